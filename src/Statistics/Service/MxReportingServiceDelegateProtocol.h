@@ -1,0 +1,41 @@
+#pragma once
+// What a client's endpoint asks of the service root: the cross-client view (every
+// client, a session of any client), the reporting switch and defaults, and the
+// driver statistics. Plain synchronous calls, made on the server queue.
+
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Statistics/MxReportingVocabulary.h"
+#include "platform/Chanstat.h"
+#include "platform/Value.h"
+
+namespace mx {
+
+class MxReportingServerInstance;
+class MxReportingSession;
+
+// Driver description ("Haptics-Stats") -> that driver's samples at the snapshot.
+using MxReportingDriverSnapShot = std::map<std::string, ChanstatChannels>;
+
+class MxReportingServiceDelegateProtocol {
+public:
+    virtual ~MxReportingServiceDelegateProtocol() = default;
+
+    // Nothing until the preferences were first read.
+    virtual std::optional<Dictionary> getDefaults() = 0;
+    // The connected endpoints in connection order.
+    virtual const std::vector<std::shared_ptr<MxReportingServerInstance>>& getAllClients() = 0;
+    virtual bool isReportingEnabled() = 0;
+    // The first session of that ID in any client; nothing for ID 0 or while reporting is off.
+    virtual std::shared_ptr<MxReportingSession> findReportingSessionForID(ReporterID reporterID) = 0;
+    virtual std::shared_ptr<MxReportingDriverSnapShot> getSnapShot() = 0;
+    virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
+        const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) = 0;
+    virtual void removeClient(const MxReportingServerInstance& client) = 0;
+};
+
+} // namespace mx

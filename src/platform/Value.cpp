@@ -1,0 +1,351 @@
+#include "platform/Value.h"
+
+#include <cassert>
+#include <cmath>
+#include <ctime>
+#include <limits>
+#include <unordered_map>
+
+#include <fmt/format.h>
+
+namespace mx {
+
+// ---- Array
+
+Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) {}
+
+Array::Array(std::vector<Value> values)
+{
+    if (!values.empty())
+        items_ = std::make_shared<const std::vector<Value>>(std::move(values));
+}
+
+std::size_t Array::size() const { return items_ ? items_->size() : 0; }
+
+const Value& Array::operator[](std::size_t index) const
+{
+    assert(index < size());
+    return (*items_)[index];
+}
+
+std::vector<Value>::const_iterator Array::begin() const
+{
+    static const std::vector<Value> none;
+    return items_ ? items_->begin() : none.begin();
+}
+
+std::vector<Value>::const_iterator Array::end() const
+{
+    static const std::vector<Value> none;
+    return items_ ? items_->end() : none.end();
+}
+
+std::vector<Value>& Array::mutableItems()
+{
+    if (!items_)
+        items_ = std::make_shared<const std::vector<Value>>();
+    else if (items_.use_count() > 1)
+        items_ = std::make_shared<const std::vector<Value>>(*items_);
+    // The storage is only ever shared as const; being its sole owner makes writing safe.
+    return const_cast<std::vector<Value>&>(*items_);
+}
+
+void Array::append(Value value) { mutableItems().push_back(std::move(value)); }
+
+void Array::insert(std::size_t index, Value value)
+{
+    auto& items = mutableItems();
+    assert(index <= items.size());
+    items.insert(items.begin() + static_cast<std::ptrdiff_t>(index), std::move(value));
+}
+
+void Array::reserve(std::size_t count) { mutableItems().reserve(count); }
+
+bool operator==(const Array& a, const Array& b)
+{
+    if (a.items_ == b.items_)
+        return true;
+    if (a.size() != b.size())
+        return false;
+    for (std::size_t i = 0; i < a.size(); ++i)
+        if (!(a[i] == b[i]))
+            return false;
+    return true;
+}
+
+// ---- Dictionary
+
+// Small dictionaries (the usual report has 5-10 keys) are searched linearly; past
+// that size an index keeps lookups constant-time so a hostile 100 000-key payload
+// costs linear, not quadratic, time to build.
+struct Dictionary::Storage {
+    static constexpr std::size_t kIndexThreshold = 16;
+
+    std::vector<Entry> entries;
+    std::unordered_map<std::string, std::size_t> index;
+
+    std::optional<std::size_t> position(std::string_view key) const
+    {
+        if (entries.size() <= kIndexThreshold) {
+            for (std::size_t i = 0; i < entries.size(); ++i)
+                if (entries[i].first == key)
+                    return i;
+            return std::nullopt;
+        }
+        auto found = index.find(std::string(key));
+        if (found == index.end())
+            return std::nullopt;
+        return found->second;
+    }
+
+    void rebuildIndex()
+    {
+        index.clear();
+        if (entries.size() <= kIndexThreshold)
+            return;
+        index.reserve(entries.size());
+        for (std::size_t i = 0; i < entries.size(); ++i)
+            index.emplace(entries[i].first, i);
+    }
+};
+
+Dictionary::Dictionary(std::initializer_list<Entry> entries)
+{
+    for (const auto& entry : entries)
+        set(entry.first, entry.second);
+}
+
+std::size_t Dictionary::size() const { return storage_ ? storage_->entries.size() : 0; }
+
+const Value* Dictionary::find(std::string_view key) const
+{
+    if (!storage_)
+        return nullptr;
+    auto position = storage_->position(key);
+    return position ? &storage_->entries[*position].second : nullptr;
+}
+
+std::vector<Dictionary::Entry>::const_iterator Dictionary::begin() const
+{
+    static const std::vector<Entry> none;
+    return storage_ ? storage_->entries.begin() : none.begin();
+}
+
+std::vector<Dictionary::Entry>::const_iterator Dictionary::end() const
+{
+    static const std::vector<Entry> none;
+    return storage_ ? storage_->entries.end() : none.end();
+}
+
+Dictionary::Storage& Dictionary::mutableStorage()
+{
+    if (!storage_)
+        storage_ = std::make_shared<const Storage>();
+    else if (storage_.use_count() > 1)
+        storage_ = std::make_shared<const Storage>(*storage_);
+    // The storage is only ever shared as const; being its sole owner makes writing safe.
+    return const_cast<Storage&>(*storage_);
+}
+
+void Dictionary::set(std::string key, Value value)
+{
+    auto& storage = mutableStorage();
+    if (auto position = storage.position(key)) {
+        storage.entries[*position].second = std::move(value);
+        return;
+    }
+    storage.entries.emplace_back(std::move(key), std::move(value));
+    if (storage.entries.size() == Storage::kIndexThreshold + 1)
+        storage.rebuildIndex();
+    else if (storage.entries.size() > Storage::kIndexThreshold)
+        storage.index.emplace(storage.entries.back().first, storage.entries.size() - 1);
+}
+
+void Dictionary::erase(std::string_view key)
+{
+    if (!find(key))
+        return;
+    auto& storage = mutableStorage();
+    auto position = *storage.position(key);
+    storage.entries.erase(storage.entries.begin() + static_cast<std::ptrdiff_t>(position));
+    storage.rebuildIndex();
+}
+
+void Dictionary::merge(const Dictionary& other)
+{
+    if (empty()) {
+        storage_ = other.storage_;
+        return;
+    }
+    for (const auto& [key, value] : other)
+        set(key, value);
+}
+
+bool operator==(const Dictionary& a, const Dictionary& b)
+{
+    if (a.storage_ == b.storage_)
+        return true;
+    if (a.size() != b.size())
+        return false;
+    auto left = a.begin();
+    for (auto right = b.begin(); right != b.end(); ++left, ++right)
+        if (left->first != right->first || !(left->second == right->second))
+            return false;
+    return true;
+}
+
+// ---- Value
+
+bool Value::isNumber() const
+{
+    switch (kind()) {
+    case Kind::Bool:
+    case Kind::Int:
+    case Kind::UInt:
+    case Kind::Double:
+        return true;
+    default:
+        return false;
+    }
+}
+
+std::int64_t Value::int64Value() const
+{
+    switch (kind()) {
+    case Kind::Bool:
+        return *asBool() ? 1 : 0;
+    case Kind::Int:
+        return *asInt();
+    case Kind::UInt:
+        return static_cast<std::int64_t>(*asUInt());
+    case Kind::Double: {
+        double value = *asDouble();
+        if (std::isnan(value))
+            return 0;
+        if (value >= 9223372036854775807.0)
+            return std::numeric_limits<std::int64_t>::max();
+        if (value <= -9223372036854775808.0)
+            return std::numeric_limits<std::int64_t>::min();
+        return static_cast<std::int64_t>(value);
+    }
+    default:
+        return 0;
+    }
+}
+
+double Value::doubleValue() const
+{
+    switch (kind()) {
+    case Kind::Bool:
+        return *asBool() ? 1.0 : 0.0;
+    case Kind::Int:
+        return static_cast<double>(*asInt());
+    case Kind::UInt:
+        return static_cast<double>(*asUInt());
+    case Kind::Double:
+        return *asDouble();
+    default:
+        return 0.0;
+    }
+}
+
+std::string formatDate(Date date)
+{
+    auto sinceEpoch = date.time_since_epoch();
+    auto seconds = std::chrono::floor<std::chrono::seconds>(sinceEpoch);
+    auto nanoseconds = (sinceEpoch - seconds).count();
+    std::time_t time = static_cast<std::time_t>(seconds.count());
+    std::tm utc{};
+    gmtime_r(&time, &utc);
+    std::string text = fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}", utc.tm_year + 1900, utc.tm_mon + 1,
+                                   utc.tm_mday, utc.tm_hour, utc.tm_min, utc.tm_sec);
+    if (nanoseconds != 0) {
+        std::string fraction = fmt::format("{:09}", nanoseconds);
+        fraction.erase(fraction.find_last_not_of('0') + 1);
+        text += "." + fraction;
+    }
+    return text + "Z";
+}
+
+namespace {
+
+void appendQuoted(std::string& out, const std::string& text)
+{
+    out += '"';
+    for (unsigned char c : text) {
+        switch (c) {
+        case '"': out += "\\\""; break;
+        case '\\': out += "\\\\"; break;
+        case '\n': out += "\\n"; break;
+        case '\t': out += "\\t"; break;
+        case '\r': out += "\\r"; break;
+        default:
+            if (c < 0x20)
+                out += fmt::format("\\u{:04x}", c);
+            else
+                out += static_cast<char>(c);
+        }
+    }
+    out += '"';
+}
+
+void appendDescription(std::string& out, const Value& value, bool nested)
+{
+    switch (value.kind()) {
+    case Value::Kind::Nil: out += "null"; break;
+    case Value::Kind::Bool: out += *value.asBool() ? "true" : "false"; break;
+    case Value::Kind::Int: out += fmt::format("{}", *value.asInt()); break;
+    case Value::Kind::UInt: out += fmt::format("{}", *value.asUInt()); break;
+    case Value::Kind::Double: out += fmt::format("{}", *value.asDouble()); break;
+    case Value::Kind::String:
+        if (nested)
+            appendQuoted(out, *value.asString());
+        else
+            out += *value.asString();
+        break;
+    case Value::Kind::Date: out += formatDate(*value.asDate()); break;
+    case Value::Kind::Data:
+        out += '<';
+        for (auto byte : *value.asData())
+            out += fmt::format("{:02x}", byte);
+        out += '>';
+        break;
+    case Value::Kind::Array: {
+        out += '[';
+        bool first = true;
+        for (const auto& item : *value.asArray()) {
+            if (!first)
+                out += ',';
+            first = false;
+            appendDescription(out, item, true);
+        }
+        out += ']';
+        break;
+    }
+    case Value::Kind::Dictionary: {
+        out += '{';
+        bool first = true;
+        for (const auto& [key, item] : *value.asDictionary()) {
+            if (!first)
+                out += ',';
+            first = false;
+            appendQuoted(out, key);
+            out += ':';
+            appendDescription(out, item, true);
+        }
+        out += '}';
+        break;
+    }
+    }
+}
+
+} // namespace
+
+std::string Value::description() const
+{
+    std::string out;
+    appendDescription(out, *this, false);
+    return out;
+}
+
+} // namespace mx

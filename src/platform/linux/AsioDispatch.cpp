@@ -1,0 +1,60 @@
+#include "platform/linux/AsioDispatch.h"
+
+#include <algorithm>
+#include <thread>
+
+#include "platform/linux/AsioSerialQueue.h"
+
+namespace mx {
+
+namespace {
+
+unsigned threadCount(unsigned requested)
+{
+    return requested != 0 ? requested : std::max(2u, std::thread::hardware_concurrency());
+}
+
+// Background work yields the processor to request handling under load.
+constexpr int kUtilityNiceness = 5;
+
+} // namespace
+
+AsioDispatch::AsioDispatch(unsigned threadsPerPool)
+    : interactivePool_("mx-interactive", threadCount(threadsPerPool), 0),
+      utilityPool_("mx-utility", threadCount(threadsPerPool), kUtilityNiceness),
+      interactiveQueue_("com.kestrel.harmonia.global.interactive", interactivePool_),
+      utilityQueue_("com.kestrel.harmonia.global.utility", utilityPool_)
+{
+}
+
+AsioDispatch::~AsioDispatch() = default;
+
+AsioWorkerPool& AsioDispatch::pool(QueuePriority priority)
+{
+    return priority == QueuePriority::UserInteractive ? interactivePool_ : utilityPool_;
+}
+
+std::shared_ptr<WorkQueue> AsioDispatch::makeSerialQueue(std::string label, QueuePriority priority)
+{
+    return std::make_shared<AsioSerialQueue>(std::move(label), pool(priority).executor());
+}
+
+WorkQueue& AsioDispatch::globalQueue(QueuePriority priority)
+{
+    return priority == QueuePriority::UserInteractive ? static_cast<WorkQueue&>(interactiveQueue_)
+                                                      : static_cast<WorkQueue&>(utilityQueue_);
+}
+
+void AsioDispatch::beginBlocking()
+{
+    if (auto* pool = AsioWorkerPool::current())
+        pool->beginBlocking();
+}
+
+void AsioDispatch::endBlocking()
+{
+    if (auto* pool = AsioWorkerPool::current())
+        pool->endBlocking();
+}
+
+} // namespace mx

@@ -1,0 +1,34 @@
+#pragma once
+// The Linux work queues: one worker pool per priority, serial queues as strands over
+// it, and a concurrent global queue per priority. Installed once by main; queues
+// must not outlive it.
+
+#include <memory>
+
+#include "platform/WorkQueue.h"
+#include "platform/linux/AsioGlobalQueue.h"
+#include "platform/linux/AsioWorkerPool.h"
+
+namespace mx {
+
+class AsioDispatch final : public Dispatch {
+public:
+    // `threadsPerPool` 0 means one per core, at least two.
+    explicit AsioDispatch(unsigned threadsPerPool = 0);
+    ~AsioDispatch() override;
+
+    std::shared_ptr<WorkQueue> makeSerialQueue(std::string label, QueuePriority priority) override;
+    WorkQueue& globalQueue(QueuePriority priority) override;
+    void beginBlocking() override;
+    void endBlocking() override;
+
+private:
+    AsioWorkerPool& pool(QueuePriority priority);
+
+    AsioWorkerPool interactivePool_;
+    AsioWorkerPool utilityPool_;
+    AsioGlobalQueue interactiveQueue_;
+    AsioGlobalQueue utilityQueue_;
+};
+
+} // namespace mx

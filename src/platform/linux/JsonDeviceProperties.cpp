@@ -1,0 +1,47 @@
+#include "platform/linux/JsonDeviceProperties.h"
+
+#include <fstream>
+
+#include <nlohmann/json.hpp>
+
+#include "platform/MxLog.h"
+
+namespace mx {
+
+namespace {
+
+nlohmann::json readProperty(const std::filesystem::path& file, std::string_view key)
+{
+    std::ifstream stream(file);
+    if (!stream)
+        return nullptr;
+    auto properties = nlohmann::json::parse(stream, nullptr, /*allow_exceptions=*/false);
+    if (properties.is_discarded() || !properties.is_object()) {
+        MXLOG(nullptr, Error, "ignoring unreadable device properties in {}", file.string());
+        return nullptr;
+    }
+    auto found = properties.find(key);
+    return found == properties.end() ? nlohmann::json() : *found;
+}
+
+} // namespace
+
+JsonDeviceProperties::JsonDeviceProperties(std::filesystem::path file) : file_(std::move(file)) {}
+
+bool JsonDeviceProperties::boolProperty(std::string_view key)
+{
+    auto value = readProperty(file_, key);
+    return value.is_boolean() && value.get<bool>();
+}
+
+std::int64_t JsonDeviceProperties::integerProperty(std::string_view key)
+{
+    auto value = readProperty(file_, key);
+    if (value.is_number_integer())
+        return value.get<std::int64_t>();
+    if (value.is_number_float())
+        return static_cast<std::int64_t>(value.get<double>());
+    return 0;
+}
+
+} // namespace mx

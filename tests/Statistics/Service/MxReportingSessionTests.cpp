@@ -1,0 +1,289 @@
+#include "Statistics/Service/MxReportingSession.h"
+
+#include <thread>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "fakes/FakePlatform.h"
+
+namespace mx::testing {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+
+class MxReportingSessionTest : public ::testing::Test {
+protected:
+    std::shared_ptr<MxReportingSession> makeSession(ReporterID id = 5, ServiceType type = 7)
+    {
+        auto session = std::make_shared<MxReportingSession>(id, std::vector<std::int32_t>{42});
+        if (type != service_type::kUnknown)
+            session->setServiceType(type);
+        return session;
+    }
+
+    void run() { platform.dispatch.runUntilIdle(); }
+
+    static std::vector<std::string> identifiers(const MxReportingSession& session)
+    {
+        std::vector<std::string> ids;
+        for (const auto& entry : session.nestedAggregatedPayloadData()->snapshot())
+            ids.push_back(entry.asDictionary()->begin()->first);
+        return ids;
+    }
+
+    std::shared_ptr<FakeUplinkSession> onlyBackendSession()
+    {
+        auto sessions = platform.uplink.sessions();
+        EXPECT_EQ(sessions.size(), 1u);
+        return sessions.empty() ? nullptr : sessions.front();
+    }
+
+    FakePlatform platform;
+};
+
+TEST_F(MxReportingSessionTest, RepeatedStartKeepsTheStoreAndOpensNoSecondBackendSession)
+{
+    auto session = makeSession();
+    session->start();
+    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+    session->start();
+    run();
+    EXPECT_TRUE(platform.log.contains("5 is already started"));
+    EXPECT_EQ(session->aggregatedPayloadData()->snapshot().size(), 1u);
+    EXPECT_EQ(platform.uplink.sessions().size(), 1u);
+    EXPECT_EQ(platform.uplink.tokensIssued(), 1);
+}
+
+TEST_F(MxReportingSessionTest, StopOfANeverStartedSessionLeavesNoTrace)
+{
+    auto session = makeSession();
+    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+    run();
+    platform.trace.clear();
+    session->stop();
+    run();
+    EXPECT_THAT(platform.trace.codes(), IsEmpty());
+    EXPECT_FALSE(platform.log.contains("sending summary event for reporter 5"));
+    EXPECT_NE(session->aggregatedPayloadData(), nullptr) << "a stop that stops nothing keeps the store";
+    EXPECT_TRUE(platform.uplink.sessions().empty());
+}
+
+TEST_F(MxReportingSessionTest, IdentifiersCountOnAcrossRestartsWhileStoresStartAfresh)
+{
+    auto session = makeSession();
+    session->sendMessage(Dictionary{{"early", 1}}, 3, 1, nullptr);
+    session->start();
+    EXPECT_TRUE(session->aggregatedPayloadData()->snapshot().empty()) << "start drops what came before";
+    session->sendMessage(Dictionary{}, 3, 1, nullptr);
+    session->sendMessage(Dictionary{}, 3, 1, nullptr);
+    session->sendMessage(Dictionary{}, 3, 2, nullptr);
+    session->sendMessage(Dictionary{}, 0xFFFFFFFF, 7, nullptr);
+    EXPECT_THAT(identifiers(*session),
+                ElementsAre("Playback_Start_2", "Playback_Start_3", "Playback_Stop_1", "Undefined_Undefined_1"));
+
+    session->stop();
+    EXPECT_EQ(session->aggregatedPayloadData(), nullptr);
+    EXPECT_EQ(session->nestedAggregatedPayloadData(), nullptr);
+    session->sendMessage(Dictionary{{"late", 1}}, 3, 1, nullptr);
+    session->start();
+    session->sendMessage(Dictionary{}, 3, 1, nullptr);
+    EXPECT_THAT(identifiers(*session), ElementsAre("Playback_Start_5"));
+    EXPECT_EQ(session->messageTypeCounts().at("Undefined_Unknown"), 1) << "the summary event was counted";
+}
+
+TEST_F(MxReportingSessionTest, KeysAreCleanedAtTheTopLevelOnly)
+{
+    Dictionary nested{{"inner key", 1}};
+    Dictionary cleaned = MxReportingCleanKeys(
+        Dictionary{{"peak level", 3}, {"rate", 48000}, {"a  b", nested}, {"x y", 1}, {"x_y", 2}});
+    EXPECT_EQ(cleaned, (Dictionary{{"peak_level", 3}, {"rate", 48000}, {"a__b", nested}, {"x_y", 2}}));
+
+    auto session = makeSession();
+    session->start();
+    session->sendMessage(Dictionary{{"peak level", 3}}, 3, 1, nullptr);
+    EXPECT_EQ(session->aggregatedPayloadData()->snapshot()[0], Value(Dictionary{{"peak_level", 3}}));
+}
+
+TEST_F(MxReportingSessionTest, BackendGetsSessionDescriptionAndMessagesInOrderThenTheFlush)
+{
+    auto session = makeSession(5, 12);
+    session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "ExampleHost"}});
+    bool replied = false;
+    session->start();
+    // Merged after start, before the configuration job runs: still reaches the backend.
+    session->setConfiguration(Dictionary{{"ServiceName", "custom"}});
+    session->sendMessage(Dictionary{{"rate", 48000}, {"route", "Speaker"}}, 0x08000003, 1,
+                         [&](std::optional<UplinkError> error) { replied = !error; });
+    EXPECT_TRUE(replied) << "the reply reports acceptance before delivery";
+    session->sendMessage(Dictionary{{"rate", 44100}}, 0x08000003, 2, nullptr);
+    session->stop();
+    run();
+
+    auto backend = onlyBackendSession();
+    ASSERT_TRUE(backend);
+    EXPECT_EQ(backend->sessionInfo,
+              (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", 5}, {"BatchEvent", false},
+                          {"HierarchyToken", session->uplinkAgentToken()->text()}, {"ContainsRealtimeEvents", true}}));
+    EXPECT_EQ(backend->userInfo, (Dictionary{{"ClientName", "com.kestrel.harmonia"},
+                                             {"ServiceName", "custom"},
+                                             {"HostApplicationDisplayID", "ExampleHost"}}));
+    auto messages = backend->messages();
+    ASSERT_EQ(messages.size(), 3u);
+    EXPECT_EQ(messages[0].category, 3) << "the subsystem half is cut off";
+    EXPECT_EQ(messages[1].type, 2);
+    EXPECT_EQ(messages[2].category, 0xFFFF);
+    EXPECT_EQ(messages[2].type, 0xFFFF);
+    EXPECT_EQ(messages[2].payload,
+              (Dictionary{{"Mx_Session_Summary_Event", "12"}, {"rate", "48000,44100"}, {"route", "Speaker"}}));
+    EXPECT_EQ(backend->flushes(), 1);
+    EXPECT_EQ(session->uplinkSession(), nullptr);
+    EXPECT_TRUE(session->uplinkAgentToken()) << "the token is kept until the next start";
+    EXPECT_FALSE(platform.log.contains("waiting for uplinkd to find backends")) << "backends were already known";
+}
+
+TEST_F(MxReportingSessionTest, BatchSessionOfUnsetTypeIsNamedUnknown)
+{
+    auto session = makeSession(8, service_type::kUnknown);
+    session->start();
+    run();
+    auto backend = onlyBackendSession();
+    ASSERT_TRUE(backend);
+    EXPECT_EQ(*backend->sessionInfo.find("BatchEvent"), Value(true));
+    EXPECT_EQ(*backend->sessionInfo.find("ContainsRealtimeEvents"), Value(false));
+    EXPECT_EQ(*backend->userInfo.find("ServiceName"), Value("unknown_session"));
+}
+
+TEST_F(MxReportingSessionTest, TestSessionsAggregateButNeverTouchTheBackend)
+{
+    auto session = makeSession(5, service_type::kTest);
+    session->start();
+    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+    session->sendMessage(Dictionary{{"a", 2}}, 3, 1, nullptr);
+    session->stop();
+    run();
+    EXPECT_TRUE(platform.uplink.sessions().empty());
+    EXPECT_EQ(platform.uplink.tokensIssued(), 0);
+    EXPECT_EQ(platform.log.count("transactions aren't allowed on this platform"), 3u) << "two messages and the summary";
+    EXPECT_EQ(session->messageTypeCounts().at("Playback_Start"), 2);
+}
+
+TEST_F(MxReportingSessionTest, MessagesOutsideAStartedPeriodGoOutAsSingleMessages)
+{
+    auto session = makeSession(5, service_type::kAlarms);
+    session->sendMessage(Dictionary{{"a b", 1}}, 0x20000001, 4, nullptr);
+    run();
+    EXPECT_TRUE(platform.uplink.oneShots().empty()) << "alarms wait out a random delay";
+    platform.dispatch.advance(std::chrono::seconds(59));
+    run();
+    auto oneShots = platform.uplink.oneShots();
+    ASSERT_EQ(oneShots.size(), 1u);
+    EXPECT_EQ(oneShots[0].category, 1);
+    EXPECT_EQ(oneShots[0].payload, (Dictionary{{"a_b", 1}}));
+    EXPECT_EQ(oneShots[0].userInfo, (Dictionary{{"ClientName", "com.kestrel.harmonia"}, {"ServiceName", "alarms"}}));
+    EXPECT_EQ(oneShots[0].sessionInfo, (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}}));
+}
+
+TEST_F(MxReportingSessionTest, SingleMessageReportsTheBackendsRefusal)
+{
+    platform.uplink.setOneShotResult(false, UplinkError{7, "refused"});
+    std::vector<std::optional<UplinkError>> replies;
+    MxReportingSession::sendSingleMessage(Dictionary{}, 1, 0, service_type::kStandalone, nullptr,
+                                          [&](std::optional<UplinkError> error) { replies.push_back(error); });
+    run();
+    platform.uplink.setOneShotResult(false, std::nullopt);
+    MxReportingSession::sendSingleMessage(Dictionary{}, 1, 0, service_type::kStandalone, nullptr,
+                                          [&](std::optional<UplinkError> error) { replies.push_back(error); });
+    run();
+    ASSERT_EQ(replies.size(), 2u);
+    EXPECT_EQ(replies[0]->description, "refused");
+    EXPECT_FALSE(replies[1]) << "a refusal without an error replies nothing and logs nothing";
+    EXPECT_EQ(platform.log.texts(MxLogLevel::Error), std::vector<std::string>{"sendOneMessageWithSessionInfo refused"});
+}
+
+TEST_F(MxReportingSessionTest, SummaryListsEveryValueOfEveryKeyInMessageOrder)
+{
+    auto session = makeSession();
+    EXPECT_FALSE(session->createSummaryEventForSession()) << "nothing aggregated, no summary";
+    session->start();
+    EXPECT_FALSE(session->createSummaryEventForSession());
+    session->sendMessage(Dictionary{{"rate", 48000}, {"output route", "Speaker"}}, 3, 1, nullptr);
+    session->sendMessage(Dictionary{{"rate", 44100}, {"list", Array{1, "two"}}, {"Mx_Session_Summary_Event", "x"}},
+                         3, 1, nullptr);
+    EXPECT_EQ(*session->createSummaryEventForSession(),
+              (Dictionary{{"Mx_Session_Summary_Event", "7,x"},
+                          {"rate", "48000,44100"},
+                          {"output_route", "Speaker"},
+                          {"list", "[1,\"two\"]"}}));
+    session->stop();
+    EXPECT_TRUE(platform.log.contains("sending summary event for reporter 5"));
+}
+
+TEST_F(MxReportingSessionTest, FailedDiscoveryDropsTheBackendSessionAfterNineSeconds)
+{
+    platform.uplink.setDiscovery(FakeUplink::Discovery::NoBackends);
+    auto session = makeSession();
+    session->start();
+    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+    auto began = std::chrono::steady_clock::now();
+    run();
+    auto waited = std::chrono::steady_clock::now() - began;
+
+    EXPECT_GE(waited, std::chrono::seconds(9));
+    EXPECT_LT(waited, std::chrono::seconds(12));
+    EXPECT_THAT(platform.log.texts(MxLogLevel::Error),
+                ElementsAre("No backends found, this session won't get sent to the server", "failed to find backend",
+                            "No valid UplinkSession"));
+    EXPECT_EQ(session->uplinkSession(), nullptr);
+    EXPECT_TRUE(session->started()) << "the session keeps collecting";
+    EXPECT_EQ(platform.dispatch.blockingCalls(), 1) << "the wait lends its thread's place to others";
+}
+
+TEST_F(MxReportingSessionTest, DiscoveryAnsweredDuringTheWaitContinuesWithTheBackend)
+{
+    platform.uplink.setDiscovery(FakeUplink::Discovery::Held);
+    auto session = makeSession();
+    session->start();
+    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+    std::thread backend([&] {
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+        while (!platform.log.contains("waiting for uplinkd to find backends") &&
+               std::chrono::steady_clock::now() < deadline)
+            std::this_thread::yield();
+        platform.uplink.sessions().front()->answerDiscovery(std::vector<std::string>{"spool", "collector"});
+    });
+    run();
+    backend.join();
+    EXPECT_THAT(platform.log.texts(MxLogLevel::Default),
+                ElementsAre("waiting for uplinkd to find backends", "List of backends [\"spool\",\"collector\"]",
+                            "continuing"));
+    EXPECT_EQ(onlyBackendSession()->messages().size(), 1u);
+    EXPECT_NE(session->uplinkSession(), nullptr);
+    EXPECT_FALSE(session->uplinkSessionStarted()) << "nothing ever sets the seed";
+}
+
+TEST_F(MxReportingSessionTest, FlushErrorIsLogged)
+{
+    platform.uplink.setFlushError(UplinkError{5, "collector unreachable"});
+    auto session = makeSession();
+    session->start();
+    session->stop();
+    run();
+    EXPECT_TRUE(platform.log.contains("flush error collector unreachable"));
+}
+
+TEST_F(MxReportingSessionTest, LastReferenceToAStartedSessionGoesWithoutStopping)
+{
+    auto session = makeSession();
+    session->start();
+    run();
+    platform.trace.clear();
+    session.reset();
+    EXPECT_THAT(platform.trace.codes(), ElementsAre(0x21042834));
+    EXPECT_TRUE(platform.log.contains("deallocing this session 5"));
+    EXPECT_EQ(onlyBackendSession()->flushes(), 0);
+}
+
+} // namespace
+} // namespace mx::testing

@@ -1,0 +1,43 @@
+#pragma once
+// Installs a fake of every process-wide platform service for the lifetime of a test
+// fixture, and restores whatever was installed before.
+
+#include "fakes/CapturingLogSink.h"
+#include "fakes/FakeDispatch.h"
+#include "fakes/FakeServices.h"
+#include "fakes/FakeUplink.h"
+#include "Statistics/MxReportingVocabulary.h"
+
+namespace mx::testing {
+
+class FakePlatform {
+public:
+    FakePlatform() { MxReportingResetInternalBuildForTesting(); }
+    ~FakePlatform()
+    {
+        // Work still queued holds sessions; they must go while the fakes they log and
+        // trace through are still installed.
+        dispatch.discardAll();
+        MxReportingResetInternalBuildForTesting();
+    }
+
+    EffectJournal journal;
+    CapturingLogSink log;
+    RecordingTracePoints trace{journal};
+    FakeTally tally{journal};
+    FakeJoule joule{journal};
+    FakeUplink uplink;
+    FakeDeviceProperties device;
+    FakeDispatch dispatch;
+
+private:
+    ScopedInstall<MxLogSink> installLog_{log};
+    ScopedInstall<TracePoints> installTrace_{trace};
+    ScopedInstall<Tally> installTally_{tally};
+    ScopedInstall<Joule> installJoule_{joule};
+    ScopedInstall<Uplink> installUplink_{uplink};
+    ScopedInstall<DeviceProperties> installDevice_{device};
+    ScopedInstall<Dispatch> installDispatch_{dispatch};
+};
+
+} // namespace mx::testing

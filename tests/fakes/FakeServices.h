@@ -1,0 +1,161 @@
+#pragma once
+// Small working stand-ins for the process-wide platform services: each records what
+// the daemon handed it, for the test to assert on. All are thread-safe.
+
+#include <map>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include <fmt/format.h>
+
+#include "platform/DeviceProperties.h"
+#include "platform/Joule.h"
+#include "platform/Tally.h"
+#include "platform/TracePoints.h"
+
+namespace mx::testing {
+
+// One ordered record of the effects of several fakes ("trace 0x21042838",
+// "tally com.kestrel...", "joule Tessera_Haptics"), for tests of the order of effects.
+class EffectJournal {
+public:
+    void record(std::string effect)
+    {
+        std::lock_guard lock(mutex_);
+        effects_.push_back(std::move(effect));
+    }
+    std::vector<std::string> effects() const
+    {
+        std::lock_guard lock(mutex_);
+        return effects_;
+    }
+    void clear()
+    {
+        std::lock_guard lock(mutex_);
+        effects_.clear();
+    }
+
+private:
+    mutable std::mutex mutex_;
+    std::vector<std::string> effects_;
+};
+
+class RecordingTracePoints final : public TracePoints {
+public:
+    explicit RecordingTracePoints(EffectJournal& journal) : journal_(journal) {}
+    void emit(std::uint32_t code, std::uint64_t, std::uint64_t, std::uint64_t, std::uint64_t) override
+    {
+        journal_.record(fmt::format("trace {:#x}", code));
+        std::lock_guard lock(mutex_);
+        codes_.push_back(code);
+    }
+    std::vector<std::uint32_t> codes() const
+    {
+        std::lock_guard lock(mutex_);
+        return codes_;
+    }
+    void clear()
+    {
+        std::lock_guard lock(mutex_);
+        codes_.clear();
+    }
+
+private:
+    EffectJournal& journal_;
+    mutable std::mutex mutex_;
+    std::vector<std::uint32_t> codes_;
+};
+
+struct TallyEvent {
+    std::string name;
+    Dictionary payload;
+};
+
+class FakeTally final : public Tally {
+public:
+    explicit FakeTally(EffectJournal& journal) : journal_(journal) {}
+    void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override
+    {
+        journal_.record(fmt::format("tally {}", name));
+        Dictionary payload = buildPayload();
+        std::lock_guard lock(mutex_);
+        events_.push_back({std::string(name), std::move(payload)});
+    }
+    std::vector<TallyEvent> events() const
+    {
+        std::lock_guard lock(mutex_);
+        return events_;
+    }
+
+private:
+    EffectJournal& journal_;
+    mutable std::mutex mutex_;
+    std::vector<TallyEvent> events_;
+};
+
+struct JouleEvent {
+    std::int32_t agent;
+    std::string name;
+    Dictionary event;
+};
+
+class FakeJoule final : public Joule {
+public:
+    explicit FakeJoule(EffectJournal& journal) : journal_(journal) {}
+    void logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event, const Dictionary*) override
+    {
+        journal_.record(fmt::format("joule {}", name));
+        std::lock_guard lock(mutex_);
+        events_.push_back({agent, std::string(name), std::move(event)});
+    }
+    std::vector<JouleEvent> events() const
+    {
+        std::lock_guard lock(mutex_);
+        return events_;
+    }
+
+private:
+    EffectJournal& journal_;
+    mutable std::mutex mutex_;
+    std::vector<JouleEvent> events_;
+};
+
+class FakeDeviceProperties final : public DeviceProperties {
+public:
+    bool boolProperty(std::string_view key) override
+    {
+        std::lock_guard lock(mutex_);
+        ++queries_;
+        return bools_.count(std::string(key)) ? bools_[std::string(key)] : false;
+    }
+    std::int64_t integerProperty(std::string_view key) override
+    {
+        std::lock_guard lock(mutex_);
+        ++queries_;
+        return integers_.count(std::string(key)) ? integers_[std::string(key)] : 0;
+    }
+    void setBool(const std::string& key, bool value)
+    {
+        std::lock_guard lock(mutex_);
+        bools_[key] = value;
+    }
+    void setInteger(const std::string& key, std::int64_t value)
+    {
+        std::lock_guard lock(mutex_);
+        integers_[key] = value;
+    }
+    int queries() const
+    {
+        std::lock_guard lock(mutex_);
+        return queries_;
+    }
+
+private:
+    mutable std::mutex mutex_;
+    std::map<std::string, bool> bools_;
+    std::map<std::string, std::int64_t> integers_;
+    int queries_ = 0;
+};
+
+} // namespace mx::testing

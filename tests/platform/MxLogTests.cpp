@@ -1,0 +1,44 @@
+#include "platform/MxLog.h"
+
+#include <cstdlib>
+
+#include <gtest/gtest.h>
+
+#include "fakes/CapturingLogSink.h"
+
+namespace mx::testing {
+namespace {
+
+TEST(MxLogTest, EveryLineCarriesFileLineAndFunctionPrefix)
+{
+    CapturingLogSink sink;
+    ScopedInstall<MxLogSink> install(sink);
+    MXLOG(nullptr, Error, "value {}", 7);
+    auto lines = sink.lines();
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_EQ(lines[0].message, fmt::format("MxLogTests.cpp:{}:TestBody: value 7", __LINE__ - 3));
+    EXPECT_EQ(lines[0].level, MxLogLevel::Error);
+}
+
+TEST(MxLogTest, VerboseLinesNeedTheScopesSwitchAtLevelFive)
+{
+    ::setenv("mxlog_test_loud", "5", 1);
+    ::setenv("mxlog_test_quiet", "4", 1);
+    const MxLogScope* loud = MxLogRegisterScope(1, MxFourCharCode("loud"), "loud", "com.kestrel.harmonia", "mxlog_test_loud", 31);
+    const MxLogScope* quiet = MxLogRegisterScope(1, MxFourCharCode("quit"), "quit", "com.kestrel.harmonia", "mxlog_test_quiet", 31);
+    EXPECT_EQ(MxLogRegisterScope(1, 0, "loud", "other", "other", 31), loud) << "registered once";
+
+    CapturingLogSink sink;
+    ScopedInstall<MxLogSink> install(sink);
+    int formatted = 0;
+    auto count = [&] { return ++formatted; };
+    MXLOG_VERBOSE(loud, "loud {}", count());
+    MXLOG_VERBOSE(quiet, "quiet {}", count());
+    MXLOG_VERBOSE(nullptr, "default {}", count());
+    EXPECT_EQ(sink.texts(), std::vector<std::string>{"loud 1"});
+    EXPECT_EQ(sink.lines()[0].level, MxLogLevel::Debug);
+    EXPECT_EQ(formatted, 1) << "a silent verbose line is not even formatted";
+}
+
+} // namespace
+} // namespace mx::testing
