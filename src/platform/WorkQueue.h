@@ -49,10 +49,14 @@ public:
 // Marks the enclosing scope as blocking the current worker thread.
 class ScopedBlockingCall {
 public:
-    ScopedBlockingCall() { ProcessWide<Dispatch>::get().beginBlocking(); }
-    ~ScopedBlockingCall() { ProcessWide<Dispatch>::get().endBlocking(); }
+    ScopedBlockingCall() : dispatch_(ProcessWide<Dispatch>::get()) { dispatch_.beginBlocking(); }
+    ~ScopedBlockingCall() { dispatch_.endBlocking(); }
     ScopedBlockingCall(const ScopedBlockingCall&) = delete;
     ScopedBlockingCall& operator=(const ScopedBlockingCall&) = delete;
+
+private:
+    // The end pairs with the beginning even if another implementation was installed meanwhile.
+    Dispatch& dispatch_;
 };
 
 } // namespace mx
