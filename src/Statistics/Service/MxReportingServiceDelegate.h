@@ -1,0 +1,75 @@
+#pragma once
+// The service root: accepts client connections and makes one endpoint per client,
+// keeps the list of connected clients, answers the endpoints' cross-client
+// questions, holds the reporting defaults and switch, and reports each client's
+// connection time when it leaves. Created once by main and never destroyed.
+// The client list, the defaults and the switch change only on the serial server
+// queue; acceptance and the cross-client lookup also take the root's own lock.
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <vector>
+
+#include "Statistics/Service/MxReportingServerInstance.h"
+#include "Statistics/Service/MxReportingServiceDelegateProtocol.h"
+#include "platform/Notifications.h"
+#include "platform/Preferences.h"
+#include "platform/ProcessTable.h"
+#include "platform/ServiceConnection.h"
+#include "platform/WorkQueue.h"
+
+namespace mx {
+
+inline constexpr const char* kMxReportingDefaultsDomain = "com.kestrel.harmonia";
+inline constexpr const char* kMxReportingDefaultsNotification = "com.kestrel.harmonia.reporting";
+
+class MxReportingServiceDelegate final : public MxReportingServiceDelegateProtocol,
+                                         public ServiceListenerDelegate,
+                                         public std::enable_shared_from_this<MxReportingServiceDelegate> {
+public:
+    // init: the scope, the server queue, an empty client list, reporting on, the
+    // registration for the defaults notification. Defaults are not read yet.
+    static std::shared_ptr<MxReportingServiceDelegate> make(Preferences& preferences, Notifications& notifications,
+                                                            ProcessTable& processTable);
+
+    const std::shared_ptr<WorkQueue>& serverQueue() const { return serverQueue_; }
+
+    bool shouldAcceptNewConnection(ServiceListener& listener, std::shared_ptr<ServiceConnection> connection) override;
+
+    std::optional<Dictionary> getDefaults() override;
+    const std::vector<std::shared_ptr<MxReportingServerInstance>>& getAllClients() override;
+    bool isReportingEnabled() override { return reportingEnabled_.load(); }
+    std::shared_ptr<MxReportingSession> findReportingSessionForID(ReporterID reporterID) override;
+    std::shared_ptr<MxReportingDriverSnapShot> getSnapShot() override;
+    std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
+        const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) override;
+    void removeClient(const MxReportingServerInstance& client) override;
+
+    // The defaults dictionary as the preferences hold it now.
+    Dictionary MxReportingDefaults();
+
+    // The invalidation handler's work: clean-up, then the client uptime event.
+    void reportClientUptime(const std::weak_ptr<MxReportingServerInstance>& weakClient, pid_t pid);
+
+private:
+    MxReportingServiceDelegate(Preferences& preferences, Notifications& notifications, ProcessTable& processTable);
+
+    void listenForDefaultsNotification();
+    void handleDefaultsNotification(int token);
+    void registerClient(const std::shared_ptr<MxReportingServerInstance>& client, pid_t pid, Date accepted);
+
+    Preferences& preferences_;
+    Notifications& notifications_;
+    ProcessTable& processTable_;
+    std::shared_ptr<WorkQueue> serverQueue_;
+    std::recursive_mutex lock_;
+
+    std::atomic<bool> reportingEnabled_{true};
+    std::vector<std::shared_ptr<MxReportingServerInstance>> clients_;
+    std::optional<Dictionary> defaults_;
+    int notifyToken_ = 0;
+};
+
+} // namespace mx

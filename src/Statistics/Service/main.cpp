@@ -1,0 +1,136 @@
+// mxreportingd: installs the Linux platform services, creates the service root and
+// hands it the listener; from then on the process lives on the connection thread,
+// the server queue and the session queues. It ends when the platform ends it
+// (SIGTERM: the stores commit what they were handed first) or when a client calls
+// killService (status 2).
+
+#include <cstdio>
+#include <cstring>
+#include <future>
+#include <unistd.h>
+
+#include <asio/signal_set.hpp>
+#include <systemd/sd-daemon.h>
+
+#include "Statistics/Service/MxReportingServiceDelegate.h"
+#include "platform/linux/AsioDispatch.h"
+#include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/JournalLogSink.h"
+#include "platform/linux/JsonDeviceProperties.h"
+#include "platform/linux/JsonPreferences.h"
+#include "platform/linux/MsgpackRpcListener.h"
+#include "platform/linux/ProcProcessTable.h"
+#include "platform/linux/RootPath.h"
+#include "platform/linux/SpoolUplink.h"
+#include "platform/linux/SqliteJoule.h"
+#include "platform/linux/SqliteTally.h"
+#include "platform/linux/StderrLogSink.h"
+#include "platform/linux/UsdtTracePoints.h"
+
+using namespace mx;
+
+namespace {
+
+constexpr const char* kUsage = R"(usage: mxreportingd [--help]
+
+The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default /):
+  run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
+  run/harmonia/notify.sock          the notification endpoint
+  var/lib/harmonia/                 tally.db, joule.db, uplink.db, preferences/
+  etc/harmonia/                     device.json, tally.json
+Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
+SIGHUP re-reads the preferences; SIGTERM commits the stores and exits.
+)";
+
+[[noreturn]] void fail(const std::string& message)
+{
+    MXLOG(nullptr, Error, "mxreportingd cannot start: {}", message);
+    std::exit(1);
+}
+
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    for (int i = 1; i < argc; ++i) {
+        if (std::strcmp(argv[i], "--help") == 0 || std::strcmp(argv[i], "-h") == 0) {
+            std::fputs(kUsage, stdout);
+            return 0;
+        }
+        std::fprintf(stderr, "mxreportingd: unknown argument %s\n%s", argv[i], kUsage);
+        return 64;
+    }
+
+    StderrLogSink stderrSink;
+    JournalLogSink journalSink;
+    ProcessWide<MxLogSink>::install(JournalLogSink::runningUnderJournal() ? static_cast<MxLogSink*>(&journalSink)
+                                                                          : &stderrSink);
+    UsdtTracePoints tracePoints;
+    ProcessWide<TracePoints>::install(&tracePoints);
+    AsioDispatch dispatch;
+    ProcessWide<Dispatch>::install(&dispatch);
+    JsonDeviceProperties deviceProperties(MxReportingPath("etc/harmonia/device.json"));
+    ProcessWide<DeviceProperties>::install(&deviceProperties);
+
+    std::string error;
+    auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"),
+                                   MxReportingPath("etc/harmonia/tally.json"), error);
+    if (!tally)
+        fail(error);
+    ProcessWide<Tally>::install(tally.get());
+    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), error);
+    if (!joule)
+        fail(error);
+    ProcessWide<Joule>::install(joule.get());
+    auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), error);
+    if (!uplink)
+        fail(error);
+    ProcessWide<Uplink>::install(uplink.get());
+
+    ProcProcessTable processTable;
+    JsonPreferences preferences(MxReportingPath("var/lib/harmonia/preferences"));
+    DatagramNotifications notifications(MxReportingPath("run/harmonia/notify.sock"));
+
+    auto root = MxReportingServiceDelegate::make(preferences, notifications, processTable);
+    auto listener = MsgpackRpcListener::make(MxReportingPath("run/harmonia/reporting.sock"), error);
+    if (!listener)
+        fail(error);
+    if (!notifications.listen(listener->ioContext(), error))
+        fail(error);
+
+    std::promise<int> terminated;
+    asio::signal_set reload(listener->ioContext(), SIGHUP);
+    std::function<void()> waitForReload = [&] {
+        reload.async_wait([&](const std::error_code& cancelled, int) {
+            if (cancelled)
+                return;
+            notifications.deliver(kMxReportingDefaultsNotification);
+            waitForReload();
+        });
+    };
+    waitForReload();
+    asio::signal_set termination(listener->ioContext(), SIGTERM, SIGINT);
+    termination.async_wait([&](const std::error_code& cancelled, int signal) {
+        if (!cancelled)
+            terminated.set_value(signal);
+    });
+
+    listener->setDelegate(root);
+    listener->resume();
+    sd_notify(0, "READY=1");
+    std::fprintf(stderr,
+                 "mxreportingd %d listening on %s\n"
+                 "  talk to it:  MXREPORTING_ROOT=%s mxreport demo\n",
+                 getpid(), listener->endpointDescription().c_str(), MxReportingRoot().c_str());
+
+    int signal = terminated.get_future().get();
+    sd_notify(0, "STOPPING=1");
+    MXLOG(nullptr, Default, "mxreportingd stopping on signal {}: committing the stores", signal);
+    tally->store().flush();
+    joule->store().flush();
+    uplink->store().flush();
+    // Queues and connections are not torn down: the process simply ends, as it
+    // would at any other moment.
+    std::_Exit(0);
+}

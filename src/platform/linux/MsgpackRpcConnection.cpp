@@ -1,0 +1,228 @@
+#include "platform/linux/MsgpackRpcConnection.h"
+
+#include <sys/socket.h>
+
+#include <asio/buffer.hpp>
+#include <asio/post.hpp>
+#include <asio/write.hpp>
+#include <fmt/format.h>
+
+#include "Statistics/Service/MxReportingServiceProtocol.h"
+#include "platform/MxLog.h"
+#include "platform/linux/MsgpackValue.h"
+#include "platform/linux/MxReportingRpcDispatch.h"
+
+namespace mx {
+
+namespace {
+
+// Sends the first reply of one request and drops the rest: the protocol's own rules
+// allow a second reply (and a reply after the client left).
+class ConnectionResponder final : public RpcResponder {
+public:
+    ConnectionResponder(std::weak_ptr<MsgpackRpcConnection> connection, std::uint32_t msgid)
+        : connection_(std::move(connection)), msgid_(msgid)
+    {
+    }
+
+    void respond(const Value& result) override
+    {
+        if (claim())
+            if (auto connection = connection_.lock())
+                connection->sendResponse(msgid_, Value(), result);
+    }
+
+    void fail(const RpcError& error) override
+    {
+        if (claim())
+            if (auto connection = connection_.lock())
+                connection->sendError(msgid_, error);
+    }
+
+private:
+    bool claim() { return !replied_.exchange(true); }
+
+    std::weak_ptr<MsgpackRpcConnection> connection_;
+    std::uint32_t msgid_;
+    std::atomic<bool> replied_{false};
+};
+
+std::shared_ptr<msgpack::sbuffer> encodeResponse(std::uint32_t msgid, const Value& error, const Value& result)
+{
+    auto bytes = std::make_shared<msgpack::sbuffer>();
+    msgpack::packer<msgpack::sbuffer> packer(*bytes);
+    packer.pack_array(4);
+    packer.pack_uint8(1);
+    packer.pack_uint32(msgid);
+    encodeMsgpack(packer, error);
+    encodeMsgpack(packer, result);
+    return bytes;
+}
+
+} // namespace
+
+MsgpackRpcConnection::MsgpackRpcConnection(asio::local::stream_protocol::socket socket, std::uint64_t number)
+    : socket_(std::move(socket)), number_(number)
+{
+    ucred credentials{};
+    socklen_t length = sizeof(credentials);
+    if (getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) == 0) {
+        pid_ = credentials.pid;
+        uid_ = credentials.uid;
+    }
+}
+
+MsgpackRpcConnection::~MsgpackRpcConnection() = default;
+
+std::string MsgpackRpcConnection::description() const
+{
+    return fmt::format("<connection {} from pid {} uid {}>", number_, pid_, uid_);
+}
+
+void MsgpackRpcConnection::setExportedObject(std::shared_ptr<MxReportingServiceProtocol> object)
+{
+    exported_ = std::move(object);
+}
+
+void MsgpackRpcConnection::setInterruptionHandler(std::function<void()> handler)
+{
+    interruptionHandler_ = std::move(handler);
+}
+
+void MsgpackRpcConnection::setInvalidationHandler(std::function<void()> handler)
+{
+    invalidationHandler_ = std::move(handler);
+}
+
+void MsgpackRpcConnection::resume()
+{
+    if (resumed_)
+        return;
+    resumed_ = true;
+    readMore();
+}
+
+void MsgpackRpcConnection::readMore()
+{
+    if (reading_ || closed_ || outboxBytes_ > kBackPressureBytes)
+        return;
+    reading_ = true;
+    auto space = decoder_.buffer();
+    socket_.async_read_some(asio::buffer(space.data(), space.size()),
+                            [self = shared_from_this()](const std::error_code& error, std::size_t bytes) {
+                                self->reading_ = false;
+                                if (error) {
+                                    // The client closed or reset: the ordinary end of a connection.
+                                    self->close({});
+                                    return;
+                                }
+                                self->handleRead(bytes);
+                            });
+}
+
+void MsgpackRpcConnection::handleRead(std::size_t bytes)
+{
+    decoder_.consumed(bytes);
+    Value message;
+    std::string reason;
+    for (;;) {
+        switch (decoder_.next(message, reason)) {
+        case MsgpackRpcDecoder::Status::NeedMore: readMore(); return;
+        case MsgpackRpcDecoder::Status::Bad: close(reason); return;
+        case MsgpackRpcDecoder::Status::Message:
+            if (!handleMessage(message))
+                return;
+            if (closed_)
+                return;
+            break;
+        }
+    }
+}
+
+bool MsgpackRpcConnection::handleMessage(const Value& message)
+{
+    std::string reason;
+    auto request = parseRpcRequest(message, reason);
+    if (!request) {
+        close(reason);
+        return false;
+    }
+    auto responder = std::make_shared<ConnectionResponder>(weak_from_this(), request->msgid);
+    if (!exported_) {
+        responder->fail({kRpcErrorUnknownMethod, "nothing is exported on this connection"});
+        return true;
+    }
+    dispatchReportingRequest(*exported_, *request, responder);
+    return true;
+}
+
+void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error, const Value& result)
+{
+    if (closed_)
+        return;
+    // Encoded on the replying thread, so the I/O thread only writes.
+    auto bytes = encodeResponse(msgid, error, result);
+    asio::post(socket_.get_executor(), [self = shared_from_this(), bytes = std::move(bytes)]() mutable {
+        self->enqueue(std::move(bytes));
+    });
+}
+
+void MsgpackRpcConnection::sendError(std::uint32_t msgid, const RpcError& error)
+{
+    sendResponse(msgid, Dictionary{{"code", error.code}, {"message", error.message}}, Value());
+}
+
+void MsgpackRpcConnection::enqueue(std::shared_ptr<msgpack::sbuffer> bytes)
+{
+    if (closed_)
+        return;
+    outboxBytes_ += bytes->size();
+    outbox_.push_back(std::move(bytes));
+    writeMore();
+}
+
+void MsgpackRpcConnection::writeMore()
+{
+    if (writing_ || closed_ || outbox_.empty())
+        return;
+    writing_ = true;
+    // Everything queued goes out in one gathered write.
+    std::vector<asio::const_buffer> buffers;
+    buffers.reserve(outbox_.size());
+    for (const auto& bytes : outbox_)
+        buffers.emplace_back(bytes->data(), bytes->size());
+    std::size_t batch = outbox_.size();
+    asio::async_write(socket_, buffers, [self = shared_from_this(), batch](const std::error_code& error, std::size_t) {
+        self->writing_ = false;
+        if (error) {
+            self->close({});
+            return;
+        }
+        for (std::size_t i = 0; i < batch; ++i) {
+            self->outboxBytes_ -= self->outbox_.front()->size();
+            self->outbox_.pop_front();
+        }
+        self->writeMore();
+        self->readMore();
+    });
+}
+
+void MsgpackRpcConnection::close(const std::string& reason)
+{
+    if (closed_.exchange(true))
+        return;
+    if (!reason.empty())
+        MXLOG(nullptr, Error, "closing connection of pid {}: {}", pid_, reason);
+    std::error_code ignored;
+    socket_.shutdown(asio::socket_base::shutdown_both, ignored);
+    socket_.close(ignored);
+    outbox_.clear();
+    outboxBytes_ = 0;
+    if (auto handler = std::move(invalidationHandler_))
+        handler();
+    // The exported object goes only after the handler, which may still need it.
+    exported_.reset();
+    interruptionHandler_ = nullptr;
+}
+
+} // namespace mx

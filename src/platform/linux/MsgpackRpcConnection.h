@@ -1,0 +1,73 @@
+#pragma once
+// One client connection of the listener: reads msgpack-rpc requests from the Unix
+// stream socket, hands them to the exported object, and writes the replies back in
+// whatever order they come. Bad input closes only this connection, with one log
+// line. A client that stops reading its replies is back-pressured: its requests are
+// not read while its unsent replies exceed a bound.
+// Lives on the connection layer's I/O thread; replies may be sent from any thread.
+
+#include <atomic>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include <asio/io_context.hpp>
+#include <asio/local/stream_protocol.hpp>
+#include <msgpack.hpp>
+
+#include "platform/ServiceConnection.h"
+#include "platform/linux/MsgpackRpcDecoder.h"
+
+namespace mx {
+
+struct RpcError;
+
+class MsgpackRpcConnection final : public ServiceConnection,
+                                   public std::enable_shared_from_this<MsgpackRpcConnection> {
+public:
+    // Unsent reply bytes above which the client's requests are no longer read.
+    static constexpr std::size_t kBackPressureBytes = 4 << 20;
+
+    MsgpackRpcConnection(asio::local::stream_protocol::socket socket, std::uint64_t number);
+    ~MsgpackRpcConnection() override;
+
+    pid_t processIdentifier() const override { return pid_; }
+    std::string description() const override;
+    void setExportedObject(std::shared_ptr<MxReportingServiceProtocol> object) override;
+    void setInterruptionHandler(std::function<void()> handler) override;
+    void setInvalidationHandler(std::function<void()> handler) override;
+    void resume() override;
+
+    // Any thread. Dropped when the connection is gone.
+    void sendResponse(std::uint32_t msgid, const Value& error, const Value& result);
+    void sendError(std::uint32_t msgid, const RpcError& error);
+
+private:
+    void readMore();
+    void handleRead(std::size_t bytes);
+    bool handleMessage(const Value& message);
+    void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
+    void writeMore();
+    void close(const std::string& reason);
+
+    asio::local::stream_protocol::socket socket_;
+    std::uint64_t number_;
+    pid_t pid_ = 0;
+    uid_t uid_ = 0;
+
+    // I/O thread only.
+    MsgpackRpcDecoder decoder_;
+    std::shared_ptr<MxReportingServiceProtocol> exported_;
+    std::function<void()> interruptionHandler_;
+    std::function<void()> invalidationHandler_;
+    std::deque<std::shared_ptr<msgpack::sbuffer>> outbox_;
+    std::size_t outboxBytes_ = 0;
+    bool reading_ = false;
+    bool writing_ = false;
+    bool resumed_ = false;
+
+    std::atomic<bool> closed_{false};
+};
+
+} // namespace mx

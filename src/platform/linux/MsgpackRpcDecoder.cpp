@@ -1,0 +1,122 @@
+#include "platform/linux/MsgpackRpcDecoder.h"
+
+#include <cstring>
+
+#include "platform/linux/MsgpackValue.h"
+
+namespace mx {
+
+namespace {
+
+// No element count may exceed what fits in one message: a forged container header
+// then cannot make the unpacker reserve more than that.
+msgpack::unpack_limit limitsFor(std::size_t maximumMessageBytes)
+{
+    return msgpack::unpack_limit(maximumMessageBytes, maximumMessageBytes / 2, maximumMessageBytes,
+                                 maximumMessageBytes, maximumMessageBytes, kMsgpackMaximumDepth);
+}
+
+} // namespace
+
+MsgpackRpcDecoder::MsgpackRpcDecoder(std::size_t maximumMessageBytes)
+    : maximumMessageBytes_(maximumMessageBytes),
+      unpacker_(nullptr, nullptr, MSGPACK_UNPACKER_INIT_BUFFER_SIZE, limitsFor(maximumMessageBytes))
+{
+}
+
+std::span<char> MsgpackRpcDecoder::buffer(std::size_t atLeast)
+{
+    unpacker_.reserve_buffer(atLeast);
+    return {unpacker_.buffer(), unpacker_.buffer_capacity()};
+}
+
+void MsgpackRpcDecoder::consumed(std::size_t count) { unpacker_.buffer_consumed(count); }
+
+void MsgpackRpcDecoder::feed(const char* bytes, std::size_t count)
+{
+    auto space = buffer(count);
+    std::memcpy(space.data(), bytes, count);
+    consumed(count);
+}
+
+MsgpackRpcDecoder::Status MsgpackRpcDecoder::next(Value& message, std::string& reason)
+{
+    msgpack::object_handle handle;
+    std::size_t before = unpacker_.parsed_size();
+    bool complete = false;
+    try {
+        complete = unpacker_.next(handle);
+    } catch (const msgpack::depth_size_overflow&) {
+        reason = "nesting deeper than 64";
+        return Status::Bad;
+    } catch (const msgpack::size_overflow&) {
+        reason = "message larger than 1 MiB";
+        return Status::Bad;
+    } catch (const std::exception& error) {
+        reason = std::string("malformed MessagePack (") + error.what() + ")";
+        return Status::Bad;
+    }
+    if (!complete) {
+        if (unpacker_.nonparsed_size() > maximumMessageBytes_) {
+            reason = "message larger than 1 MiB";
+            return Status::Bad;
+        }
+        return Status::NeedMore;
+    }
+    if (unpacker_.parsed_size() - before > maximumMessageBytes_) {
+        reason = "message larger than 1 MiB";
+        return Status::Bad;
+    }
+    auto decoded = decodeMsgpack(handle.get(), reason);
+    if (!decoded)
+        return Status::Bad;
+    message = std::move(*decoded);
+    return Status::Message;
+}
+
+namespace {
+
+const Array* messageArray(const Value& message, std::size_t size, std::int64_t type, std::string& reason)
+{
+    const Array* array = message.asArray();
+    if (!array || array->size() != size || (*array)[0].kind() != Value::Kind::Int || *(*array)[0].asInt() != type) {
+        reason = type == 0 ? "not a msgpack-rpc request" : "not a msgpack-rpc response";
+        return nullptr;
+    }
+    const Value& msgid = (*array)[1];
+    if (msgid.kind() != Value::Kind::Int || *msgid.asInt() < 0 || *msgid.asInt() > std::int64_t(UINT32_MAX)) {
+        reason = "message id is not an unsigned 32-bit integer";
+        return nullptr;
+    }
+    return array;
+}
+
+} // namespace
+
+std::optional<RpcRequest> parseRpcRequest(const Value& message, std::string& reason)
+{
+    const Array* array = messageArray(message, 4, 0, reason);
+    if (!array)
+        return std::nullopt;
+    const std::string* method = (*array)[2].asString();
+    if (!method) {
+        reason = "method name is not a string";
+        return std::nullopt;
+    }
+    RpcRequest request{static_cast<std::uint32_t>(*(*array)[1].asInt()), *method, std::nullopt};
+    // Parameters that are not an array are the request's own problem, answered with
+    // an error; the connection stays usable.
+    if (const Array* params = (*array)[3].asArray())
+        request.params = *params;
+    return request;
+}
+
+std::optional<RpcResponse> parseRpcResponse(const Value& message, std::string& reason)
+{
+    const Array* array = messageArray(message, 4, 1, reason);
+    if (!array)
+        return std::nullopt;
+    return RpcResponse{static_cast<std::uint32_t>(*(*array)[1].asInt()), (*array)[2], (*array)[3]};
+}
+
+} // namespace mx

@@ -1,0 +1,59 @@
+#pragma once
+// Cuts a byte stream into msgpack-rpc messages and checks each against the limits of
+// the connection layer: at most 1 MiB a message, nesting at most 64 deep, string
+// map keys only. Used on both ends: the daemon reads requests with it, the client
+// library reads responses. Not thread-safe; one per connection.
+
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <string>
+
+#include <msgpack.hpp>
+
+#include "platform/Value.h"
+
+namespace mx {
+
+inline constexpr std::size_t kMsgpackRpcMaximumMessageBytes = 1 << 20;
+
+struct RpcRequest {
+    std::uint32_t msgid = 0;
+    std::string method;
+    std::optional<Array> params; // nothing when the request's parameters are not an array
+};
+
+struct RpcResponse {
+    std::uint32_t msgid = 0;
+    Value error;
+    Value result;
+};
+
+class MsgpackRpcDecoder {
+public:
+    enum class Status { Message, NeedMore, Bad };
+
+    explicit MsgpackRpcDecoder(std::size_t maximumMessageBytes = kMsgpackRpcMaximumMessageBytes);
+
+    // Where the next bytes read from the stream go; at least `atLeast` bytes long.
+    std::span<char> buffer(std::size_t atLeast = 64 * 1024);
+    void consumed(std::size_t count);
+
+    // The next complete message, or NeedMore, or Bad with `reason` set. After Bad
+    // the stream cannot be trusted and must be closed.
+    Status next(Value& message, std::string& reason);
+
+    // Convenience for tests and fuzzing: feed bytes in one go.
+    void feed(const char* bytes, std::size_t count);
+
+private:
+    std::size_t maximumMessageBytes_;
+    msgpack::unpacker unpacker_;
+};
+
+// The request or response in a decoded message; nothing, with `reason`, when the
+// message is not one.
+std::optional<RpcRequest> parseRpcRequest(const Value& message, std::string& reason);
+std::optional<RpcResponse> parseRpcResponse(const Value& message, std::string& reason);
+
+} // namespace mx

@@ -1,0 +1,96 @@
+#include "platform/linux/MsgpackRpcListener.h"
+
+#include <pthread.h>
+#include <sys/stat.h>
+
+#include <systemd/sd-daemon.h>
+
+#include "platform/MxLog.h"
+#include "platform/linux/MsgpackRpcConnection.h"
+
+namespace mx {
+
+MsgpackRpcListener::MsgpackRpcListener() : keepRunning_(io_.get_executor()), acceptor_(io_), retry_(io_) {}
+
+MsgpackRpcListener::~MsgpackRpcListener()
+{
+    keepRunning_.reset();
+    io_.stop();
+    if (thread_.joinable())
+        thread_.join();
+}
+
+std::unique_ptr<MsgpackRpcListener> MsgpackRpcListener::make(const std::filesystem::path& path, std::string& error)
+{
+    std::unique_ptr<MsgpackRpcListener> listener(new MsgpackRpcListener);
+    std::error_code failure;
+    if (sd_listen_fds(1) >= 1 && sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) > 0) {
+        listener->acceptor_.assign(asio::local::stream_protocol(), SD_LISTEN_FDS_START, failure);
+        if (failure) {
+            error = "cannot take the socket systemd passed: " + failure.message();
+            return nullptr;
+        }
+        listener->endpoint_ = "socket passed by systemd";
+        return listener;
+    }
+
+    std::filesystem::create_directories(path.parent_path(), failure);
+    std::filesystem::remove(path, failure);
+    asio::local::stream_protocol::endpoint endpoint(path.string());
+    auto& acceptor = listener->acceptor_;
+    acceptor.open(endpoint.protocol(), failure);
+    if (!failure)
+        acceptor.bind(endpoint, failure);
+    if (!failure)
+        acceptor.listen(asio::socket_base::max_listen_connections, failure);
+    if (failure) {
+        error = "cannot listen on " + path.string() + ": " + failure.message();
+        return nullptr;
+    }
+    // Audio clients run as other users of the audio group.
+    chmod(path.c_str(), 0660);
+    listener->endpoint_ = path.string();
+    return listener;
+}
+
+void MsgpackRpcListener::setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate)
+{
+    delegate_ = std::move(delegate);
+}
+
+void MsgpackRpcListener::resume()
+{
+    if (thread_.joinable())
+        return;
+    acceptNext();
+    thread_ = std::thread([this] {
+        pthread_setname_np(pthread_self(), "mx-connections");
+        io_.run();
+    });
+}
+
+void MsgpackRpcListener::acceptNext()
+{
+    acceptor_.async_accept([this](const std::error_code& error, asio::local::stream_protocol::socket socket) {
+        if (error) {
+            if (error == asio::error::operation_aborted)
+                return;
+            // Out of descriptors and the like: say so, and try again shortly rather
+            // than spin on a failing accept.
+            MXLOG(nullptr, Error, "accept failed: {}", error.message());
+            retry_.expires_after(std::chrono::milliseconds(100));
+            retry_.async_wait([this](const std::error_code& cancelled) {
+                if (!cancelled)
+                    acceptNext();
+            });
+            return;
+        } else {
+            auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), ++accepted_);
+            if (!delegate_ || !delegate_->shouldAcceptNewConnection(*this, connection))
+                connection.reset();
+        }
+        acceptNext();
+    });
+}
+
+} // namespace mx

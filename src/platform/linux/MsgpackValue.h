@@ -1,0 +1,24 @@
+#pragma once
+// Values on the wire: MessagePack objects to Values and back. Dates travel as the
+// timestamp extension (type -1). Decoding untrusted input never throws and never
+// recurses deeper than the limit; it says why a value was refused instead.
+
+#include <optional>
+#include <string>
+
+#include <msgpack.hpp>
+
+#include "platform/Value.h"
+
+namespace mx {
+
+inline constexpr std::size_t kMsgpackMaximumDepth = 64;
+
+// Nothing, with `reason` set, when the object holds what a Value cannot: a map key
+// that is not a string, an extension other than the timestamp, or nesting deeper
+// than kMsgpackMaximumDepth.
+std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& reason);
+
+void encodeMsgpack(msgpack::packer<msgpack::sbuffer>& packer, const Value& value);
+
+} // namespace mx

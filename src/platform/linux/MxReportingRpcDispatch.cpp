@@ -1,0 +1,206 @@
+#include "platform/linux/MxReportingRpcDispatch.h"
+
+#include <functional>
+#include <limits>
+#include <map>
+
+#include <fmt/format.h>
+
+#include "Statistics/Service/MxReportingServiceProtocol.h"
+
+namespace mx {
+
+namespace {
+
+// Reads the arguments of one request, remembering the first that does not fit.
+class Arguments {
+public:
+    Arguments(const std::string& method, const Array& params) : method_(method), params_(params) {}
+
+    std::int64_t integer(std::size_t index, std::int64_t minimum, std::int64_t maximum, const char* what)
+    {
+        const Value& value = params_[index];
+        if (const std::int64_t* number = value.asInt(); number && *number >= minimum && *number <= maximum)
+            return *number;
+        refuse(index, what);
+        return 0;
+    }
+
+    std::uint64_t unsignedInteger(std::size_t index, std::uint64_t maximum, const char* what)
+    {
+        const Value& value = params_[index];
+        if (const std::int64_t* number = value.asInt(); number && *number >= 0 && std::uint64_t(*number) <= maximum)
+            return std::uint64_t(*number);
+        if (const std::uint64_t* number = value.asUInt(); number && *number <= maximum)
+            return *number;
+        refuse(index, what);
+        return 0;
+    }
+
+    ReporterID reporterID(std::size_t index)
+    {
+        return integer(index, std::numeric_limits<std::int64_t>::min(), std::numeric_limits<std::int64_t>::max(),
+                       "a signed 64-bit reporter ID");
+    }
+
+    Dictionary dictionary(std::size_t index)
+    {
+        if (const Dictionary* dictionary = params_[index].asDictionary())
+            return *dictionary;
+        refuse(index, "a map");
+        return {};
+    }
+
+    std::optional<Dictionary> optionalDictionary(std::size_t index)
+    {
+        if (params_[index].isNil())
+            return std::nullopt;
+        return dictionary(index);
+    }
+
+    std::optional<Array> optionalArray(std::size_t index)
+    {
+        if (params_[index].isNil())
+            return std::nullopt;
+        if (const Array* array = params_[index].asArray())
+            return *array;
+        refuse(index, "an array or nil");
+        return std::nullopt;
+    }
+
+    const std::optional<RpcError>& error() const { return error_; }
+
+private:
+    void refuse(std::size_t index, const char* what)
+    {
+        if (!error_)
+            error_ = RpcError{kRpcErrorBadArguments,
+                              fmt::format("argument {} of {} must be {}", index + 1, method_, what)};
+    }
+
+    const std::string& method_;
+    const Array& params_;
+    std::optional<RpcError> error_;
+};
+
+using Responder = std::shared_ptr<RpcResponder>;
+using Call = std::function<void(MxReportingServiceProtocol&, Arguments&, const Responder&)>;
+
+struct Operation {
+    std::size_t arity;
+    Call call;
+};
+
+MxBoolReply boolReply(const Responder& responder)
+{
+    return [responder](bool value) { responder->respond(value); };
+}
+
+const std::map<std::string, Operation, std::less<>>& operations()
+{
+    static const std::map<std::string, Operation, std::less<>> table = {
+        {"createReportingSession:reply:",
+         {1, [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.createReportingSession(id, boolReply(responder));
+          }}},
+        {"setServiceType:reportingSession:reply:",
+         {2, [](auto& service, auto& args, const Responder& responder) {
+              auto type = static_cast<ServiceType>(args.unsignedInteger(0, 0xFFFF, "an unsigned 16-bit service type"));
+              auto id = args.reporterID(1);
+              if (!args.error())
+                  service.setServiceType(type, id, boolReply(responder));
+          }}},
+        {"getServiceNameForReporterID:reply:",
+         {1, [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.getServiceNameForReporterID(id, [responder](ServiceType type) { responder->respond(type); });
+          }}},
+        {"setConfiguration:forReporterID:reply:",
+         {2, [](auto& service, auto& args, const Responder& responder) {
+              auto configuration = args.optionalDictionary(0);
+              auto id = args.reporterID(1);
+              if (!args.error())
+                  service.setConfiguration(std::move(configuration), id, boolReply(responder));
+          }}},
+        {"startReportingSessionForID:reply:",
+         {1, [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.startReportingSessionForID(id, boolReply(responder));
+          }}},
+        {"sendMessage:withCategory:andType:forReportingIDs:reply:",
+         {4, [](auto& service, auto& args, const Responder& responder) {
+              auto payload = args.dictionary(0);
+              auto category =
+                  static_cast<MessageCategory>(args.unsignedInteger(1, 0xFFFFFFFF, "an unsigned 32-bit category"));
+              auto type = static_cast<MessageType>(args.unsignedInteger(2, 0xFFFF, "an unsigned 16-bit message type"));
+              auto ids = args.optionalArray(3);
+              if (!args.error())
+                  service.sendMessage(std::move(payload), category, type, std::move(ids),
+                                      [responder](std::optional<MxReportingError> error) {
+                                          if (!error)
+                                              responder->respond(Value());
+                                          else
+                                              responder->respond(Dictionary{{"domain", error->domain},
+                                                                            {"code", error->code}});
+                                      });
+          }}},
+        {"stopReportingSessionForID:reply:",
+         {1, [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.stopReportingSessionForID(id, boolReply(responder));
+          }}},
+        {"destroyReportingSession:reply:",
+         {1, [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.destroyReportingSession(id, boolReply(responder));
+          }}},
+        {"reporterID:valid:",
+         {1, [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.reporterID(id, [responder](Dictionary validity) { responder->respond(validity); });
+          }}},
+        {"getAllReporters:",
+         {0, [](auto& service, auto&, const Responder& responder) {
+              service.getAllReporters([responder](std::vector<ReporterID> reporters) {
+                  responder->respond(Array(std::vector<Value>(reporters.begin(), reporters.end())));
+              });
+          }}},
+        {"killService:",
+         {0, [](auto& service, auto&, const Responder& responder) { service.killService(boolReply(responder)); }}},
+    };
+    return table;
+}
+
+} // namespace
+
+void dispatchReportingRequest(MxReportingServiceProtocol& service, const RpcRequest& request,
+                              const std::shared_ptr<RpcResponder>& responder)
+{
+    auto operation = operations().find(request.method);
+    if (operation == operations().end()) {
+        responder->fail({kRpcErrorUnknownMethod, fmt::format("unknown method {}", request.method)});
+        return;
+    }
+    if (!request.params) {
+        responder->fail({kRpcErrorBadArguments, fmt::format("parameters of {} must be an array", request.method)});
+        return;
+    }
+    if (request.params->size() != operation->second.arity) {
+        responder->fail({kRpcErrorBadArguments, fmt::format("{} takes {} arguments, not {}", request.method,
+                                                            operation->second.arity, request.params->size())});
+        return;
+    }
+    Arguments arguments(request.method, *request.params);
+    operation->second.call(service, arguments, responder);
+    if (arguments.error())
+        responder->fail(*arguments.error());
+}
+
+} // namespace mx

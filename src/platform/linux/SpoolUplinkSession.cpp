@@ -1,0 +1,71 @@
+#include "platform/linux/SpoolUplinkSession.h"
+
+#include <fmt/format.h>
+
+#include "platform/WorkQueue.h"
+#include "platform/linux/JsonValue.h"
+#include "platform/linux/SpoolUplink.h"
+
+namespace mx {
+
+namespace {
+
+bool containsRealtimeEvents(const Dictionary& sessionInfo)
+{
+    const Value* realtime = sessionInfo.find(kUplinkSessionInfoContainsRealtimeEvents);
+    return realtime && realtime->boolValue();
+}
+
+} // namespace
+
+SpoolUplinkSession::SpoolUplinkSession(SqliteStore& store, std::int64_t id, Dictionary sessionInfo, Dictionary userInfo)
+    : store_(store), id_(id), realtime_(containsRealtimeEvents(sessionInfo))
+{
+    store_.submit({SpoolUplink::kInsertSession,
+                   {id_, toJson(sessionInfo).dump(), toJson(userInfo).dump(), secondsSinceEpoch()}});
+}
+
+void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
+{
+    // The spool is always there to answer.
+    ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
+        [completion = std::move(completion)]() mutable { completion(std::vector<std::string>{"spool"}); });
+}
+
+SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const
+{
+    return {SpoolUplink::kInsertMessage,
+            {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, toJson(payload).dump(), nullptr,
+             nullptr}};
+}
+
+bool SpoolUplinkSession::sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,
+                                     std::optional<UplinkError>&)
+{
+    auto row = messageRow(category, type, payload);
+    if (realtime_) {
+        store_.submit(std::move(row));
+        return true;
+    }
+    std::lock_guard lock(mutex_);
+    held_.push_back(std::move(row));
+    return true;
+}
+
+void SpoolUplinkSession::flushMessages(UniqueFunction<void(std::optional<UplinkError>)> completion)
+{
+    std::vector<SqliteWrite> held;
+    {
+        std::lock_guard lock(mutex_);
+        held.swap(held_);
+    }
+    for (auto& row : held)
+        store_.submit(std::move(row));
+    store_.submit({SpoolUplink::kFlushSession, {secondsSinceEpoch(), id_}});
+    ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
+        [completion = std::move(completion)]() mutable { completion(std::nullopt); });
+}
+
+std::string SpoolUplinkSession::description() const { return fmt::format("<spool session {}>", id_); }
+
+} // namespace mx

@@ -1,0 +1,23 @@
+#include "platform/linux/SqliteJoule.h"
+
+#include "platform/linux/JsonValue.h"
+
+namespace mx {
+
+std::unique_ptr<SqliteJoule> SqliteJoule::open(const std::filesystem::path& database, std::string& error)
+{
+    auto store = SqliteStore::open(database,
+                                   {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, "
+                                    "agent INTEGER, name TEXT, payload TEXT)"},
+                                   {"INSERT INTO events(time, agent, name, payload) VALUES(?, ?, ?, ?)"}, error);
+    if (!store)
+        return nullptr;
+    return std::unique_ptr<SqliteJoule>(new SqliteJoule(std::move(store)));
+}
+
+void SqliteJoule::logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event, const Dictionary*)
+{
+    store_->submit({0, {secondsSinceEpoch(), std::int64_t{agent}, std::string(name), toJson(event).dump()}});
+}
+
+} // namespace mx

@@ -1,0 +1,75 @@
+#pragma once
+// An embedded SQLite store written in batches on a writer thread of its own. Callers
+// hand over rows and go on; they wait only while the bounded queue in front of the
+// writer is full, so nothing is ever dropped. WAL journaling keeps every committed
+// batch across a crash; destruction commits everything handed over before.
+// Thread-safe: any thread may submit.
+
+#include <condition_variable>
+#include <cstdint>
+#include <deque>
+#include <filesystem>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <variant>
+#include <vector>
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace mx {
+
+// The time columns' unit: seconds since the Unix epoch.
+double secondsSinceEpoch();
+
+using SqliteValue = std::variant<std::nullptr_t, std::int64_t, double, std::string>;
+
+struct SqliteWrite {
+    std::size_t statement; // index into the statements given at open
+    std::vector<SqliteValue> parameters;
+};
+
+class SqliteStore {
+public:
+    static constexpr std::size_t kQueueBound = 65536;
+    static constexpr std::size_t kBatchLimit = 4096;
+
+    // Opens or creates the database, runs `schema`, prepares `statements`. Nothing,
+    // with `error`, when any of that fails.
+    static std::unique_ptr<SqliteStore> open(const std::filesystem::path& path, const std::vector<std::string>& schema,
+                                             const std::vector<std::string>& statements, std::string& error);
+    ~SqliteStore();
+    SqliteStore(const SqliteStore&) = delete;
+    SqliteStore& operator=(const SqliteStore&) = delete;
+
+    void submit(SqliteWrite write);
+    // Waits until everything submitted before the call is committed.
+    void flush();
+
+    // Runs a query on a connection of its own and returns the first column of the
+    // first row as an integer (0 when there is none). For reading ids at start-up.
+    std::int64_t queryInteger(const std::string& sql);
+
+    const std::filesystem::path& path() const { return path_; }
+
+private:
+    SqliteStore(std::filesystem::path path, sqlite3* database, std::vector<sqlite3_stmt*> statements);
+    void run();
+    void commit(std::deque<SqliteWrite>& batch);
+
+    std::filesystem::path path_;
+    sqlite3* database_;
+    std::vector<sqlite3_stmt*> statements_;
+
+    std::mutex mutex_;
+    std::condition_variable changed_;
+    std::deque<SqliteWrite> queue_;
+    std::uint64_t submitted_ = 0;
+    std::uint64_t committed_ = 0;
+    bool stopping_ = false;
+    std::thread writer_;
+};
+
+} // namespace mx

@@ -1,0 +1,33 @@
+#pragma once
+// The analytics event service on this host: wanted events go to tally.db. Which
+// events are wanted comes from etc/harmonia/tally.json ({"disabled": [names or
+// prefixes]}); an unwanted event costs a string comparison and its payload is
+// never built.
+
+#include <filesystem>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/Tally.h"
+#include "platform/linux/SqliteStore.h"
+
+namespace mx {
+
+class SqliteTally final : public Tally {
+public:
+    static std::unique_ptr<SqliteTally> open(const std::filesystem::path& database,
+                                             const std::filesystem::path& configuration, std::string& error);
+
+    void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override;
+    bool wanted(std::string_view name) const;
+    SqliteStore& store() { return *store_; }
+
+private:
+    SqliteTally(std::unique_ptr<SqliteStore> store, std::vector<std::string> disabled);
+
+    std::unique_ptr<SqliteStore> store_;
+    std::vector<std::string> disabled_;
+};
+
+} // namespace mx

@@ -1,0 +1,404 @@
+// mxreport: the operator's and script's way to talk to mxreportingd. Every protocol
+// operation, the preferences domain, the notification, and a demo session.
+// Operations given in one invocation (separated by "--") share one connection, as
+// sessions belong to the connection that created them.
+//
+// Exit status: 0 done; 1 the daemon refused or failed an operation; 2 the daemon
+// cannot be reached; 64 bad usage.
+
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <future>
+#include <iostream>
+#include <random>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include <fmt/format.h>
+
+#include "Statistics/MxReportingVocabulary.h"
+#include "client/MxReportingClient.h"
+#include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/JsonPreferences.h"
+#include "platform/linux/JsonValue.h"
+#include "platform/linux/RootPath.h"
+
+using namespace mx;
+
+namespace {
+
+constexpr int kExitRefused = 1;
+constexpr int kExitUnreachable = 2;
+constexpr int kExitUsage = 64;
+
+constexpr const char* kUsage = R"(usage: mxreport [--socket PATH] [--timeout SECONDS] COMMAND [ARGS] [-- COMMAND [ARGS]]...
+
+Talks to mxreportingd on $MXREPORTING_ROOT/run/harmonia/reporting.sock. Commands joined
+by "--" run in order on one connection (a session lives as long as its connection).
+
+Protocol operations:
+  create ID                         createReportingSession
+  type ID SERVICE_TYPE              setServiceType (number or name: longformaudio, alarms, ...)
+  service-type ID                   getServiceNameForReporterID (prints the number)
+  configure ID JSON_OBJECT          setConfiguration
+  start ID [--wait]                 startReportingSessionForID (its reply comes at stop)
+  send JSON_OBJECT CATEGORY TYPE [ID... | --none]
+                                    sendMessage; without IDs to every started session,
+                                    --none for an empty list. CATEGORY by number (0x08000003)
+                                    or name (Session_Playback); TYPE by number or name (Start)
+  stop ID                           stopReportingSessionForID
+  destroy ID                        destroyReportingSession
+  valid ID                          reporterID:valid:
+  reporters                         getAllReporters
+  kill                              killService (the daemon exits with status 2)
+
+Preferences (domain com.kestrel.harmonia) and notifications:
+  defaults read [KEY]               print the domain or one key
+  defaults write KEY VALUE          VALUE as JSON (true, 3, "name"), else as a string
+  defaults delete KEY
+  notify [NAME]                     post NAME (default com.kestrel.harmonia.reporting)
+
+  demo                              play a realistic session and show what happens
+  help                              this text
+)";
+
+struct UsageError {
+    std::string message;
+};
+
+std::int64_t parseInteger(const std::string& text, const char* what)
+{
+    try {
+        std::size_t used = 0;
+        long long value = std::stoll(text, &used, 0);
+        if (used == text.size())
+            return value;
+    } catch (const std::exception&) {
+    }
+    throw UsageError{fmt::format("{} must be a number, not \"{}\"", what, text)};
+}
+
+template <class Name>
+std::int64_t parseNamed(const std::string& text, const char* what, std::int64_t maximum, Name name,
+                        const std::vector<std::int64_t>& candidates)
+{
+    if (!text.empty() && (std::isdigit(static_cast<unsigned char>(text[0])) || text[0] == '-')) {
+        auto value = parseInteger(text, what);
+        if (value < 0 || value > maximum)
+            throw UsageError{fmt::format("{} {} is out of range", what, text)};
+        return value;
+    }
+    for (auto candidate : candidates)
+        if (name(candidate) == text)
+            return candidate;
+    throw UsageError{fmt::format("unknown {} \"{}\"", what, text)};
+}
+
+ServiceType parseServiceType(const std::string& text)
+{
+    std::vector<std::int64_t> codes;
+    for (int code = 0; code <= 12; ++code)
+        codes.push_back(code);
+    codes.push_back(65535);
+    return static_cast<ServiceType>(parseNamed(
+        text, "service type", 0xFFFF, [](std::int64_t code) { return MxReportingServiceTypeName(ServiceType(code)); },
+        codes));
+}
+
+MessageCategory parseCategory(const std::string& text)
+{
+    std::vector<std::int64_t> codes;
+    for (std::int64_t subsystem : {0x0ll, 0x80000000ll, 0x08000000ll, 0x10000000ll, 0x20000000ll, 0x40000000ll})
+        for (std::int64_t low = 0; low <= 11; ++low)
+            codes.push_back(subsystem | low);
+    return static_cast<MessageCategory>(parseNamed(
+        text, "category", 0xFFFFFFFF,
+        [](std::int64_t code) { return MxReportingCategoryName(MessageCategory(code)); }, codes));
+}
+
+MessageType parseMessageType(const std::string& text)
+{
+    return static_cast<MessageType>(parseNamed(
+        text, "message type", 0xFFFF, [](std::int64_t code) { return MxReportingMessageTypeName(MessageType(code)); },
+        {0, 1, 2, 3, 4, 5, 65535}));
+}
+
+Dictionary parseObject(const std::string& text)
+{
+    auto json = nlohmann::ordered_json::parse(text, nullptr, /*allow_exceptions=*/false);
+    if (json.is_discarded() || !json.is_object())
+        throw UsageError{fmt::format("expected a JSON object, not {}", text)};
+    return *fromJson(json).asDictionary();
+}
+
+std::string show(const Value& value) { return toJson(value).dump(); }
+
+class Session {
+public:
+    Session(MxReportingClient& client) : client_(client) {}
+
+    // Runs one command; returns false when the daemon refused or failed it.
+    bool run(const std::vector<std::string>& words)
+    {
+        const std::string& command = words.at(0);
+        auto argument = [&](std::size_t index) -> const std::string& {
+            if (index >= words.size())
+                throw UsageError{fmt::format("{} needs more arguments (see mxreport help)", command)};
+            return words[index];
+        };
+        auto id = [&](std::size_t index) { return parseInteger(argument(index), "reporter ID"); };
+
+        if (command == "create")
+            return report(command, client_.createReportingSession(id(1)));
+        if (command == "type")
+            return report(command, client_.setServiceType(parseServiceType(argument(2)), id(1)));
+        if (command == "service-type")
+            return report(command, client_.getServiceNameForReporterID(id(1)));
+        if (command == "configure")
+            return report(command, client_.setConfiguration(parseObject(argument(2)), id(1)));
+        if (command == "start")
+            return start(id(1), words.size() > 2 && words[2] == "--wait");
+        if (command == "send")
+            return send(words);
+        if (command == "stop")
+            return report(command, client_.stopReportingSessionForID(id(1)));
+        if (command == "destroy")
+            return report(command, client_.destroyReportingSession(id(1)));
+        if (command == "valid")
+            return report(command, client_.reporterID(id(1)));
+        if (command == "reporters")
+            return report(command, client_.getAllReporters());
+        if (command == "kill") {
+            client_.killService();
+            std::puts("kill: sent (the daemon exits with status 2)");
+            return true;
+        }
+        throw UsageError{fmt::format("unknown command \"{}\" (see mxreport help)", command)};
+    }
+
+private:
+    bool start(ReporterID reporterID, bool wait)
+    {
+        if (wait)
+            return report("start", waitForStart(reporterID));
+        // The reply is held by the daemon until the session is stopped; it is printed
+        // when it comes.
+        client_.startReportingSessionForID(reporterID, [reporterID](MxClientResult<bool> result) {
+            if (result)
+                std::printf("start %lld: %s (held reply, answered now)\n", static_cast<long long>(reporterID),
+                            *result.value ? "true" : "false");
+            std::fflush(stdout);
+        });
+        std::printf("start %lld: sent, its reply is held until the session stops\n", static_cast<long long>(reporterID));
+        return true;
+    }
+
+    MxClientResult<bool> waitForStart(ReporterID reporterID)
+    {
+        std::promise<MxClientResult<bool>> reply;
+        client_.startReportingSessionForID(reporterID, [&](MxClientResult<bool> result) { reply.set_value(result); });
+        return reply.get_future().get();
+    }
+
+    bool send(const std::vector<std::string>& words)
+    {
+        if (words.size() < 4)
+            throw UsageError{"send needs a JSON object, a category and a type"};
+        std::optional<std::vector<ReporterID>> ids;
+        for (std::size_t i = 4; i < words.size(); ++i) {
+            if (!ids)
+                ids.emplace();
+            if (words[i] != "--none")
+                ids->push_back(parseInteger(words[i], "reporter ID"));
+        }
+        auto result =
+            client_.sendMessage(parseObject(words[1]), parseCategory(words[2]), parseMessageType(words[3]), ids);
+        if (result && *result.value) {
+            std::printf("send: refused: domain %s code %lld (reporting is switched off)\n",
+                        (*result.value)->domain.c_str(), static_cast<long long>((*result.value)->code));
+            return false;
+        }
+        return report("send", result);
+    }
+
+    template <class T>
+    bool report(const std::string& command, const MxClientResult<T>& result)
+    {
+        if (!result) {
+            std::fprintf(stderr, "%s: %s\n", command.c_str(), result.error ? result.error->message.c_str() : "failed");
+            return false;
+        }
+        std::printf("%s: %s\n", command.c_str(), describe(*result.value).c_str());
+        return true;
+    }
+
+    static std::string describe(bool value) { return value ? "true" : "false"; }
+    static std::string describe(ServiceType value)
+    {
+        return fmt::format("{} ({})", value, MxReportingServiceTypeName(value));
+    }
+    static std::string describe(const Dictionary& value) { return show(value); }
+    static std::string describe(const MxSendOutcome&) { return "accepted"; }
+    static std::string describe(const std::vector<ReporterID>& value)
+    {
+        return show(Array(std::vector<Value>(value.begin(), value.end())));
+    }
+
+    MxReportingClient& client_;
+};
+
+std::filesystem::path preferencesDirectory() { return MxReportingPath("var/lib/harmonia/preferences"); }
+
+int defaults(const std::vector<std::string>& words)
+{
+    const std::string domain = "com.kestrel.harmonia";
+    JsonPreferences preferences(preferencesDirectory());
+    Dictionary stored = preferences.copyDomain(domain);
+    std::string verb = words.size() > 1 ? words[1] : "read";
+    if (verb == "read") {
+        if (words.size() > 2) {
+            const Value* value = stored.find(words[2]);
+            if (!value) {
+                std::fprintf(stderr, "defaults: %s is not set\n", words[2].c_str());
+                return kExitRefused;
+            }
+            std::puts(show(*value).c_str());
+        } else {
+            std::puts(toJson(stored).dump(2).c_str());
+        }
+        return 0;
+    }
+    if (verb == "write" && words.size() == 4) {
+        auto json = nlohmann::ordered_json::parse(words[3], nullptr, false);
+        stored.set(words[2], json.is_discarded() ? Value(words[3]) : fromJson(json));
+    } else if (verb == "delete" && words.size() == 3) {
+        stored.erase(words[2]);
+    } else {
+        throw UsageError{"defaults read [KEY] | write KEY VALUE | delete KEY"};
+    }
+    auto path = preferences.domainPath(domain);
+    std::filesystem::create_directories(path.parent_path());
+    auto temporary = path;
+    temporary += ".tmp";
+    std::ofstream(temporary) << toJson(stored).dump(2) << "\n";
+    std::filesystem::rename(temporary, path);
+    std::printf("defaults: %s written; post the notification (mxreport notify) for the daemon to read it\n",
+                path.c_str());
+    return 0;
+}
+
+int notify(const std::vector<std::string>& words)
+{
+    std::string name = words.size() > 1 ? words[1] : "com.kestrel.harmonia.reporting";
+    DatagramNotifications notifications(MxReportingPath("run/harmonia/notify.sock"));
+    std::uint32_t status = notifications.post(name);
+    if (status != 0) {
+        std::fprintf(stderr, "notify: cannot post %s: %s\n", name.c_str(), std::strerror(static_cast<int>(status)));
+        return kExitUnreachable;
+    }
+    std::printf("notify: posted %s\n", name.c_str());
+    return 0;
+}
+
+int demo(MxReportingClient& client)
+{
+    std::mt19937_64 random{std::random_device{}()};
+    ReporterID id = static_cast<ReporterID>(random() % 1000000000) + 1;
+    std::string reporter = std::to_string(id);
+    std::string timestamp = std::to_string(std::time(nullptr));
+    std::vector<std::vector<std::string>> script = {
+        {"create", reporter},
+        {"type", reporter, "longformaudio"},
+        {"configure", reporter, R"({"HostApplicationDisplayID": "com.example.player", "output route": "Speaker"})"},
+        {"start", reporter},
+        {"send", R"({"sample rate": 48000, "codec": "aac"})", "Session_Playback", "Start", reporter},
+        {"send", R"({"route": "Headphones", "reason": "new device"})", "Routing_RouteChange", "Generic", reporter},
+        {"send", R"({"EngineOnTime": 12.5, "mxreporting_timestamp": )" + timestamp + "}", "Volume", "Generic", reporter},
+        {"send", R"({"sample rate": 44100, "underruns": 0})", "Session_Playback", "Stop", reporter},
+        {"reporters"},
+        {"valid", reporter},
+        {"stop", reporter},
+        {"destroy", reporter},
+    };
+    std::printf("demo: one long-form audio session, reporter %s\n", reporter.c_str());
+    Session session(client);
+    for (const auto& words : script) {
+        std::string line;
+        for (const auto& word : words)
+            line += (line.empty() ? "" : " ") + word;
+        std::printf("\n$ mxreport %s\n", line.c_str());
+        std::fflush(stdout);
+        if (!session.run(words))
+            return kExitRefused;
+        std::fflush(stdout);
+    }
+    std::printf("\nThe daemon wrote analytics events to var/lib/harmonia/tally.db, a power log event to\n"
+                "joule.db and the backend session with its messages and summary to uplink.db.\n");
+    return 0;
+}
+
+std::vector<std::vector<std::string>> splitCommands(const std::vector<std::string>& words)
+{
+    std::vector<std::vector<std::string>> commands(1);
+    for (const auto& word : words) {
+        if (word == "--") {
+            commands.emplace_back();
+            continue;
+        }
+        commands.back().push_back(word);
+    }
+    std::erase_if(commands, [](const auto& command) { return command.empty(); });
+    return commands;
+}
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    std::vector<std::string> words(argv + 1, argv + argc);
+    std::filesystem::path socket = MxReportingClient::defaultSocketPath();
+    std::chrono::milliseconds timeout = MxReportingClient::kDefaultTimeout;
+    try {
+        while (!words.empty() && words[0].starts_with("--") && words[0] != "--") {
+            std::string option = words[0];
+            words.erase(words.begin());
+            if (option == "--help")
+                words = {"help"};
+            else if (option == "--socket" && !words.empty())
+                socket = words[0], words.erase(words.begin());
+            else if (option == "--timeout" && !words.empty())
+                timeout = std::chrono::seconds(parseInteger(words[0], "timeout")), words.erase(words.begin());
+            else
+                throw UsageError{"unknown option " + option};
+        }
+        auto commands = splitCommands(words);
+        if (commands.empty() || commands[0][0] == "help" || commands[0][0] == "-h") {
+            std::fputs(kUsage, commands.empty() ? stderr : stdout);
+            return commands.empty() ? kExitUsage : 0;
+        }
+        if (commands[0][0] == "defaults")
+            return defaults(commands[0]);
+        if (commands[0][0] == "notify")
+            return notify(commands[0]);
+
+        std::string error;
+        auto client = MxReportingClient::connect(socket, error);
+        if (!client) {
+            std::fprintf(stderr, "mxreport: %s (is mxreportingd running?)\n", error.c_str());
+            return kExitUnreachable;
+        }
+        client->setTimeout(timeout);
+        if (commands[0][0] == "demo")
+            return demo(*client);
+        Session session(*client);
+        for (const auto& command : commands)
+            if (!session.run(command))
+                return kExitRefused;
+        return 0;
+    } catch (const UsageError& usage) {
+        std::fprintf(stderr, "mxreport: %s\n", usage.message.c_str());
+        return kExitUsage;
+    }
+}
