@@ -194,6 +194,8 @@ void MsgpackRpcConnection::writeMore()
     std::size_t batch = outbox_.size();
     asio::async_write(socket_, buffers, [self = shared_from_this(), batch](const std::error_code& error, std::size_t) {
         self->writing_ = false;
+        if (self->closed_)
+            return;
         if (error) {
             self->close({});
             return;
@@ -216,8 +218,7 @@ void MsgpackRpcConnection::close(const std::string& reason)
     std::error_code ignored;
     socket_.shutdown(asio::socket_base::shutdown_both, ignored);
     socket_.close(ignored);
-    outbox_.clear();
-    outboxBytes_ = 0;
+    // The outbox stays until the connection goes: a write in flight still points into it.
     if (auto handler = std::move(invalidationHandler_))
         handler();
     // The exported object goes only after the handler, which may still need it.

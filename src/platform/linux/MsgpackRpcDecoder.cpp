@@ -42,7 +42,10 @@ void MsgpackRpcDecoder::feed(const char* bytes, std::size_t count)
 MsgpackRpcDecoder::Status MsgpackRpcDecoder::next(Value& message, std::string& reason)
 {
     msgpack::object_handle handle;
-    std::size_t before = unpacker_.parsed_size();
+    // The unpacker counts the bytes of a message that spans several reads in
+    // parsed_size() until the message completes, and then starts again at zero.
+    std::size_t partial = unpacker_.parsed_size();
+    std::size_t pending = unpacker_.nonparsed_size();
     bool complete = false;
     try {
         complete = unpacker_.next(handle);
@@ -63,7 +66,7 @@ MsgpackRpcDecoder::Status MsgpackRpcDecoder::next(Value& message, std::string& r
         }
         return Status::NeedMore;
     }
-    if (unpacker_.parsed_size() - before > maximumMessageBytes_) {
+    if (partial + (pending - unpacker_.nonparsed_size()) > maximumMessageBytes_) {
         reason = "message larger than 1 MiB";
         return Status::Bad;
     }

@@ -1,0 +1,280 @@
+// The daemon as clients meet it: a real process, real sockets, real stores, in a
+// private root per test.
+
+#include <csignal>
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <future>
+
+#include <fmt/format.h>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <msgpack.hpp>
+#include <nlohmann/json.hpp>
+
+#include "client/MxReportingClient.h"
+#include "integration/DaemonProcess.h"
+
+namespace mx::testing {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+
+// A connection that speaks bytes, for what no well-behaved client would send.
+class RawConnection {
+public:
+    explicit RawConnection(const std::filesystem::path& socketPath)
+    {
+        fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        std::strncpy(address.sun_path, socketPath.c_str(), sizeof(address.sun_path) - 1);
+        connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
+    }
+    ~RawConnection() { ::close(fd_); }
+
+    bool connected() const { return connected_; }
+    bool send(const std::string& bytes) { return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == ssize_t(bytes.size()); }
+
+    // True once the daemon has closed its end.
+    bool waitForClose()
+    {
+        return waitUntil([&] {
+            char byte;
+            ssize_t got = ::recv(fd_, &byte, 1, MSG_DONTWAIT);
+            return got == 0 || (got < 0 && errno != EAGAIN && errno != EWOULDBLOCK);
+        });
+    }
+
+    int fd() const { return fd_; }
+
+private:
+    int fd_ = -1;
+    bool connected_ = false;
+};
+
+std::string packed(const std::function<void(msgpack::packer<msgpack::sbuffer>&)>& write)
+{
+    msgpack::sbuffer buffer;
+    msgpack::packer<msgpack::sbuffer> packer(buffer);
+    write(packer);
+    return std::string(buffer.data(), buffer.size());
+}
+
+class DaemonIntegrationTest : public ::testing::Test {
+protected:
+    void SetUp() override { daemon.start(); }
+
+    std::unique_ptr<MxReportingClient> connect()
+    {
+        std::string error;
+        auto client = MxReportingClient::connect(daemon.socketPath(), error);
+        EXPECT_TRUE(client) << error;
+        return client;
+    }
+
+    DaemonProcess daemon;
+};
+
+TEST_F(DaemonIntegrationTest, TwoClientsFollowTheCrossClientRules)
+{
+    auto owner = connect();
+    auto other = connect();
+    ASSERT_TRUE(owner->createReportingSession(5).value.value_or(false));
+    ASSERT_TRUE(other->createReportingSession(6).value.value_or(false));
+
+    std::promise<bool> started;
+    other->startReportingSessionForID(5, [&](MxClientResult<bool> result) { started.set_value(result.value.value_or(false)); });
+    EXPECT_EQ(other->reporterID(5).value, (Dictionary{{"reporterID", 5}, {"serviceType", 65535}}));
+    EXPECT_TRUE(*other->stopReportingSessionForID(5).value) << "stop of another client's session replies true";
+    auto startReply = started.get_future();
+    EXPECT_EQ(startReply.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout)
+        << "and does nothing: the start reply stays held";
+    EXPECT_THAT(*owner->getAllReporters().value, ElementsAre(5, 6)) << "clients in connection order";
+
+    EXPECT_TRUE(*owner->stopReportingSessionForID(5).value);
+    ASSERT_EQ(startReply.wait_for(DaemonProcess::kBound), std::future_status::ready);
+    EXPECT_TRUE(startReply.get());
+
+    auto raw = owner->call("getServiceNameForReporterID:reply:", Array{0});
+    EXPECT_EQ(raw.value, Value(65535)) << "the first of the two replies";
+    EXPECT_EQ(*owner->getServiceNameForReporterID(6).value, 65535);
+}
+
+TEST_F(DaemonIntegrationTest, RequestsThatCannotBeHandedOnGetAnRpcErrorAndTheConnectionStays)
+{
+    auto client = connect();
+    auto unknown = client->call("noSuchOperation:", Array{});
+    ASSERT_TRUE(unknown.error);
+    EXPECT_EQ(unknown.error->kind, MxClientError::Kind::Rpc);
+    EXPECT_EQ(unknown.error->code, 1);
+    auto wrongCount = client->call("createReportingSession:reply:", Array{1, 2});
+    ASSERT_TRUE(wrongCount.error);
+    EXPECT_EQ(wrongCount.error->code, 2);
+    auto wrongType = client->call("setServiceType:reportingSession:reply:", Array{70000, 5});
+    ASSERT_TRUE(wrongType.error);
+    EXPECT_THAT(wrongType.error->message, HasSubstr("argument 1"));
+    EXPECT_TRUE(*client->createReportingSession(5).value);
+}
+
+TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
+{
+    auto bystander = connect();
+    ASSERT_TRUE(*bystander->createReportingSession(7).value);
+
+    struct Case {
+        std::string bytes;
+        std::string reason;
+    };
+    std::string deep;
+    for (int i = 0; i < 70; ++i)
+        deep += '\x91'; // fixarray of one
+    deep += '\xc0';
+    std::vector<Case> cases = {
+        {"\xc1", "malformed MessagePack"},
+        {packed([](auto& p) {
+             p.pack_array(4), p.pack(0), p.pack(1), p.pack(std::string("createReportingSession:reply:"));
+             p.pack_array(1), p.pack_map(1), p.pack(1), p.pack(2);
+         }),
+         "map key is not a string"},
+        {deep, "nesting deeper than 64"},
+        {std::string("\xdb\x00\x20\x00\x00", 5) + std::string((1 << 20) + 4096, 'x'), "message larger than 1 MiB"},
+        {packed([](auto& p) { p.pack_array(2), p.pack(0), p.pack(1); }), "not a msgpack-rpc request"},
+    };
+    for (const auto& badInput : cases) {
+        RawConnection raw(daemon.socketPath());
+        ASSERT_TRUE(raw.connected());
+        raw.send(badInput.bytes); // the daemon may close before it has read everything
+        EXPECT_TRUE(raw.waitForClose()) << badInput.reason;
+        EXPECT_TRUE(daemon.waitForLog("pid " + std::to_string(getpid()) + ": " + badInput.reason)) << badInput.reason;
+    }
+    EXPECT_TRUE(*bystander->setServiceType(7, 7).value) << "the bystander is still served";
+    EXPECT_EQ(*bystander->getServiceNameForReporterID(7).value, 7);
+}
+
+TEST_F(DaemonIntegrationTest, AClientThatDoesNotReadHoldsUpNobodyElse)
+{
+    RawConnection flooder(daemon.socketPath());
+    ASSERT_TRUE(flooder.connected());
+    fcntl(flooder.fd(), F_SETFL, O_NONBLOCK);
+    std::string request = packed([](auto& p) {
+        p.pack_array(4), p.pack(0), p.pack(1), p.pack(std::string("reporterID:valid:")), p.pack_array(1), p.pack(1);
+    });
+    std::string burst;
+    for (int i = 0; i < 20000; ++i)
+        burst += request;
+    // Write until the daemon stops reading: its replies to us are not being read.
+    std::size_t written = 0;
+    bool blocked = waitUntil([&] {
+        std::size_t offset = written % burst.size();
+        ssize_t sent = ::send(flooder.fd(), burst.data() + offset, burst.size() - offset, MSG_NOSIGNAL);
+        if (sent > 0)
+            written += std::size_t(sent);
+        return sent < 0 && errno == EAGAIN;
+    });
+    EXPECT_TRUE(blocked) << "the daemon kept reading after " << written << " bytes";
+
+    auto client = connect();
+    EXPECT_TRUE(*client->createReportingSession(9).value);
+    EXPECT_EQ(client->reporterID(9).value, (Dictionary{{"reporterID", 9}, {"serviceType", 65535}}));
+}
+
+TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)
+{
+    auto bystander = connect();
+    pid_t victim = daemon.spawn({MXREPORT_PATH, "create", "11", "--", "type", "11", "test", "--", "start", "11", "--wait"});
+    ASSERT_TRUE(daemon.waitForLog("session created for reporter 11"));
+    ASSERT_TRUE(waitUntil([&] { return bystander->reporterID(11).value == Dictionary{{"reporterID", 11}, {"serviceType", 11}}; }));
+    ::kill(victim, SIGKILL);
+    waitpid(victim, nullptr, 0);
+
+    EXPECT_TRUE(daemon.waitForLog(fmt::format("removing {} from the server client list", victim)));
+    EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=mxreport"));
+    EXPECT_TRUE(waitUntil([&] {
+        return !daemon.query("tally", "SELECT payload FROM events WHERE name = "
+                                      "'com.kestrel.harmonia.mxreportingclientuptime'").empty();
+    }));
+    auto uptime = nlohmann::json::parse(daemon.query("tally", "SELECT payload FROM events WHERE name = "
+                                                              "'com.kestrel.harmonia.mxreportingclientuptime'")[0][0]);
+    EXPECT_EQ(uptime["processName"], "mxreport");
+    EXPECT_TRUE(uptime["seconds"].is_number_float());
+    EXPECT_EQ(bystander->reporterID(11).value, (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
+    EXPECT_TRUE(*bystander->createReportingSession(12).value);
+}
+
+TEST_F(DaemonIntegrationTest, KillServiceEndsTheDaemonWithStatusTwo)
+{
+    auto client = connect();
+    client->killService();
+    EXPECT_EQ(daemon.waitForExit(), 2);
+    EXPECT_THAT(daemon.log(), HasSubstr("DESTROYING SERVICE"));
+}
+
+TEST_F(DaemonIntegrationTest, ReportingSwitchFollowsThePreferencesWhenTheNotificationIsPosted)
+{
+    auto client = connect();
+    auto refused = [&] {
+        auto outcome = client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::nullopt);
+        return outcome.value && outcome.value->has_value() && (*outcome.value)->code == 1 &&
+               (*outcome.value)->domain == "com.kestrel.audio.reporting";
+    };
+    daemon.writeFile("var/lib/harmonia/preferences/com.kestrel.harmonia.json",
+                     R"({"disable_reporting": true, "device_name": "den"})");
+    EXPECT_FALSE(refused()) << "nothing changes before the notification";
+
+    pid_t poster = daemon.spawn({MXREPORT_PATH, "notify"});
+    waitpid(poster, nullptr, 0);
+    EXPECT_TRUE(waitUntil(refused));
+    EXPECT_TRUE(daemon.waitForLog("defaults {\"device_name\":\"den\",\"disable_reporting\":1}"));
+
+    daemon.writeFile("var/lib/harmonia/preferences/com.kestrel.harmonia.json", "{}");
+    daemon.signal(SIGHUP);
+    EXPECT_TRUE(waitUntil([&] { return !refused(); })) << "SIGHUP posts the notification too";
+    EXPECT_TRUE(daemon.waitForLog("defaults {\"disable_reporting\":0}"));
+}
+
+TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
+{
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    auto client = connect();
+    ASSERT_TRUE(*client->createReportingSession(21).value);
+    ASSERT_TRUE(*client->setServiceType(7, 21).value);
+    ASSERT_TRUE(*client->setConfiguration(Dictionary{{"HostApplicationDisplayID", "ExampleHost"}}, 21).value);
+    client->startReportingSessionForID(21, nullptr);
+    for (int i = 0; i < 50; ++i)
+        ASSERT_TRUE(client->sendMessage(Dictionary{{"seq", i}, {"EngineOnTime", 0.5}, {"mxreporting_timestamp", 100 + i}},
+                                        0x08000003, 1, std::vector<ReporterID>{21}));
+    ASSERT_TRUE(*client->stopReportingSessionForID(21).value);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"alone", true}}, 1, 0, std::nullopt));
+
+    daemon.signal(SIGTERM);
+    EXPECT_EQ(daemon.waitForExit(), 0);
+    EXPECT_EQ(daemon.query("tally", "SELECT count(*) FROM events WHERE name = "
+                                    "'com.kestrel.harmonia.Session_Playback.Start'")[0][0], "50");
+    EXPECT_EQ(daemon.query("joule", "SELECT count(*) FROM events WHERE name = 'Tessera_Haptics' AND agent = 28")[0][0],
+              "50");
+    auto sessions = daemon.query("uplink", "SELECT id, session_info, user_info FROM sessions");
+    ASSERT_EQ(sessions.size(), 1u);
+    auto sessionInfo = nlohmann::json::parse(sessions[0][1]);
+    EXPECT_EQ(sessionInfo.size(), 6u);
+    EXPECT_EQ(sessionInfo["SessionID"], 21);
+    EXPECT_EQ(nlohmann::json::parse(sessions[0][2])["ServiceName"], "longformaudio_session");
+    auto messages = daemon.query("uplink", "SELECT category, type, payload FROM messages WHERE session = " +
+                                               sessions[0][0] + " ORDER BY id");
+    ASSERT_EQ(messages.size(), 51u);
+    for (int i = 0; i < 50; ++i)
+        EXPECT_EQ(nlohmann::json::parse(messages[i][2])["seq"], i);
+    EXPECT_EQ(messages[50][1], "65535") << "the summary event comes last";
+    auto alone = daemon.query("uplink", "SELECT payload, user_info FROM messages WHERE session IS NULL");
+    ASSERT_EQ(alone.size(), 1u);
+    EXPECT_EQ(nlohmann::json::parse(alone[0][1])["ServiceName"], "standalone");
+}
+
+} // namespace
+} // namespace mx::testing

@@ -1,0 +1,138 @@
+#include "integration/DaemonProcess.h"
+
+#include <csignal>
+#include <cstdlib>
+#include <fcntl.h>
+#include <fstream>
+#include <sstream>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+
+#include <sqlite3.h>
+
+namespace mx::testing {
+
+bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds bound)
+{
+    auto deadline = std::chrono::steady_clock::now() + bound;
+    while (!condition()) {
+        if (std::chrono::steady_clock::now() > deadline)
+            return false;
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return true;
+}
+
+DaemonProcess::DaemonProcess()
+{
+    std::string pattern = (std::filesystem::temp_directory_path() / "mxreporting-test-XXXXXX").string();
+    root_ = mkdtemp(pattern.data());
+}
+
+DaemonProcess::~DaemonProcess()
+{
+    if (pid_ > 0) {
+        ::kill(pid_, SIGKILL);
+        waitpid(pid_, nullptr, 0);
+    }
+    std::error_code ignored;
+    std::filesystem::remove_all(root_, ignored);
+}
+
+void DaemonProcess::writeFile(const std::string& relative, const std::string& contents) const
+{
+    std::filesystem::create_directories(path(relative).parent_path());
+    std::ofstream(path(relative)) << contents;
+}
+
+pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments) const
+{
+    std::string log = (root_ / "spawned.log").string();
+    pid_t child = fork();
+    if (child == 0) {
+        setenv("MXREPORTING_ROOT", root_.c_str(), 1);
+        int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+        dup2(fd, STDOUT_FILENO);
+        dup2(fd, STDERR_FILENO);
+        std::vector<char*> argv;
+        for (const auto& argument : arguments)
+            argv.push_back(const_cast<char*>(argument.c_str()));
+        argv.push_back(nullptr);
+        execv(argv[0], argv.data());
+        _exit(127);
+    }
+    return child;
+}
+
+void DaemonProcess::start()
+{
+    std::string log = (root_ / "daemon.log").string();
+    pid_ = fork();
+    if (pid_ == 0) {
+        setenv("MXREPORTING_ROOT", root_.c_str(), 1);
+        unsetenv("JOURNAL_STREAM");
+        unsetenv("LISTEN_FDS");
+        int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        dup2(fd, STDERR_FILENO);
+        dup2(fd, STDOUT_FILENO);
+        execl(MXREPORTINGD_PATH, MXREPORTINGD_PATH, nullptr);
+        _exit(127);
+    }
+    waitForLog("listening on");
+}
+
+void DaemonProcess::signal(int signal) const { ::kill(pid_, signal); }
+
+std::optional<int> DaemonProcess::waitForExit()
+{
+    int status = 0;
+    bool ended = waitUntil([&] { return waitpid(pid_, &status, WNOHANG) == pid_; });
+    if (!ended)
+        return std::nullopt;
+    pid_ = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+std::string DaemonProcess::log() const
+{
+    std::ifstream stream(root_ / "daemon.log");
+    std::stringstream contents;
+    contents << stream.rdbuf();
+    return contents.str();
+}
+
+bool DaemonProcess::waitForLog(const std::string& text, std::chrono::milliseconds bound) const
+{
+    return waitUntil([&] { return log().find(text) != std::string::npos; }, bound);
+}
+
+std::vector<std::vector<std::string>> DaemonProcess::query(const std::string& store, const std::string& sql) const
+{
+    std::vector<std::vector<std::string>> rows;
+    sqlite3* database = nullptr;
+    auto file = path("var/lib/harmonia/" + store + ".db");
+    if (sqlite3_open_v2(file.c_str(), &database, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
+        sqlite3_close(database);
+        return rows;
+    }
+    sqlite3_busy_timeout(database, 5000);
+    sqlite3_stmt* statement = nullptr;
+    if (sqlite3_prepare_v2(database, sql.c_str(), -1, &statement, nullptr) == SQLITE_OK) {
+        while (sqlite3_step(statement) == SQLITE_ROW) {
+            std::vector<std::string> row;
+            for (int column = 0; column < sqlite3_column_count(statement); ++column) {
+                auto* text = sqlite3_column_text(statement, column);
+                row.push_back(text ? reinterpret_cast<const char*>(text) : "NULL");
+            }
+            rows.push_back(std::move(row));
+        }
+    }
+    sqlite3_finalize(statement);
+    sqlite3_close(database);
+    return rows;
+}
+
+} // namespace mx::testing

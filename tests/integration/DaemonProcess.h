@@ -1,0 +1,52 @@
+#pragma once
+// The real mxreportingd, run as a child process in a private MXREPORTING_ROOT, with
+// its stderr in a file the test can wait on and its SQLite stores open to queries.
+
+#include <chrono>
+#include <filesystem>
+#include <functional>
+#include <optional>
+#include <string>
+#include <sys/types.h>
+#include <vector>
+
+namespace mx::testing {
+
+class DaemonProcess {
+public:
+    static constexpr std::chrono::seconds kBound{20};
+
+    DaemonProcess();
+    ~DaemonProcess();
+
+    const std::filesystem::path& root() const { return root_; }
+    std::filesystem::path path(const std::string& relative) const { return root_ / relative; }
+    std::filesystem::path socketPath() const { return path("run/harmonia/reporting.sock"); }
+    void writeFile(const std::string& relative, const std::string& contents) const;
+
+    // Starts the daemon and waits until it accepts connections.
+    void start();
+    pid_t pid() const { return pid_; }
+    void signal(int signal) const;
+    // The exit status, or the signal as 128+N; nothing when it did not end in time.
+    std::optional<int> waitForExit();
+
+    std::string log() const;
+    bool waitForLog(const std::string& text, std::chrono::milliseconds bound = kBound) const;
+
+    // Every row of a query on one of the stores ("tally", "joule", "uplink"), each
+    // column as text.
+    std::vector<std::vector<std::string>> query(const std::string& store, const std::string& sql) const;
+
+    // Runs another program with this root in its environment; returns its pid.
+    pid_t spawn(const std::vector<std::string>& arguments) const;
+
+private:
+    std::filesystem::path root_;
+    pid_t pid_ = -1;
+};
+
+// Polls `condition` until it holds or `bound` passes.
+bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds bound = DaemonProcess::kBound);
+
+} // namespace mx::testing
