@@ -1,0 +1,76 @@
+// libFuzzer target: arbitrary bytes from a client, cut at arbitrary points, through
+// the request decoder, the request parser and the protocol dispatch. Nothing may
+// crash, hang or leak; every request that is handed on gets exactly one answer.
+
+#include <cassert>
+#include <cstdint>
+#include <cstring>
+
+#include "Statistics/Service/MxReportingServiceProtocol.h"
+#include "platform/linux/MsgpackRpcDecoder.h"
+#include "platform/linux/MxReportingRpcDispatch.h"
+
+namespace {
+
+using namespace mx;
+
+class AnsweringService final : public MxReportingServiceProtocol {
+public:
+    void createReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
+    void setServiceType(ServiceType, ReporterID, MxBoolReply reply) override { reply(true); }
+    void getServiceNameForReporterID(ReporterID, MxServiceTypeReply reply) override { reply(65535); }
+    void setConfiguration(std::optional<Dictionary>, ReporterID, MxBoolReply reply) override { reply(true); }
+    void startReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
+    void sendMessage(Dictionary payload, MessageCategory, MessageType, std::optional<Array>, MxErrorReply reply) override
+    {
+        (void)Value(payload).description();
+        reply(std::nullopt);
+    }
+    void stopReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
+    void destroyReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
+    void reporterID(ReporterID, MxDictionaryReply valid) override { valid(Dictionary{{"reporterID", 0}}); }
+    void getAllReporters(MxReportersReply reply) override { reply({}); }
+    void killService(MxBoolReply reply) override { reply(false); } // the real one exits
+};
+
+class CountingResponder final : public RpcResponder {
+public:
+    void respond(const Value&) override { ++answers; }
+    void fail(const RpcError&) override { ++answers; }
+    int answers = 0;
+};
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size)
+{
+    if (size == 0)
+        return 0;
+    // The first byte picks the read size, so messages are split across reads too.
+    std::size_t chunk = 1 + data[0] % 64;
+    ++data;
+    --size;
+    MsgpackRpcDecoder decoder(1 << 16);
+    AnsweringService service;
+    for (std::size_t offset = 0; offset < size; offset += chunk) {
+        std::size_t count = std::min(chunk, size - offset);
+        decoder.feed(reinterpret_cast<const char*>(data + offset), count);
+        Value message;
+        std::string reason;
+        for (;;) {
+            auto status = decoder.next(message, reason);
+            if (status == MsgpackRpcDecoder::Status::Bad)
+                return 0;
+            if (status == MsgpackRpcDecoder::Status::NeedMore)
+                break;
+            auto request = parseRpcRequest(message, reason);
+            if (!request)
+                return 0;
+            auto responder = std::make_shared<CountingResponder>();
+            dispatchReportingRequest(service, *request, responder);
+            if (responder->answers < 1)
+                __builtin_trap();
+        }
+    }
+    return 0;
+}
