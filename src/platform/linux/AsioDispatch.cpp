@@ -20,7 +20,8 @@ constexpr int kUtilityNiceness = 5;
 } // namespace
 
 AsioDispatch::AsioDispatch(unsigned threadsPerPool)
-    : interactivePool_("mx-interactive", threadCount(threadsPerPool), 0),
+    // Request work is one serial queue: a second thread would only bounce it between cores.
+    : interactivePool_("mx-interactive", threadsPerPool != 0 ? threadsPerPool : 1, 0),
       utilityPool_("mx-utility", threadCount(threadsPerPool), kUtilityNiceness),
       interactiveQueue_("com.kestrel.harmonia.global.interactive", interactivePool_),
       utilityQueue_("com.kestrel.harmonia.global.utility", utilityPool_)

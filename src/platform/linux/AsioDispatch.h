@@ -13,7 +13,8 @@ namespace mx {
 
 class AsioDispatch final : public Dispatch {
 public:
-    // `threadsPerPool` 0 means one per core, at least two.
+    // `threadsPerPool` 0: one thread for user-interactive work (a single serial
+    // queue), one per core (at least two) for utility work.
     explicit AsioDispatch(unsigned threadsPerPool = 0);
     ~AsioDispatch() override;
 

@@ -47,16 +47,14 @@ private:
     std::atomic<bool> replied_{false};
 };
 
-std::shared_ptr<msgpack::sbuffer> encodeResponse(std::uint32_t msgid, const Value& error, const Value& result)
+void encodeResponse(msgpack::sbuffer& bytes, std::uint32_t msgid, const Value& error, const Value& result)
 {
-    auto bytes = std::make_shared<msgpack::sbuffer>();
-    msgpack::packer<msgpack::sbuffer> packer(*bytes);
+    msgpack::packer<msgpack::sbuffer> packer(bytes);
     packer.pack_array(4);
     packer.pack_uint8(1);
     packer.pack_uint32(msgid);
     encodeMsgpack(packer, error);
     encodeMsgpack(packer, result);
-    return bytes;
 }
 
 } // namespace
@@ -161,10 +159,26 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
     if (closed_)
         return;
     // Encoded on the replying thread, so the I/O thread only writes.
-    auto bytes = encodeResponse(msgid, error, result);
-    asio::post(socket_.get_executor(), [self = shared_from_this(), bytes = std::move(bytes)]() mutable {
-        self->enqueue(std::move(bytes));
-    });
+    std::lock_guard lock(repliesMutex_);
+    if (!replies_)
+        replies_ = std::make_shared<msgpack::sbuffer>();
+    encodeResponse(*replies_, msgid, error, result);
+    if (flushScheduled_)
+        return;
+    flushScheduled_ = true;
+    asio::post(socket_.get_executor(), [self = shared_from_this()] { self->flushReplies(); });
+}
+
+void MsgpackRpcConnection::flushReplies()
+{
+    std::shared_ptr<msgpack::sbuffer> replies;
+    {
+        std::lock_guard lock(repliesMutex_);
+        replies.swap(replies_);
+        flushScheduled_ = false;
+    }
+    if (replies)
+        enqueue(std::move(replies));
 }
 
 void MsgpackRpcConnection::sendError(std::uint32_t msgid, const RpcError& error)

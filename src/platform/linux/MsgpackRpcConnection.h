@@ -10,6 +10,7 @@
 #include <deque>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <string>
 
 #include <asio/io_context.hpp>
@@ -47,6 +48,7 @@ private:
     void readMore();
     void handleRead(std::size_t bytes);
     bool handleMessage(const Value& message);
+    void flushReplies();
     void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
     void writeMore();
     void close(const std::string& reason);
@@ -68,6 +70,13 @@ private:
     bool resumed_ = false;
 
     std::atomic<bool> closed_{false};
+
+    // Replies encoded on other threads gather here; one hand-over to the I/O thread
+    // carries all that arrived meanwhile, so a busy connection costs one wake-up
+    // per batch rather than per reply.
+    std::mutex repliesMutex_;
+    std::shared_ptr<msgpack::sbuffer> replies_;
+    bool flushScheduled_ = false;
 };
 
 } // namespace mx

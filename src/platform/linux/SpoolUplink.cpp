@@ -57,8 +57,8 @@ bool SpoolUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, st
                                  std::uint16_t type, Dictionary payload, std::optional<UplinkError>&)
 {
     store_->submit({kInsertMessage,
-                    {nullptr, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, toJson(payload).dump(),
-                     toJson(sessionInfo).dump(), toJson(userInfo).dump()}});
+                    {nullptr, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, std::move(payload),
+                     std::move(sessionInfo), std::move(userInfo)}});
     return true;
 }
 

@@ -22,7 +22,7 @@ SpoolUplinkSession::SpoolUplinkSession(SqliteStore& store, std::int64_t id, Dict
     : store_(store), id_(id), realtime_(containsRealtimeEvents(sessionInfo))
 {
     store_.submit({SpoolUplink::kInsertSession,
-                   {id_, toJson(sessionInfo).dump(), toJson(userInfo).dump(), secondsSinceEpoch()}});
+                   {id_, std::move(sessionInfo), std::move(userInfo), secondsSinceEpoch()}});
 }
 
 void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
@@ -35,7 +35,7 @@ void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<st
 SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const
 {
     return {SpoolUplink::kInsertMessage,
-            {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, toJson(payload).dump(), nullptr,
+            {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, payload, nullptr,
              nullptr}};
 }
 

@@ -17,7 +17,7 @@ std::unique_ptr<SqliteJoule> SqliteJoule::open(const std::filesystem::path& data
 
 void SqliteJoule::logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event, const Dictionary*)
 {
-    store_->submit({0, {secondsSinceEpoch(), std::int64_t{agent}, std::string(name), toJson(event).dump()}});
+    store_->submit({0, {secondsSinceEpoch(), std::int64_t{agent}, std::string(name), std::move(event)}});
 }
 
 } // namespace mx

@@ -5,6 +5,7 @@
 #include <sqlite3.h>
 
 #include "platform/MxLog.h"
+#include "platform/linux/JsonValue.h"
 
 namespace mx {
 
@@ -81,13 +82,15 @@ void SqliteStore::submit(SqliteWrite write)
     changed_.wait(lock, [&] { return queue_.size() < kQueueBound || stopping_; });
     queue_.push_back(std::move(write));
     ++submitted_;
-    changed_.notify_all();
+    if (writerWaiting_)
+        changed_.notify_all();
 }
 
 void SqliteStore::flush()
 {
     std::unique_lock lock(mutex_);
     std::uint64_t target = submitted_;
+    changed_.notify_all();
     changed_.wait(lock, [&] { return committed_ >= target; });
 }
 
@@ -95,9 +98,16 @@ void SqliteStore::run()
 {
     std::unique_lock lock(mutex_);
     for (;;) {
+        writerWaiting_ = true;
         changed_.wait(lock, [&] { return !queue_.empty() || stopping_; });
+        writerWaiting_ = false;
         if (queue_.empty() && stopping_)
             return;
+        if (!stopping_ && queue_.size() < kBatchLimit) {
+            lock.unlock();
+            std::this_thread::sleep_for(kBatchWindow);
+            lock.lock();
+        }
         std::deque<SqliteWrite> batch;
         while (!queue_.empty() && batch.size() < kBatchLimit) {
             batch.push_back(std::move(queue_.front()));
@@ -130,9 +140,11 @@ void SqliteStore::commit(std::deque<SqliteWrite>& batch)
                         sqlite3_bind_int64(statement, index, value);
                     else if constexpr (std::is_same_v<T, double>)
                         sqlite3_bind_double(statement, index, value);
-                    else
+                    else if constexpr (std::is_same_v<T, std::string>)
                         sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()),
                                           SQLITE_STATIC);
+                    else
+                        sqlite3_bind_text(statement, index, toJson(value).dump().c_str(), -1, SQLITE_TRANSIENT);
                 },
                 write.parameters[i]);
         }

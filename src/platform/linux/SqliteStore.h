@@ -5,6 +5,7 @@
 // batch across a crash; destruction commits everything handed over before.
 // Thread-safe: any thread may submit.
 
+#include <chrono>
 #include <condition_variable>
 #include <cstdint>
 #include <deque>
@@ -16,6 +17,8 @@
 #include <variant>
 #include <vector>
 
+#include "platform/Value.h"
+
 struct sqlite3;
 struct sqlite3_stmt;
 
@@ -24,7 +27,9 @@ namespace mx {
 // The time columns' unit: seconds since the Unix epoch.
 double secondsSinceEpoch();
 
-using SqliteValue = std::variant<std::nullptr_t, std::int64_t, double, std::string>;
+// A Dictionary parameter is written as its JSON text; it is serialised on the
+// writer thread, off the caller's path.
+using SqliteValue = std::variant<std::nullptr_t, std::int64_t, double, std::string, Dictionary>;
 
 struct SqliteWrite {
     std::size_t statement; // index into the statements given at open
@@ -35,6 +40,9 @@ class SqliteStore {
 public:
     static constexpr std::size_t kQueueBound = 65536;
     static constexpr std::size_t kBatchLimit = 4096;
+    // How long the writer lets a batch gather once the first row of it arrived: a
+    // thousand rows a millisecond cost one transaction and one wake-up, not a thousand.
+    static constexpr std::chrono::milliseconds kBatchWindow{2};
 
     // Opens or creates the database, runs `schema`, prepares `statements`. Nothing,
     // with `error`, when any of that fails.
@@ -69,6 +77,7 @@ private:
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
     bool stopping_ = false;
+    bool writerWaiting_ = false;
     std::thread writer_;
 };
 

@@ -58,7 +58,7 @@ void SqliteTally::sendEventLazy(std::string_view name, UniqueFunction<Dictionary
     if (!wanted(name))
         return;
     Dictionary payload = buildPayload();
-    store_->submit({0, {secondsSinceEpoch(), std::string(name), toJson(payload).dump()}});
+    store_->submit({0, {secondsSinceEpoch(), std::string(name), std::move(payload)}});
 }
 
 } // namespace mx

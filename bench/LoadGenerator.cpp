@@ -1,0 +1,226 @@
+// The end-to-end load benchmark: N client connections, each with a started session
+// and k report requests in flight, against the real daemon (full path through
+// sinks, session and stores), and in the same run against a bare msgpack-rpc echo
+// server on the same socket type as the ceiling. Prints reports/s, p50/p99 reply
+// latency, the daemon's peak memory and the ratios to the echo.
+//
+//   mxreporting_load [--connections N] [--in-flight K] [--seconds S]
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <mutex>
+#include <random>
+#include <string>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+#include <vector>
+
+#include "EchoServer.h"
+#include "client/MxReportingClient.h"
+
+using namespace mx;
+using Clock = std::chrono::steady_clock;
+
+namespace {
+
+struct Options {
+    int connections = 8;
+    int inFlight = 32;
+    double seconds = 5;
+};
+
+struct Figures {
+    double reportsPerSecond = 0;
+    double p50Microseconds = 0;
+    double p99Microseconds = 0;
+    std::uint64_t errors = 0;
+};
+
+Dictionary realisticPayload(std::mt19937& random, int seq)
+{
+    static const char* routes[] = {"Speaker", "Headphones", "BluetoothA2DP", "CarPlay"};
+    Dictionary payload{
+        {"sample_rate", (random() % 2) ? 48000 : 44100},
+        {"route", routes[random() % 4]},
+        {"buffer_frames", 512},
+        {"underruns", static_cast<int>(random() % 3)},
+        {"peak level", -12.5 + (random() % 100) / 10.0},
+        {"codec", "aac"},
+        {"seq", seq},
+    };
+    if (seq % 4 == 0)
+        payload.set("EngineOnTime", 1.5);
+    if (seq % 2 == 0)
+        payload.set("mxreporting_timestamp", static_cast<std::int64_t>(std::time(nullptr)));
+    return payload;
+}
+
+bool waitForSocket(const std::filesystem::path& path)
+{
+    auto deadline = Clock::now() + std::chrono::seconds(20);
+    while (Clock::now() < deadline) {
+        std::string error;
+        if (MxReportingClient::connect(path, error))
+            return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+}
+
+// Keeps `inFlight` requests outstanding on every connection for `seconds`.
+Figures drive(const std::filesystem::path& socket, const Options& options, bool withSessions)
+{
+    std::vector<std::unique_ptr<MxReportingClient>> clients;
+    for (int c = 0; c < options.connections; ++c) {
+        std::string error;
+        auto client = MxReportingClient::connect(socket, error);
+        if (!client) {
+            std::fprintf(stderr, "cannot connect: %s\n", error.c_str());
+            std::exit(1);
+        }
+        if (withSessions) {
+            client->createReportingSession(c + 1);
+            client->setServiceType(7, c + 1);
+            client->setConfiguration(Dictionary{{"HostApplicationDisplayID", "bench"}}, c + 1);
+            client->startReportingSessionForID(c + 1, nullptr);
+        }
+        clients.push_back(std::move(client));
+    }
+
+    std::atomic<bool> running{true};
+    std::atomic<std::uint64_t> completed{0}, errors{0};
+    std::mutex latencyMutex;
+    std::vector<double> latencies;
+    latencies.reserve(4'000'000);
+
+    struct Lane {
+        MxReportingClient* client;
+        ReporterID id;
+        std::mt19937 random;
+        int seq = 0;
+    };
+    std::vector<std::unique_ptr<Lane>> lanes;
+    for (int c = 0; c < options.connections; ++c)
+        lanes.push_back(std::make_unique<Lane>(Lane{clients[c].get(), c + 1, std::mt19937(c)}));
+
+    std::function<void(Lane&)> issue = [&](Lane& lane) {
+        if (!running)
+            return;
+        auto payload = realisticPayload(lane.random, lane.seq++);
+        auto sent = Clock::now();
+        lane.client->sendMessage(payload, 0x08000003, 1, std::vector<ReporterID>{lane.id},
+                                 [&, sent, lanePointer = &lane](MxClientResult<MxSendOutcome> result) {
+                                     double micros = std::chrono::duration<double, std::micro>(Clock::now() - sent).count();
+                                     if (!result || *result.value)
+                                         ++errors;
+                                     ++completed;
+                                     {
+                                         std::lock_guard lock(latencyMutex);
+                                         latencies.push_back(micros);
+                                     }
+                                     issue(*lanePointer);
+                                 });
+    };
+
+    auto began = Clock::now();
+    for (auto& lane : lanes)
+        for (int k = 0; k < options.inFlight; ++k)
+            issue(*lane);
+    std::this_thread::sleep_for(std::chrono::duration<double>(options.seconds));
+    running = false;
+    double elapsed = std::chrono::duration<double>(Clock::now() - began).count();
+    std::uint64_t done = completed.load();
+    // Let the requests still in flight come back before the clients go.
+    std::this_thread::sleep_for(std::chrono::milliseconds(500));
+
+    Figures figures;
+    figures.reportsPerSecond = done / elapsed;
+    figures.errors = errors;
+    std::lock_guard lock(latencyMutex);
+    std::sort(latencies.begin(), latencies.end());
+    if (!latencies.empty()) {
+        figures.p50Microseconds = latencies[latencies.size() / 2];
+        figures.p99Microseconds = latencies[std::min(latencies.size() - 1, latencies.size() * 99 / 100)];
+    }
+    return figures;
+}
+
+long peakMemoryKiB(pid_t pid)
+{
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    std::string line;
+    while (std::getline(status, line))
+        if (line.rfind("VmHWM:", 0) == 0)
+            return std::stol(line.substr(6));
+    return -1;
+}
+
+void print(const char* name, const Figures& figures)
+{
+    std::printf("%-8s %12.0f reports/s   p50 %8.1f us   p99 %8.1f us   errors %llu\n", name, figures.reportsPerSecond,
+                figures.p50Microseconds, figures.p99Microseconds, static_cast<unsigned long long>(figures.errors));
+}
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    Options options;
+    for (int i = 1; i + 1 < argc; i += 2) {
+        std::string option = argv[i];
+        if (option == "--connections")
+            options.connections = std::stoi(argv[i + 1]);
+        else if (option == "--in-flight")
+            options.inFlight = std::stoi(argv[i + 1]);
+        else if (option == "--seconds")
+            options.seconds = std::stod(argv[i + 1]);
+        else {
+            std::fprintf(stderr, "usage: mxreporting_load [--connections N] [--in-flight K] [--seconds S]\n");
+            return 64;
+        }
+    }
+    std::string pattern = (std::filesystem::temp_directory_path() / "mxreporting-bench-XXXXXX").string();
+    std::filesystem::path root = mkdtemp(pattern.data());
+
+    // Both servers are forked before this process starts any thread.
+    std::filesystem::path echoSocket = root / "echo.sock";
+    pid_t echo = fork();
+    if (echo == 0)
+        bench::runEchoServer(echoSocket);
+    pid_t daemon = fork();
+    if (daemon == 0) {
+        setenv("MXREPORTING_ROOT", root.c_str(), 1);
+        unsetenv("JOURNAL_STREAM");
+        freopen((root / "daemon.log").c_str(), "w", stderr);
+        execl(MXREPORTINGD_PATH, MXREPORTINGD_PATH, nullptr);
+        _exit(127);
+    }
+    std::filesystem::path daemonSocket = root / "run/harmonia/reporting.sock";
+    if (!waitForSocket(echoSocket) || !waitForSocket(daemonSocket)) {
+        std::fprintf(stderr, "servers did not come up\n");
+        return 1;
+    }
+
+    std::printf("%d connections x %d in flight, %.0f s each, 7-key reports (sendMessage to one started session)\n",
+                options.connections, options.inFlight, options.seconds);
+    Figures ceiling = drive(echoSocket, options, false);
+    print("echo", ceiling);
+    Figures daemonFigures = drive(daemonSocket, options, true);
+    print("daemon", daemonFigures);
+    std::printf("daemon/echo: throughput %.2f, p99 %.2f; daemon peak memory %ld KiB\n",
+                daemonFigures.reportsPerSecond / ceiling.reportsPerSecond,
+                daemonFigures.p99Microseconds / ceiling.p99Microseconds, peakMemoryKiB(daemon));
+
+    ::kill(echo, SIGKILL);
+    ::kill(daemon, SIGTERM);
+    waitpid(echo, nullptr, 0);
+    waitpid(daemon, nullptr, 0);
+    std::filesystem::remove_all(root);
+    return 0;
+}
