@@ -1,0 +1,166 @@
+#include "Statistics/Service/MxReportingServiceDelegate.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "fakes/FakePlatform.h"
+#include "fakes/FakeServiceHost.h"
+
+namespace mx::testing {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+
+class NoListener final : public ServiceListener {
+public:
+    void setDelegate(std::shared_ptr<ServiceListenerDelegate>) override {}
+    void resume() override {}
+};
+
+class MxReportingServiceDelegateTest : public ::testing::Test {
+protected:
+    std::shared_ptr<FakeServiceConnection> accept(pid_t pid)
+    {
+        auto connection = std::make_shared<FakeServiceConnection>(pid);
+        EXPECT_TRUE(root->shouldAcceptNewConnection(listener, connection));
+        EXPECT_TRUE(connection->resumed);
+        return connection;
+    }
+
+    static MxReportingServerInstance& instance(const FakeServiceConnection& connection)
+    {
+        return static_cast<MxReportingServerInstance&>(*connection.exported);
+    }
+
+    void run() { platform.dispatch.runUntilIdle(); }
+
+    // The client list belongs to the server queue.
+    std::vector<std::shared_ptr<MxReportingServerInstance>> clients()
+    {
+        std::vector<std::shared_ptr<MxReportingServerInstance>> clients;
+        root->serverQueue()->dispatch([&] { clients = root->getAllClients(); });
+        run();
+        return clients;
+    }
+
+    FakePlatform platform;
+    FakePreferences preferences;
+    FakeNotifications notifications;
+    FakeProcessTable processes;
+    NoListener listener;
+    std::shared_ptr<MxReportingServiceDelegate> root =
+        MxReportingServiceDelegate::make(preferences, notifications, processes);
+};
+
+TEST_F(MxReportingServiceDelegateTest, AcceptedClientsAreRegisteredInOrderWithNameAndStartDate)
+{
+    processes.names[7] = "player";
+    auto before = std::chrono::system_clock::now();
+    auto first = accept(7);
+    auto own = accept(1000);
+    auto nameless = accept(0);
+    EXPECT_THAT(platform.log.texts(), ::testing::Contains("newConnection: <fake connection 7>"));
+    run();
+    auto clients = this->clients();
+    ASSERT_EQ(clients.size(), 3u);
+    EXPECT_EQ(clients[0].get(), &instance(*first));
+    EXPECT_EQ(clients[0]->clientProcessName(), "player");
+    EXPECT_GE(*clients[0]->clientStartDate(), before);
+    EXPECT_EQ(clients[1]->clientProcessName(), "mxreportingd");
+    EXPECT_EQ(clients[2]->clientProcessName(), std::nullopt);
+    EXPECT_TRUE(platform.log.contains("notify setup result 0"));
+}
+
+TEST_F(MxReportingServiceDelegateTest, LookupAcrossClientsFollowsConnectionOrderAndTheSwitch)
+{
+    auto first = accept(1);
+    auto second = accept(2);
+    run();
+    instance(*second).createReportingSession(5, [](bool) {});
+    instance(*first).createReportingSession(0, [](bool) {});
+    run();
+    platform.log.clear();
+    std::shared_ptr<MxReportingSession> found, zero, missing;
+    found = root->findReportingSessionForID(5);
+    zero = root->findReportingSessionForID(0);
+    missing = root->findReportingSessionForID(9);
+    ASSERT_TRUE(found);
+    EXPECT_EQ(found->reporterID(), 5);
+    EXPECT_FALSE(zero);
+    EXPECT_FALSE(missing);
+    EXPECT_THAT(platform.log.texts(), ElementsAre("found reporting session 5 for client 2",
+                                                  "failed to find reporting session 9"));
+}
+
+TEST_F(MxReportingServiceDelegateTest, NotificationReReadsDefaultsPushesThemAndSetsTheSwitch)
+{
+    auto client = accept(1);
+    run();
+    instance(*client).createReportingSession(5, [](bool) {});
+    run();
+    preferences.domains["com.kestrel.harmonia"] = Dictionary{{"disable_reporting", true}, {"device_name", "den"}};
+    EXPECT_TRUE(root->isReportingEnabled()) << "nothing is read before the notification";
+
+    notifications.deliver(999);
+    run();
+    EXPECT_TRUE(root->isReportingEnabled()) << "another token is ignored";
+    EXPECT_FALSE(root->getDefaults());
+
+    notifications.post("com.kestrel.harmonia.reporting");
+    run();
+    EXPECT_FALSE(root->isReportingEnabled());
+    EXPECT_EQ(root->getDefaults(), (Dictionary{{"device_name", "den"}, {"disable_reporting", 1}}));
+    auto session = instance(*client).clientReportingSessionMap().at(5);
+    EXPECT_EQ(session->userInfo()->find("device_name"), Value("den"));
+    EXPECT_TRUE(platform.log.contains("re-reading harmonia defaults"));
+
+    preferences.domains["com.kestrel.harmonia"] = Dictionary{};
+    notifications.post("com.kestrel.harmonia.reporting");
+    run();
+    EXPECT_TRUE(root->isReportingEnabled()) << "an unset key switches reporting back on";
+    EXPECT_EQ(root->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
+}
+
+TEST_F(MxReportingServiceDelegateTest, InvalidationStopsTheClientAndReportsItsUptime)
+{
+    processes.names[7] = "player";
+    auto connection = accept(7);
+    run();
+    instance(*connection).setClientStartDate(std::chrono::system_clock::now() - std::chrono::milliseconds(1500));
+    connection->invalidation();
+    run();
+    EXPECT_THAT(clients(), IsEmpty());
+    auto events = platform.tally.events();
+    ASSERT_EQ(events.size(), 1u);
+    EXPECT_EQ(events[0].name, "com.kestrel.harmonia.mxreportingclientuptime");
+    EXPECT_EQ(*events[0].payload.find("processName"), Value("player"));
+    double seconds = events[0].payload.find("seconds")->doubleValue();
+    EXPECT_GE(seconds, 1.5);
+    EXPECT_LT(seconds, 5.0);
+    EXPECT_TRUE(platform.log.contains("InvalidationHandler: connection exited process=player uptime_sec=1"));
+}
+
+TEST_F(MxReportingServiceDelegateTest, UptimeOfClientsWithoutNameOrDateOrInstance)
+{
+    auto nameless = accept(0);
+    auto future = accept(1000);
+    run();
+    instance(*future).setClientStartDate(std::chrono::system_clock::now() + std::chrono::seconds(30));
+    nameless->invalidation();
+    future->invalidation();
+    root->reportClientUptime({}, 77);
+    run();
+
+    EXPECT_TRUE(platform.log.contains("clientProcessName is nil. clientpid=0"));
+    EXPECT_TRUE(platform.log.contains("clientStartDate is in the past. clientpid=1000 clientprocessname=mxreportingd"));
+    EXPECT_TRUE(platform.log.contains("clientStartDate is nil. clientpid=77 clientprocessname=unknown"));
+    EXPECT_TRUE(platform.log.contains("InvalidationHandler: connection exited process=(null) uptime_sec=-1"));
+    EXPECT_TRUE(platform.log.contains("clientProcessName is nil. clientpid=77"));
+    auto events = platform.tally.events();
+    ASSERT_EQ(events.size(), 1u) << "only the named client is reported";
+    EXPECT_GE(events[0].payload.find("seconds")->doubleValue(), 29.0) << "never negative";
+}
+
+} // namespace
+} // namespace mx::testing
