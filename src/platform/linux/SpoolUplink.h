@@ -1,8 +1,9 @@
 #pragma once
 // The embedded reporting backend: backend sessions and their messages spooled into
-// uplink.db. A batch session's messages are held until its flush and then written
-// together; a realtime session's go in at once. One-shot messages carry their own
-// session and user information and belong to no session row.
+// uplink.db as they come, so that nothing a session was given is lost with the
+// process. A batch session is complete once its row has a flush time; exporters
+// hold its messages until then and send a realtime session's at once. One-shot
+// messages carry their own session and user information and belong to no session.
 // Thread-safe; completions run on the global utility queue.
 
 #include <atomic>

@@ -8,18 +8,8 @@
 
 namespace mx {
 
-namespace {
-
-bool containsRealtimeEvents(const Dictionary& sessionInfo)
-{
-    const Value* realtime = sessionInfo.find(kUplinkSessionInfoContainsRealtimeEvents);
-    return realtime && realtime->boolValue();
-}
-
-} // namespace
-
 SpoolUplinkSession::SpoolUplinkSession(SqliteStore& store, std::int64_t id, Dictionary sessionInfo, Dictionary userInfo)
-    : store_(store), id_(id), realtime_(containsRealtimeEvents(sessionInfo))
+    : store_(store), id_(id)
 {
     store_.submit({SpoolUplink::kInsertSession,
                    {id_, std::move(sessionInfo), std::move(userInfo), secondsSinceEpoch()}});
@@ -42,25 +32,12 @@ SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t
 bool SpoolUplinkSession::sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,
                                      std::optional<UplinkError>&)
 {
-    auto row = messageRow(category, type, payload);
-    if (realtime_) {
-        store_.submit(std::move(row));
-        return true;
-    }
-    std::lock_guard lock(mutex_);
-    held_.push_back(std::move(row));
+    store_.submit(messageRow(category, type, payload));
     return true;
 }
 
 void SpoolUplinkSession::flushMessages(UniqueFunction<void(std::optional<UplinkError>)> completion)
 {
-    std::vector<SqliteWrite> held;
-    {
-        std::lock_guard lock(mutex_);
-        held.swap(held_);
-    }
-    for (auto& row : held)
-        store_.submit(std::move(row));
     store_.submit({SpoolUplink::kFlushSession, {secondsSinceEpoch(), id_}});
     ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
         [completion = std::move(completion)]() mutable { completion(std::nullopt); });

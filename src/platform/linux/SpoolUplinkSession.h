@@ -25,9 +25,6 @@ private:
 
     SqliteStore& store_;
     const std::int64_t id_;
-    const bool realtime_;
-    std::mutex mutex_;
-    std::vector<SqliteWrite> held_;
 };
 
 } // namespace mx
