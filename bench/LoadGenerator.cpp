@@ -5,6 +5,8 @@
 // latency, the daemon's peak memory and the ratios to the echo.
 //
 //   mxreporting_load [--connections N] [--in-flight K] [--seconds S]
+//   MXREPORTING_BENCH_TALLY_JSON='{"disabled":["com"]}' gives the daemon that tally.json, to
+//   see what the analytics store costs.
 
 #include <algorithm>
 #include <atomic>
@@ -187,6 +189,10 @@ int main(int argc, char** argv)
     }
     std::string pattern = (std::filesystem::temp_directory_path() / "mxreporting-bench-XXXXXX").string();
     std::filesystem::path root = mkdtemp(pattern.data());
+    if (const char* tally = std::getenv("MXREPORTING_BENCH_TALLY_JSON")) {
+        std::filesystem::create_directories(root / "etc/harmonia");
+        std::ofstream(root / "etc/harmonia/tally.json") << tally;
+    }
 
     // Both servers are forked before this process starts any thread.
     std::filesystem::path echoSocket = root / "echo.sock";
