@@ -22,7 +22,7 @@
 #include "client/MxReportingClient.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/JsonPreferences.h"
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 #include "platform/linux/RootPath.h"
 
 using namespace mx;

@@ -29,6 +29,7 @@ public:
     FakeUplink uplink;
     FakeDeviceProperties device;
     FakeDispatch dispatch;
+    FakeFileSystem files;
 
 private:
     ScopedInstall<MxLogSink> installLog_{log};
@@ -38,6 +39,7 @@ private:
     ScopedInstall<Uplink> installUplink_{uplink};
     ScopedInstall<DeviceProperties> installDevice_{device};
     ScopedInstall<Dispatch> installDispatch_{dispatch};
+    ScopedInstall<FileSystem> installFiles_{files};
 };
 
 } // namespace mx::testing

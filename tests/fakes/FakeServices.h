@@ -10,6 +10,7 @@
 #include <fmt/format.h>
 
 #include "platform/DeviceProperties.h"
+#include "platform/FileSystem.h"
 #include "platform/Joule.h"
 #include "platform/Tally.h"
 #include "platform/TracePoints.h"
@@ -156,6 +157,33 @@ private:
     std::map<std::string, bool> bools_;
     std::map<std::string, std::int64_t> integers_;
     int queries_ = 0;
+};
+
+// Files kept in memory: what was written where, and directories that fail on demand.
+class FakeFileSystem final : public FileSystem {
+public:
+    std::filesystem::path resolve(const std::string& path) override { return "/root" + path; }
+    std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode) override
+    {
+        std::lock_guard lock(mutex_);
+        directories[directory] = mode;
+        return directoryFailure;
+    }
+    std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents) override
+    {
+        std::lock_guard lock(mutex_);
+        if (directoryFailure)
+            return std::string("No such file or directory");
+        files[file] = std::string(contents);
+        return std::nullopt;
+    }
+
+    std::map<std::filesystem::path, mode_t> directories;
+    std::map<std::filesystem::path, std::string> files;
+    std::optional<std::string> directoryFailure;
+
+private:
+    std::mutex mutex_;
 };
 
 } // namespace mx::testing

@@ -271,6 +271,10 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     for (int i = 0; i < 50; ++i)
         EXPECT_EQ(nlohmann::json::parse(messages[i][2])["seq"], i);
     EXPECT_EQ(messages[50][1], "65535") << "the summary event comes last";
+    auto summaries = daemon.path("private/var/mobile/Library/Logs/FaultDesk/DiagnosticLogs/Audio/Reporting");
+    ASSERT_TRUE(std::filesystem::is_directory(summaries));
+    auto summary = std::filesystem::directory_iterator(summaries)->path().filename().string();
+    EXPECT_THAT(summary, ::testing::EndsWith("-harmonia-ExampleHost-longformaudio.json"));
     auto alone = daemon.query("uplink", "SELECT payload, user_info FROM messages WHERE session IS NULL");
     ASSERT_EQ(alone.size(), 1u);
     EXPECT_EQ(nlohmann::json::parse(alone[0][1])["ServiceName"], "standalone");

@@ -5,6 +5,8 @@
 #include <fmt/format.h>
 
 #include "Statistics/MxReportingUtilityWait.h"
+#include "platform/FileSystem.h"
+#include "platform/JsonValue.h"
 #include "platform/TracePoints.h"
 
 namespace mx {
@@ -22,6 +24,7 @@ constexpr std::int64_t kUplinkClientType = 19;
 constexpr float kUplinkClientVersion = 2.0f;
 constexpr float kDiscoveryTimeoutSeconds = 9.0f;
 constexpr const char* kUplinkClientName = "com.kestrel.harmonia";
+constexpr const char* kSummaryDirectory = "/private/var/mobile/Library/Logs/FaultDesk/DiagnosticLogs/Audio/Reporting";
 
 // Most payloads carry no spaced key; they are shared as they are, not rebuilt.
 bool hasSpacedKey(const Dictionary& message)
@@ -189,6 +192,7 @@ void MxReportingSession::stop()
         MXLOG(logScope(), Default, "sending summary event for reporter {}", reporterID_);
         sendMessage(*summary, message_category::kSummary, message_type::kSummary, true, nullptr);
     }
+    writeSummaryJson();
 
     uplinkQueue_->dispatch([self = shared_from_this()] { self->flushUplink(); });
 
@@ -340,6 +344,59 @@ std::optional<Dictionary> MxReportingSession::createSummaryEventForSession()
     for (auto& [key, joined] : collected)
         summary.set(key, std::move(joined));
     return summary;
+}
+
+std::string MxReportingSession::summaryFileName(std::time_t now) const
+{
+    std::tm local{};
+    localtime_r(&now, &local);
+    char date[32];
+    std::strftime(date, sizeof(date), "%Y%m%d-%H%M%S%z", &local);
+
+    std::string host = "unknown";
+    if (auto stored = userInfo_->find("HostApplicationDisplayID"))
+        host = stored->description();
+    // The host is the client's text: it must not name another directory, nor make the
+    // name longer than a file name may be.
+    for (char& c : host)
+        if (c == '/' || c == '\0')
+            c = '_';
+    if (host.size() > 128)
+        host.resize(128);
+    return fmt::format("{}-{}-{}-{}.json", date, "harmonia", host, MxReportingServiceTypeName(serviceType()));
+}
+
+void MxReportingSession::writeSummaryJson()
+{
+    if (!MxReportingInternalBuild())
+        return;
+    auto nested = nestedAggregatedPayloadData();
+    if (!nested)
+        return;
+    std::string text;
+    {
+        std::lock_guard lock(nested->monitor());
+        if (nested->items().empty())
+            return;
+        nested->insert(0, userInfo_->snapshot());
+        try {
+            nlohmann::ordered_json document = nlohmann::ordered_json::array();
+            for (const auto& item : nested->items())
+                document.push_back(toJson(item));
+            text = document.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+        } catch (const std::exception& error) {
+            MXLOG(logScope(), Error, "dataWithJSONObject: {}", error.what());
+        }
+    }
+
+    auto& fileSystem = ProcessWide<FileSystem>::get();
+    auto directory = fileSystem.resolve(kSummaryDirectory);
+    if (auto failure = fileSystem.createDirectories(directory, 0777))
+        MXLOG(logScope(), Error, "can't create logging directory at {}: {}", directory.string(), *failure);
+    if (text.empty())
+        return;
+    if (auto failure = fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr)), text))
+        MXLOG(logScope(), Error, "jsonOutput writeToURL: {}", *failure);
 }
 
 void MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArray>& field, Value value)

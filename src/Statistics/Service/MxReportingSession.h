@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <ctime>
 #include <functional>
 #include <map>
 #include <memory>
@@ -98,6 +99,12 @@ public:
     // Every key that occurred in this period's payloads, with all of its values in
     // text form joined by ","; nothing when nothing was aggregated.
     std::optional<Dictionary> createSummaryEventForSession();
+    // On internal builds: the user information and every message of this period, as
+    // pretty-printed JSON in the summary directory. Nothing when nothing was sent.
+    void writeSummaryJson();
+    // "<local time>-harmonia-<host>-<service type name>.json", the host made safe to
+    // stand in one file name.
+    std::string summaryFileName(std::time_t now) const;
 
     std::string description() const;
 

@@ -19,6 +19,7 @@
 #include "platform/linux/JsonDeviceProperties.h"
 #include "platform/linux/JsonPreferences.h"
 #include "platform/linux/MsgpackRpcListener.h"
+#include "platform/linux/PosixFileSystem.h"
 #include "platform/linux/ProcProcessTable.h"
 #include "platform/linux/RootPath.h"
 #include "platform/linux/SpoolUplink.h"
@@ -70,6 +71,8 @@ int main(int argc, char** argv)
     ProcessWide<TracePoints>::install(&tracePoints);
     AsioDispatch dispatch;
     ProcessWide<Dispatch>::install(&dispatch);
+    PosixFileSystem fileSystem;
+    ProcessWide<FileSystem>::install(&fileSystem);
     JsonDeviceProperties deviceProperties(MxReportingPath("etc/harmonia/device.json"));
     ProcessWide<DeviceProperties>::install(&deviceProperties);
 

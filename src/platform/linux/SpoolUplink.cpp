@@ -2,7 +2,7 @@
 
 #include <random>
 
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 #include "platform/linux/SpoolUplinkSession.h"
 
 namespace mx {

@@ -3,7 +3,7 @@
 #include <fmt/format.h>
 
 #include "platform/WorkQueue.h"
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 #include "platform/linux/SpoolUplink.h"
 
 namespace mx {

@@ -1,6 +1,6 @@
 #include "platform/linux/SqliteJoule.h"
 
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 
 namespace mx {
 

@@ -5,7 +5,7 @@
 #include <sqlite3.h>
 
 #include "platform/MxLog.h"
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 
 namespace mx {
 

@@ -4,7 +4,7 @@
 #include <fstream>
 
 #include "platform/MxLog.h"
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 
 namespace mx {
 

@@ -1,4 +1,4 @@
-#include "platform/linux/JsonValue.h"
+#include "platform/JsonValue.h"
 
 #include <cmath>
 

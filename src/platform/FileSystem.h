@@ -1,0 +1,28 @@
+#pragma once
+// The file system as the daemon writes to it: fixed platform paths placed under this
+// host's root, directories made with exact permissions, files replaced atomically.
+
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <sys/types.h>
+
+#include "platform/ProcessWide.h"
+
+namespace mx {
+
+class FileSystem {
+public:
+    virtual ~FileSystem() = default;
+    // Where the platform path `path` ("/private/var/...") lives on this host.
+    virtual std::filesystem::path resolve(const std::string& path) = 0;
+    // Creates `directory` and every missing parent with exactly `mode`; an existing
+    // directory is success. The reason on failure.
+    virtual std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode) = 0;
+    // Replaces `file` with `contents` so that readers see the old file or the new one,
+    // never a part. The reason on failure.
+    virtual std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents) = 0;
+};
+
+} // namespace mx
