@@ -6,6 +6,7 @@
 // Exit status: 0 done; 1 the daemon refused or failed an operation; 2 the daemon
 // cannot be reached; 64 bad usage.
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <fstream>
@@ -18,6 +19,7 @@
 
 #include <fmt/format.h>
 
+#include "MxReportStoreView.h"
 #include "Statistics/MxReportingVocabulary.h"
 #include "client/MxReportingClient.h"
 #include "platform/linux/DatagramNotifications.h"
@@ -59,6 +61,12 @@ Preferences (domain com.kestrel.harmonia) and notifications:
   defaults write KEY VALUE          VALUE as JSON (true, 3, "name"), else as a string
   defaults delete KEY
   notify [NAME]                     post NAME (default com.kestrel.harmonia.reporting)
+
+What the stores hold (newest last; --json for one JSON object a line):
+  events [--limit N] [--json]       analytics events (tally.db)
+  power [--limit N] [--json]        power log events (joule.db)
+  sessions [--limit N] [--json]     backend sessions (uplink.db)
+  messages [--limit N] [--json]     backend messages (uplink.db)
 
   demo                              play a realistic session and show what happens
   help                              this text
@@ -334,9 +342,26 @@ int demo(MxReportingClient& client)
             return kExitRefused;
         std::fflush(stdout);
     }
-    std::printf("\nThe daemon wrote analytics events to var/lib/harmonia/tally.db, a power log event to\n"
-                "joule.db and the backend session with its messages and summary to uplink.db.\n");
+    std::printf("\nSee what the daemon stored: mxreport events, mxreport power, mxreport sessions,\n"
+                "mxreport messages (add --json for machine-readable lines).\n");
     return 0;
+}
+
+std::optional<MxReportStoreQuery> storeQuery(const std::vector<std::string>& words)
+{
+    static const std::vector<std::string> stores = {"events", "power", "sessions", "messages"};
+    if (std::find(stores.begin(), stores.end(), words[0]) == stores.end())
+        return std::nullopt;
+    MxReportStoreQuery query{words[0]};
+    for (std::size_t i = 1; i < words.size(); ++i) {
+        if (words[i] == "--json")
+            query.json = true;
+        else if (words[i] == "--limit" && i + 1 < words.size())
+            query.limit = static_cast<std::size_t>(std::max<std::int64_t>(0, parseInteger(words[++i], "limit")));
+        else
+            throw UsageError{fmt::format("{} takes --limit N and --json", words[0])};
+    }
+    return query;
 }
 
 std::vector<std::vector<std::string>> splitCommands(const std::vector<std::string>& words)
@@ -382,6 +407,8 @@ int main(int argc, char** argv)
             return defaults(commands[0]);
         if (commands[0][0] == "notify")
             return notify(commands[0]);
+        if (auto store = storeQuery(commands[0]))
+            return printStore(MxReportingPath("var/lib/harmonia"), *store);
 
         std::string error;
         auto client = MxReportingClient::connect(socket, error);

@@ -282,3 +282,41 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
 
 } // namespace
 } // namespace mx::testing
+
+namespace mx::testing {
+namespace {
+
+TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
+{
+    auto client = connect();
+    ASSERT_TRUE(*client->createReportingSession(3).value);
+    client->startReportingSessionForID(3, nullptr);
+    for (int i = 0; i < 500; ++i)
+        ASSERT_TRUE(client->sendMessage(Dictionary{{"seq", i}}, 3, 1, std::vector<ReporterID>{3}));
+    auto committed = [&](const std::string& store, const std::string& table) {
+        auto rows = daemon.query(store, "SELECT count(*) FROM " + table);
+        return rows.empty() ? 0 : std::stoi(rows[0][0]);
+    };
+    ASSERT_TRUE(waitUntil([&] { return committed("tally", "events") == 500 && committed("uplink", "messages") == 500; }));
+    // Keep the daemon busy while it dies.
+    for (int i = 0; i < 200; ++i)
+        client->sendMessage(Dictionary{{"late", i}}, 3, 1, std::vector<ReporterID>{3}, nullptr);
+    daemon.signal(SIGKILL);
+    EXPECT_EQ(daemon.waitForExit(), 128 + SIGKILL);
+
+    for (const auto& store : {"tally", "joule", "uplink"})
+        EXPECT_EQ(daemon.query(store, "PRAGMA integrity_check")[0][0], "ok") << store;
+    EXPECT_GE(committed("tally", "events"), 500);
+    EXPECT_GE(committed("uplink", "messages"), 500);
+
+    daemon.start();
+    auto again = connect();
+    ASSERT_TRUE(*again->createReportingSession(4).value);
+    again->startReportingSessionForID(4, nullptr);
+    ASSERT_TRUE(*again->stopReportingSessionForID(4).value);
+    EXPECT_TRUE(waitUntil([&] { return daemon.query("uplink", "SELECT count(*) FROM sessions")[0][0] == "2"; }))
+        << "backend sessions go on numbering after the crash";
+}
+
+} // namespace
+} // namespace mx::testing

@@ -70,6 +70,8 @@ pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments) const
 void DaemonProcess::start()
 {
     std::string log = (root_ / "daemon.log").string();
+    // Emptied here, not in the child: a restart must not find the last run's banner.
+    std::ofstream(log, std::ios::trunc).close();
     pid_ = fork();
     if (pid_ == 0) {
         setenv("MXREPORTING_ROOT", root_.c_str(), 1);
