@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include <asio/signal_set.hpp>
+#include <curl/curl.h>
 #include <systemd/sd-daemon.h>
 
 #include "Statistics/Service/MxReportingServiceDelegate.h"
@@ -86,7 +87,9 @@ int main(int argc, char** argv)
     if (!joule)
         fail(error);
     ProcessWide<Joule>::install(joule.get());
-    auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), error);
+    curl_global_init(CURL_GLOBAL_DEFAULT);
+    auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"),
+                                    MxReportingPath("etc/harmonia/uplink.json"), error);
     if (!uplink)
         fail(error);
     ProcessWide<Uplink>::install(uplink.get());

@@ -1,20 +1,65 @@
 #include "platform/linux/SpoolUplink.h"
 
+#include <fstream>
 #include <random>
+
+#include <nlohmann/json.hpp>
 
 #include "platform/JsonValue.h"
 #include "platform/linux/SpoolUplinkSession.h"
 
 namespace mx {
 
-std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& database, std::string& error)
+namespace {
+
+// Reads uplink.json; false, with `error`, when it is there but unusable.
+bool readBackends(const std::filesystem::path& configuration, bool& spoolListed, std::vector<std::string>& collectors,
+                  std::string& error)
 {
+    std::ifstream stream(configuration);
+    if (!stream) {
+        spoolListed = true;
+        return true;
+    }
+    auto json = nlohmann::json::parse(stream, nullptr, false);
+    if (json.is_discarded() || !json.is_object() || !json.contains("backends") || !json["backends"].is_array()) {
+        error = configuration.string() + ": expected {\"backends\": [...]}";
+        return false;
+    }
+    spoolListed = false;
+    for (const auto& backend : json["backends"]) {
+        std::string type = backend.is_object() ? backend.value("type", "") : "";
+        if (type == "spool") {
+            spoolListed = true;
+        } else if (type == "otlp-http" && backend.contains("url") && backend["url"].is_string()) {
+            collectors.push_back(backend["url"].get<std::string>());
+        } else {
+            error = configuration.string() + ": unknown backend " + backend.dump();
+            return false;
+        }
+    }
+    return true;
+}
+
+constexpr auto kSettleTimeout = std::chrono::seconds(10);
+
+} // namespace
+
+std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& database,
+                                               const std::filesystem::path& configuration, std::string& error)
+{
+    bool spoolListed = false;
+    std::vector<std::string> collectors;
+    if (!readBackends(configuration, spoolListed, collectors, error))
+        return nullptr;
     auto store = SqliteStore::open(
         database,
         {"CREATE TABLE IF NOT EXISTS sessions(id INTEGER PRIMARY KEY, session_info TEXT, user_info TEXT, "
          "opened REAL, flushed REAL)",
          "CREATE TABLE IF NOT EXISTS messages(id INTEGER PRIMARY KEY, session INTEGER NULL, time REAL, "
-         "category INTEGER, type INTEGER, payload TEXT, session_info TEXT NULL, user_info TEXT NULL)"},
+         "category INTEGER, type INTEGER, payload TEXT, session_info TEXT NULL, user_info TEXT NULL)",
+         "CREATE TABLE IF NOT EXISTS exports(backend TEXT PRIMARY KEY, stream_cursor INTEGER)",
+         "CREATE TABLE IF NOT EXISTS exported_sessions(backend TEXT, session INTEGER, PRIMARY KEY(backend, session))"},
         {"INSERT INTO sessions(id, session_info, user_info, opened) VALUES(?, ?, ?, ?)",
          "UPDATE sessions SET flushed = ? WHERE id = ?",
          "INSERT INTO messages(session, time, category, type, payload, session_info, user_info) "
@@ -22,12 +67,43 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
         error);
     if (!store)
         return nullptr;
-    return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store)));
+    return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store), spoolListed, collectors));
 }
 
-SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store)
-    : store_(std::move(store)), lastSessionID_(store_->queryInteger("SELECT max(id) FROM sessions"))
+SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed, const std::vector<std::string>& collectors)
+    : store_(std::move(store)),
+      lastSessionID_(store_->queryInteger("SELECT max(id) FROM sessions")),
+      spoolListed_(spoolListed)
 {
+    for (const auto& url : collectors)
+        exporters_.push_back(std::make_unique<OtlpHttpExporter>(store_->path(), url));
+}
+
+SpoolUplink::~SpoolUplink() = default;
+
+std::vector<std::string> SpoolUplink::discoverBackends()
+{
+    std::vector<std::string> answered;
+    if (spoolListed_)
+        answered.push_back("spool");
+    for (auto& exporter : exporters_)
+        if (exporter->probe())
+            answered.push_back(exporter->url());
+    return answered;
+}
+
+std::optional<UplinkError> SpoolUplink::settleSession(std::int64_t session, bool realtime)
+{
+    if (exporters_.empty())
+        return std::nullopt;
+    // The exporters read the spool: the session's rows must be committed first.
+    store_->flush();
+    for (auto& exporter : exporters_) {
+        auto error = realtime ? exporter->currentError() : exporter->waitForSession(session, kSettleTimeout);
+        if (error)
+            return error;
+    }
+    return std::nullopt;
 }
 
 UplinkSecureHierarchyToken SpoolUplink::newSecureHierarchyToken(const UplinkSecureHierarchyToken*)
@@ -50,15 +126,23 @@ std::shared_ptr<UplinkSession> SpoolUplink::makeSession(Dictionary sessionInfo, 
     // Ids are handed out here, not by SQLite, so that messages can name their session
     // before the session row is committed.
     std::int64_t id = ++lastSessionID_;
-    return std::make_shared<SpoolUplinkSession>(*store_, id, std::move(sessionInfo), std::move(userInfo));
+    return std::make_shared<SpoolUplinkSession>(shared_from_this(), id, std::move(sessionInfo), std::move(userInfo));
 }
 
 bool SpoolUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std::uint16_t category,
-                                 std::uint16_t type, Dictionary payload, std::optional<UplinkError>&)
+                                 std::uint16_t type, Dictionary payload, std::optional<UplinkError>& error)
 {
     store_->submit({kInsertMessage,
                     {nullptr, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, std::move(payload),
                      std::move(sessionInfo), std::move(userInfo)}});
+    for (auto& exporter : exporters_) {
+        exporter->wake();
+        // Spooled all the same: the exporter sends it once the collector is back.
+        if (auto failing = exporter->currentError()) {
+            error = UplinkError{failing->code, failing->description + " (message kept in the spool)"};
+            return false;
+        }
+    }
     return true;
 }
 

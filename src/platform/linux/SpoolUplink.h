@@ -4,6 +4,9 @@
 // process. A batch session is complete once its row has a flush time; exporters
 // hold its messages until then and send a realtime session's at once. One-shot
 // messages carry their own session and user information and belong to no session.
+// Backends come from uplink.json: {"backends": [{"type": "spool"},
+// {"type": "otlp-http", "url": "http://127.0.0.1:4318/v1/logs"}]}; the spool is always
+// the store behind them, so a collector that is down loses nothing.
 // Thread-safe; completions run on the global utility queue.
 
 #include <atomic>
@@ -11,13 +14,18 @@
 #include <memory>
 
 #include "platform/Uplink.h"
+#include "platform/linux/OtlpHttpExporter.h"
 #include "platform/linux/SqliteStore.h"
 
 namespace mx {
 
 class SpoolUplink final : public Uplink, public std::enable_shared_from_this<SpoolUplink> {
 public:
-    static std::shared_ptr<SpoolUplink> open(const std::filesystem::path& database, std::string& error);
+    // The spool at `database`, exporting to the backends that `configuration`
+    // (uplink.json) lists; without that file, the spool alone.
+    static std::shared_ptr<SpoolUplink> open(const std::filesystem::path& database,
+                                             const std::filesystem::path& configuration, std::string& error);
+    ~SpoolUplink() override;
 
     UplinkSecureHierarchyToken newSecureHierarchyToken(const UplinkSecureHierarchyToken* parent) override;
     std::shared_ptr<UplinkSession> makeSession(Dictionary sessionInfo, Dictionary userInfo,
@@ -27,13 +35,22 @@ public:
 
     SqliteStore& store() { return *store_; }
 
+    // The backends that answer now: "spool" when it is listed, and every collector
+    // that responds. Blocks for the probes; backend threads only.
+    std::vector<std::string> discoverBackends();
+    // Waits (bounded) until the exporters hold the session's messages acknowledged,
+    // or for their error; for a realtime session only their current error.
+    std::optional<UplinkError> settleSession(std::int64_t session, bool realtime);
+
     enum Statement : std::size_t { kInsertSession, kFlushSession, kInsertMessage };
 
 private:
-    explicit SpoolUplink(std::unique_ptr<SqliteStore> store);
+    SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed, const std::vector<std::string>& collectors);
 
     std::unique_ptr<SqliteStore> store_;
     std::atomic<std::int64_t> lastSessionID_;
+    bool spoolListed_;
+    std::vector<std::unique_ptr<OtlpHttpExporter>> exporters_;
 };
 
 } // namespace mx

@@ -8,8 +8,19 @@
 
 namespace mx {
 
-SpoolUplinkSession::SpoolUplinkSession(SqliteStore& store, std::int64_t id, Dictionary sessionInfo, Dictionary userInfo)
-    : store_(store), id_(id)
+namespace {
+
+bool containsRealtimeEvents(const Dictionary& sessionInfo)
+{
+    const Value* realtime = sessionInfo.find(kUplinkSessionInfoContainsRealtimeEvents);
+    return realtime && realtime->boolValue();
+}
+
+} // namespace
+
+SpoolUplinkSession::SpoolUplinkSession(std::shared_ptr<SpoolUplink> uplink, std::int64_t id, Dictionary sessionInfo,
+                                       Dictionary userInfo)
+    : uplink_(std::move(uplink)), store_(uplink_->store()), id_(id), realtime_(containsRealtimeEvents(sessionInfo))
 {
     store_.submit({SpoolUplink::kInsertSession,
                    {id_, std::move(sessionInfo), std::move(userInfo), secondsSinceEpoch()}});
@@ -17,9 +28,15 @@ SpoolUplinkSession::SpoolUplinkSession(SqliteStore& store, std::int64_t id, Dict
 
 void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
 {
-    // The spool is always there to answer.
     ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
-        [completion = std::move(completion)]() mutable { completion(std::vector<std::string>{"spool"}); });
+        [uplink = uplink_, completion = std::move(completion)]() mutable {
+            ScopedBlockingCall probing;
+            auto backends = uplink->discoverBackends();
+            if (backends.empty())
+                completion(std::nullopt);
+            else
+                completion(std::move(backends));
+        });
 }
 
 SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const
@@ -40,7 +57,10 @@ void SpoolUplinkSession::flushMessages(UniqueFunction<void(std::optional<UplinkE
 {
     store_.submit({SpoolUplink::kFlushSession, {secondsSinceEpoch(), id_}});
     ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
-        [completion = std::move(completion)]() mutable { completion(std::nullopt); });
+        [uplink = uplink_, id = id_, realtime = realtime_, completion = std::move(completion)]() mutable {
+            ScopedBlockingCall settling;
+            completion(uplink->settleSession(id, realtime));
+        });
 }
 
 std::string SpoolUplinkSession::description() const { return fmt::format("<spool session {}>", id_); }

@@ -10,9 +10,12 @@
 
 namespace mx {
 
+class SpoolUplink;
+
 class SpoolUplinkSession final : public UplinkSession {
 public:
-    SpoolUplinkSession(SqliteStore& store, std::int64_t id, Dictionary sessionInfo, Dictionary userInfo);
+    SpoolUplinkSession(std::shared_ptr<SpoolUplink> uplink, std::int64_t id, Dictionary sessionInfo,
+                       Dictionary userInfo);
 
     void startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion) override;
     void flushMessages(UniqueFunction<void(std::optional<UplinkError>)> completion) override;
@@ -23,8 +26,10 @@ public:
 private:
     SqliteWrite messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const;
 
+    const std::shared_ptr<SpoolUplink> uplink_;
     SqliteStore& store_;
     const std::int64_t id_;
+    const bool realtime_;
 };
 
 } // namespace mx

@@ -1,0 +1,356 @@
+#include "platform/linux/OtlpHttpExporter.h"
+
+#include <algorithm>
+#include <cmath>
+#include <set>
+
+#include <curl/curl.h>
+#include <fmt/format.h>
+#include <nlohmann/json.hpp>
+#include <pthread.h>
+#include <sqlite3.h>
+
+#include "platform/MxLog.h"
+
+namespace mx {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+constexpr std::size_t kBatchMessages = 512;
+constexpr auto kIdlePoll = std::chrono::milliseconds(200);
+constexpr auto kFirstBackoff = std::chrono::seconds(1);
+constexpr auto kLongestBackoff = std::chrono::seconds(60);
+
+Json anyValue(const Json& value)
+{
+    if (value.is_string())
+        return {{"stringValue", value.get<std::string>()}};
+    if (value.is_boolean())
+        return {{"boolValue", value.get<bool>()}};
+    if (value.is_number_integer())
+        return {{"intValue", std::to_string(value.get<std::int64_t>())}};
+    if (value.is_number_unsigned())
+        return {{"intValue", std::to_string(value.get<std::uint64_t>())}};
+    if (value.is_number_float())
+        return {{"doubleValue", value.get<double>()}};
+    if (value.is_array()) {
+        Json values = Json::array();
+        for (const auto& item : value)
+            values.push_back(anyValue(item));
+        return {{"arrayValue", {{"values", values}}}};
+    }
+    if (value.is_object()) {
+        Json values = Json::array();
+        for (const auto& [key, item] : value.items())
+            values.push_back({{"key", key}, {"value", anyValue(item)}});
+        return {{"kvlistValue", {{"values", values}}}};
+    }
+    return Json::object();
+}
+
+Json attribute(const std::string& key, const Json& value) { return {{"key", key}, {"value", anyValue(value)}}; }
+
+Json parsed(const unsigned char* text)
+{
+    if (!text)
+        return nullptr;
+    auto json = Json::parse(reinterpret_cast<const char*>(text), nullptr, false);
+    return json.is_discarded() ? Json(nullptr) : json;
+}
+
+// One spooled message as an OTLP log record: the payload is the body, the rest
+// (category, type, session and its information) are attributes.
+Json logRecord(sqlite3_stmt* row)
+{
+    double time = sqlite3_column_double(row, 1);
+    auto nanos = std::to_string(static_cast<std::int64_t>(std::llround(time * 1e9)));
+    Json sessionInfo = parsed(sqlite3_column_text(row, 5));
+    Json userInfo = parsed(sqlite3_column_text(row, 6));
+    Json attributes = Json::array({attribute("harmonia.category", sqlite3_column_int64(row, 2)),
+                                   attribute("harmonia.type", sqlite3_column_int64(row, 3))});
+    if (sqlite3_column_type(row, 7) != SQLITE_NULL)
+        attributes.push_back(attribute("harmonia.spool_session", sqlite3_column_int64(row, 7)));
+    if (sessionInfo.is_object())
+        for (const auto& [key, value] : sessionInfo.items())
+            attributes.push_back(attribute("harmonia.session." + key, value));
+    if (userInfo.is_object())
+        for (const auto& [key, value] : userInfo.items())
+            attributes.push_back(attribute("harmonia.user." + key, value));
+    return {{"timeUnixNano", nanos},
+            {"observedTimeUnixNano", nanos},
+            {"severityNumber", 9},
+            {"severityText", "INFO"},
+            {"body", anyValue(parsed(sqlite3_column_text(row, 4)))},
+            {"attributes", attributes}};
+}
+
+std::string logsRequest(const Json& records)
+{
+    Json request = {
+        {"resourceLogs",
+         Json::array({{{"resource", {{"attributes", Json::array({attribute("service.name", "mxreportingd")})}}},
+                       {"scopeLogs", Json::array({{{"scope", {{"name", "com.kestrel.harmonia"}}},
+                                                   {"logRecords", records}}})}}})}};
+    return request.dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
+std::size_t discardBody(char*, std::size_t size, std::size_t count, void*) { return size * count; }
+
+constexpr const char* kSchema[] = {
+    "CREATE TABLE IF NOT EXISTS exports(backend TEXT PRIMARY KEY, stream_cursor INTEGER)",
+    "CREATE TABLE IF NOT EXISTS exported_sessions(backend TEXT, session INTEGER, PRIMARY KEY(backend, session))",
+};
+
+// One-shot messages and realtime sessions' messages, in spool order, past the cursor.
+constexpr const char* kStreamQuery =
+    "SELECT m.id, m.time, m.category, m.type, m.payload, coalesce(s.session_info, m.session_info), "
+    "coalesce(s.user_info, m.user_info), m.session FROM messages m LEFT JOIN sessions s ON s.id = m.session "
+    "WHERE m.id > ?1 AND (m.session IS NULL OR json_extract(s.session_info, '$.ContainsRealtimeEvents') = 1) "
+    "ORDER BY m.id LIMIT ?2";
+constexpr const char* kFlushedSessionsQuery =
+    "SELECT s.id FROM sessions s WHERE s.flushed IS NOT NULL "
+    "AND coalesce(json_extract(s.session_info, '$.ContainsRealtimeEvents'), 0) = 0 "
+    "AND NOT EXISTS (SELECT 1 FROM exported_sessions e WHERE e.backend = ?1 AND e.session = s.id) "
+    "ORDER BY s.id LIMIT 16";
+constexpr const char* kSessionMessagesQuery =
+    "SELECT m.id, m.time, m.category, m.type, m.payload, s.session_info, s.user_info, m.session "
+    "FROM messages m JOIN sessions s ON s.id = m.session WHERE m.session = ?1 AND m.id > ?2 ORDER BY m.id LIMIT ?3";
+
+} // namespace
+
+OtlpHttpExporter::OtlpHttpExporter(std::filesystem::path spool, std::string url)
+    : spool_(std::move(spool)), url_(std::move(url))
+{
+    thread_ = std::thread([this] {
+        pthread_setname_np(pthread_self(), "mx-otlp");
+        run();
+    });
+}
+
+OtlpHttpExporter::~OtlpHttpExporter()
+{
+    {
+        std::lock_guard lock(mutex_);
+        stopping_ = true;
+    }
+    changed_.notify_all();
+    thread_.join();
+}
+
+void OtlpHttpExporter::wake()
+{
+    {
+        std::lock_guard lock(mutex_);
+        woken_ = true;
+    }
+    changed_.notify_all();
+}
+
+std::optional<UplinkError> OtlpHttpExporter::currentError() const
+{
+    std::lock_guard lock(mutex_);
+    return error_;
+}
+
+bool OtlpHttpExporter::probe()
+{
+    CURL* curl = curl_easy_init();
+    if (!curl)
+        return false;
+    std::string body = logsRequest(Json::array());
+    curl_easy_setopt(curl, CURLOPT_URL, url_.c_str());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.c_str());
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT, 3L);
+    curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, discardBody);
+    curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
+    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
+    bool answered = curl_easy_perform(curl) == CURLE_OK;
+    curl_slist_free_all(headers);
+    curl_easy_cleanup(curl);
+    return answered;
+}
+
+std::optional<UplinkError> OtlpHttpExporter::post(const std::string& body, std::chrono::seconds& retryAfter)
+{
+    CURL* curl = curl_easy_init();
+    if (!curl)
+        return UplinkError{-1, "cannot create an HTTP request"};
+    char failure[CURL_ERROR_SIZE] = "";
+    curl_easy_setopt(curl, CURLOPT_URL, url_.c_str());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.c_str());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, 3L);
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT, 15L);
+    curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, failure);
+    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, discardBody);
+    curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
+    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
+    CURLcode result = curl_easy_perform(curl);
+    long status = 0;
+    curl_off_t retry = 0;
+    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+    curl_easy_getinfo(curl, CURLINFO_RETRY_AFTER, &retry);
+    curl_slist_free_all(headers);
+    curl_easy_cleanup(curl);
+    retryAfter = std::chrono::seconds(retry);
+    if (result != CURLE_OK)
+        return UplinkError{result, fmt::format("{}: {}", url_, failure[0] ? failure : curl_easy_strerror(result))};
+    if (status < 200 || status >= 300)
+        return UplinkError{status, fmt::format("{}: HTTP status {}", url_, status)};
+    return std::nullopt;
+}
+
+void OtlpHttpExporter::run()
+{
+    if (sqlite3_open_v2(spool_.c_str(), &database_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) != SQLITE_OK) {
+        MXLOG(nullptr, Error, "otlp exporter cannot open {}: {}", spool_.string(), sqlite3_errmsg(database_));
+        return;
+    }
+    sqlite3_busy_timeout(database_, 5000);
+    for (const char* sql : kSchema)
+        sqlite3_exec(database_, sql, nullptr, nullptr, nullptr);
+
+    auto backoff = kFirstBackoff;
+    for (;;) {
+        std::size_t exported = 0;
+        auto failure = exportBatch(exported);
+        std::chrono::milliseconds pause = kIdlePoll;
+        {
+            std::lock_guard lock(mutex_);
+            bool wasFailing = error_.has_value();
+            error_ = failure;
+            ++passes_;
+            if (failure && !wasFailing)
+                MXLOG(nullptr, Error, "otlp export failing, keeping messages in the spool: {}", failure->description);
+            if (!failure && wasFailing)
+                MXLOG(nullptr, Default, "otlp export to {} recovered", url_);
+        }
+        changed_.notify_all();
+        if (failure) {
+            pause = backoff;
+            backoff = std::min(backoff * 2, kLongestBackoff);
+        } else {
+            backoff = kFirstBackoff;
+            if (exported > 0)
+                pause = std::chrono::milliseconds(0);
+        }
+        std::unique_lock lock(mutex_);
+        changed_.wait_for(lock, pause, [&] { return stopping_ || woken_; });
+        woken_ = false;
+        if (stopping_)
+            break;
+    }
+    sqlite3_close(database_);
+}
+
+std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
+{
+    auto query = [&](const char* sql, auto bind, auto each) {
+        sqlite3_stmt* statement = nullptr;
+        if (sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr) != SQLITE_OK)
+            return false;
+        bind(statement);
+        while (sqlite3_step(statement) == SQLITE_ROW)
+            each(statement);
+        sqlite3_finalize(statement);
+        return true;
+    };
+    auto record = [&](const char* sql, std::int64_t number) {
+        query(sql,
+              [&](sqlite3_stmt* s) {
+                  sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT);
+                  sqlite3_bind_int64(s, 2, number);
+              },
+              [](sqlite3_stmt*) {});
+    };
+    auto send = [&](const Json& records, std::optional<UplinkError>& failure) {
+        std::chrono::seconds retryAfter{0};
+        failure = post(logsRequest(records), retryAfter);
+        if (failure && retryAfter.count() > 0)
+            failure->description += fmt::format(" (retry after {} s)", retryAfter.count());
+        // A collector that refuses the content itself will refuse it again: it is
+        // logged and passed over rather than retried for ever.
+        if (failure && failure->code >= 400 && failure->code < 500 && failure->code != 408 && failure->code != 429) {
+            MXLOG(nullptr, Error, "otlp collector rejected {} records, not retrying: {}", records.size(),
+                  failure->description);
+            failure.reset();
+        }
+        return !failure;
+    };
+
+    std::int64_t cursor = 0;
+    query("SELECT stream_cursor FROM exports WHERE backend = ?1",
+          [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
+          [&](sqlite3_stmt* s) { cursor = sqlite3_column_int64(s, 0); });
+
+    Json records = Json::array();
+    std::int64_t last = cursor;
+    query(kStreamQuery,
+          [&](sqlite3_stmt* s) {
+              sqlite3_bind_int64(s, 1, cursor);
+              sqlite3_bind_int64(s, 2, kBatchMessages);
+          },
+          [&](sqlite3_stmt* s) {
+              records.push_back(logRecord(s));
+              last = sqlite3_column_int64(s, 0);
+          });
+    std::optional<UplinkError> failure;
+    if (!records.empty()) {
+        if (!send(records, failure))
+            return failure;
+        record("INSERT INTO exports(backend, stream_cursor) VALUES(?1, ?2) "
+               "ON CONFLICT(backend) DO UPDATE SET stream_cursor = ?2",
+               last);
+        exported += records.size();
+    }
+
+    std::vector<std::int64_t> sessions;
+    query(kFlushedSessionsQuery, [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
+          [&](sqlite3_stmt* s) { sessions.push_back(sqlite3_column_int64(s, 0)); });
+    for (auto session : sessions) {
+        std::int64_t after = 0;
+        for (;;) {
+            Json chunk = Json::array();
+            query(kSessionMessagesQuery,
+                  [&](sqlite3_stmt* s) {
+                      sqlite3_bind_int64(s, 1, session);
+                      sqlite3_bind_int64(s, 2, after);
+                      sqlite3_bind_int64(s, 3, kBatchMessages);
+                  },
+                  [&](sqlite3_stmt* s) {
+                      chunk.push_back(logRecord(s));
+                      after = sqlite3_column_int64(s, 0);
+                  });
+            if (chunk.empty())
+                break;
+            if (!send(chunk, failure))
+                return failure;
+            exported += chunk.size();
+        }
+        record("INSERT OR IGNORE INTO exported_sessions(backend, session) VALUES(?1, ?2)", session);
+        std::lock_guard lock(mutex_);
+        deliveredSessions_.insert(session);
+    }
+    return std::nullopt;
+}
+
+std::optional<UplinkError> OtlpHttpExporter::waitForSession(std::int64_t session, std::chrono::milliseconds timeout)
+{
+    wake();
+    std::unique_lock lock(mutex_);
+    std::uint64_t startedAt = passes_;
+    bool settled = changed_.wait_for(lock, timeout, [&] {
+        return deliveredSessions_.count(session) > 0 || (error_ && passes_ > startedAt) || stopping_;
+    });
+    if (deliveredSessions_.erase(session) > 0)
+        return std::nullopt;
+    if (settled && error_)
+        return error_;
+    return UplinkError{-1, fmt::format("{}: session not acknowledged in time, kept in the spool", url_)};
+}
+
+} // namespace mx

@@ -1,0 +1,64 @@
+#pragma once
+// Exports what the spool holds to an OpenTelemetry collector as OTLP/JSON logs over
+// HTTP: one-shot messages and realtime sessions' messages as soon as they are
+// spooled, a batch session's messages once the session is flushed. What the
+// collector has not acknowledged stays in the spool and is sent again, with
+// exponential backoff that honours Retry-After, so a collector that is down loses
+// nothing. One thread per exporter; it reads the spool on a connection of its own.
+
+#include <atomic>
+#include <condition_variable>
+#include <cstdint>
+#include <filesystem>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+#include <thread>
+
+#include "platform/Uplink.h"
+
+struct sqlite3;
+
+namespace mx {
+
+class OtlpHttpExporter {
+public:
+    OtlpHttpExporter(std::filesystem::path spool, std::string url);
+    ~OtlpHttpExporter();
+    OtlpHttpExporter(const OtlpHttpExporter&) = delete;
+    OtlpHttpExporter& operator=(const OtlpHttpExporter&) = delete;
+
+    const std::string& url() const { return url_; }
+    // Whether the collector answers an HTTP request at all (any status). Blocks for
+    // at most a few seconds; callable from any thread.
+    bool probe();
+    // Asks for an export pass now rather than at the next poll.
+    void wake();
+    // Waits (at most `timeout`) until every spooled message of `session` has been
+    // acknowledged; the export error otherwise.
+    std::optional<UplinkError> waitForSession(std::int64_t session, std::chrono::milliseconds timeout);
+    // The error of the last failed export while the collector has not yet recovered.
+    std::optional<UplinkError> currentError() const;
+
+private:
+    void run();
+    // One batch; the number of messages acknowledged, or the error.
+    std::optional<UplinkError> exportBatch(std::size_t& exported);
+    std::optional<UplinkError> post(const std::string& body, std::chrono::seconds& retryAfter);
+
+    std::filesystem::path spool_;
+    std::string url_;
+    sqlite3* database_ = nullptr;
+
+    mutable std::mutex mutex_;
+    std::condition_variable changed_;
+    bool stopping_ = false;
+    bool woken_ = false;
+    std::optional<UplinkError> error_;
+    std::uint64_t passes_ = 0;
+    std::set<std::int64_t> deliveredSessions_;
+    std::thread thread_;
+};
+
+} // namespace mx

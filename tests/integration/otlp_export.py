@@ -1,0 +1,173 @@
+#!/usr/bin/python3
+"""mxreportingd exporting to an OpenTelemetry collector: an OTLP/JSON receiver on
+loopback gets valid log batches for a flushed batch session and a standalone
+message; with the receiver down a flush reports the error, the daemon goes on, and
+what it could not send reaches the receiver once it is back."""
+
+import http.server
+import json
+import os
+import shutil
+import socket
+import subprocess
+import sys
+import tempfile
+import threading
+import time
+
+import msgpack
+
+DAEMON = sys.argv[1]
+BOUND = 20.0
+checks = {"passed": 0, "failed": 0}
+
+
+def check(name, condition, detail=""):
+    if condition:
+        checks["passed"] += 1
+    else:
+        checks["failed"] += 1
+        print(f"FAILED {name} {detail}")
+
+
+def wait_for(condition, bound=BOUND):
+    deadline = time.time() + bound
+    while time.time() < deadline:
+        if condition():
+            return True
+        time.sleep(0.02)
+    return False
+
+
+class Receiver:
+    """A collector's logs endpoint that keeps every record it is sent."""
+
+    def __init__(self, port=0):
+        self.records = []
+        self.lock = threading.Lock()
+        receiver = self
+
+        class Handler(http.server.BaseHTTPRequestHandler):
+            def do_POST(self):
+                body = self.rfile.read(int(self.headers["Content-Length"]))
+                request = json.loads(body)
+                with receiver.lock:
+                    for resource in request["resourceLogs"]:
+                        for scope in resource["scopeLogs"]:
+                            receiver.records.extend(scope["logRecords"])
+                self.send_response(200)
+                self.send_header("Content-Type", "application/json")
+                self.end_headers()
+                self.wfile.write(b"{}")
+
+            def log_message(self, *args):
+                pass
+
+        self.server = http.server.ThreadingHTTPServer(("127.0.0.1", port), Handler)
+        self.port = self.server.server_address[1]
+        threading.Thread(target=self.server.serve_forever, daemon=True).start()
+
+    def stop(self):
+        self.server.shutdown()
+        self.server.server_close()
+
+    def bodies(self):
+        with self.lock:
+            return [record["body"] for record in self.records]
+
+
+def attributes(record):
+    return {a["key"]: a["value"] for a in record["attributes"]}
+
+
+class Client:
+    def __init__(self, path):
+        self.sock = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        self.sock.connect(path)
+        self.sock.settimeout(BOUND)
+        self.unpacker = msgpack.Unpacker(raw=False)
+        self.msgid = 0
+        self.replies = {}
+
+    def send(self, method, *params):
+        self.msgid += 1
+        self.sock.sendall(msgpack.packb([0, self.msgid, method, list(params)]))
+        return self.msgid
+
+    def call(self, method, *params):
+        msgid = self.send(method, *params)
+        while msgid not in self.replies:
+            self.unpacker.feed(self.sock.recv(65536))
+            for message in self.unpacker:
+                self.replies[message[1]] = message[3]
+        return self.replies.pop(msgid)
+
+
+def session(client, reporter, reports):
+    client.call("createReportingSession:reply:", reporter)
+    client.call("setServiceType:reportingSession:reply:", 7, reporter)
+    client.send("startReportingSessionForID:reply:", reporter)
+    for index in range(reports):
+        client.call("sendMessage:withCategory:andType:forReportingIDs:reply:",
+                    {"reporter": reporter, "index": index, "peak level": -3.5}, 0x08000003, 1, [reporter])
+    client.call("stopReportingSessionForID:reply:", reporter)
+
+
+def main():
+    receiver = Receiver()
+    root = tempfile.mkdtemp(prefix="mxreporting-otlp-")
+    os.makedirs(os.path.join(root, "etc/harmonia"))
+    with open(os.path.join(root, "etc/harmonia/uplink.json"), "w") as config:
+        json.dump({"backends": [{"type": "spool"},
+                                {"type": "otlp-http", "url": f"http://127.0.0.1:{receiver.port}/v1/logs"}]}, config)
+    env = dict(os.environ, MXREPORTING_ROOT=root)
+    env.pop("JOURNAL_STREAM", None)
+    log_path = os.path.join(root, "daemon.log")
+    log = open(log_path, "w")
+    daemon = subprocess.Popen([DAEMON], env=env, stderr=log, stdout=log)
+    try:
+        path = os.path.join(root, "run/harmonia/reporting.sock")
+        wait_for(lambda: os.path.exists(path))
+        time.sleep(0.1)
+        client = Client(path)
+
+        session(client, 1, 3)
+        check("batch session exported after its flush",
+              wait_for(lambda: sum(1 for b in receiver.bodies() if "kvlistValue" in b) >= 4), receiver.bodies())
+        records = list(receiver.records)
+        first = records[0]
+        values = {v["key"]: v["value"] for v in first["body"]["kvlistValue"]["values"]}
+        check("body holds the cleaned payload", values.get("peak_level") == {"doubleValue": -3.5}, values)
+        check("time in nanoseconds", first["timeUnixNano"].isdigit() and len(first["timeUnixNano"]) >= 19)
+        attrs = attributes(first)
+        check("category cut to 16 bits", attrs["harmonia.category"] == {"intValue": "3"}, attrs)
+        check("session information travels", attrs["harmonia.session.SessionID"] == {"intValue": "1"}, attrs)
+        check("service name travels", attrs["harmonia.user.ServiceName"] == {"stringValue": "longformaudio_session"})
+        check("summary event last", attributes(records[3])["harmonia.type"] == {"intValue": "65535"})
+
+        client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"alone": True}, 1, 0, None)
+        check("standalone message exported at once",
+              wait_for(lambda: any("alone" in json.dumps(b) for b in receiver.bodies())))
+
+        receiver.stop()
+        session(client, 2, 2)
+        check("flush reports the error",
+              wait_for(lambda: "flush error" in open(log_path).read()), open(log_path).read()[-2000:])
+        check("daemon goes on", client.call("reporterID:valid:", 2) == {"reporterID": 2, "serviceType": 7})
+
+        receiver = Receiver(receiver.port)
+        check("spooled messages reach the collector once it is back",
+              wait_for(lambda: sum(1 for b in receiver.bodies() if '"reporter"' in json.dumps(b) or "reporter" in json.dumps(b)) >= 2, 90))
+    finally:
+        daemon.kill()
+        daemon.wait()
+        log.close()
+        if checks["failed"]:
+            print(open(log_path).read()[-3000:])
+        shutil.rmtree(root, ignore_errors=True)
+    print(f"{checks['passed']} passed, {checks['failed']} failed")
+    return 1 if checks["failed"] else 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
