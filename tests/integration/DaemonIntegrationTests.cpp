@@ -320,3 +320,46 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 
 } // namespace
 } // namespace mx::testing
+
+namespace mx::testing {
+namespace {
+
+class DaemonWithoutBackendTest : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+        daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+        // Port 9 (discard) on loopback: nothing answers.
+        daemon.writeFile("etc/harmonia/uplink.json",
+                         R"({"backends": [{"type": "otlp-http", "url": "http://127.0.0.1:9/v1/logs"}]})");
+        daemon.start();
+    }
+    DaemonProcess daemon;
+};
+
+TEST_F(DaemonWithoutBackendTest, SessionGivesUpOnTheBackendAfterNineSecondsAndKeepsAggregating)
+{
+    std::string error;
+    auto client = MxReportingClient::connect(daemon.socketPath(), error);
+    ASSERT_TRUE(client) << error;
+    ASSERT_TRUE(*client->createReportingSession(8).value);
+    ASSERT_TRUE(*client->setConfiguration(Dictionary{{"HostApplicationDisplayID", "Lonely"}}, 8).value);
+    auto began = std::chrono::steady_clock::now();
+    client->startReportingSessionForID(8, nullptr);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{8}));
+
+    EXPECT_TRUE(daemon.waitForLog("No backends found, this session won't get sent to the server"));
+    EXPECT_TRUE(daemon.waitForLog("failed to find backend", std::chrono::seconds(30)));
+    EXPECT_GE(std::chrono::steady_clock::now() - began, std::chrono::seconds(9));
+    EXPECT_TRUE(daemon.waitForLog("No valid UplinkSession")) << "the delivery queued behind the wait finds no backend";
+
+    ASSERT_TRUE(*client->stopReportingSessionForID(8).value);
+    auto summaries = daemon.path("private/var/mobile/Library/Logs/FaultDesk/DiagnosticLogs/Audio/Reporting");
+    ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(summaries) && !std::filesystem::is_empty(summaries); }));
+    EXPECT_THAT(std::filesystem::directory_iterator(summaries)->path().filename().string(),
+                ::testing::EndsWith("-harmonia-Lonely-unknown.json"));
+    EXPECT_EQ(daemon.query("tally", "SELECT count(*) FROM events WHERE name LIKE '%Playback.Start'")[0][0], "1");
+}
+
+} // namespace
+} // namespace mx::testing
