@@ -156,24 +156,14 @@ std::optional<UplinkError> OtlpHttpExporter::currentError() const
 
 bool OtlpHttpExporter::probe()
 {
-    CURL* curl = curl_easy_init();
-    if (!curl)
-        return false;
-    std::string body = logsRequest(Json::array());
-    curl_easy_setopt(curl, CURLOPT_URL, url_.c_str());
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.c_str());
-    curl_easy_setopt(curl, CURLOPT_TIMEOUT, 3L);
-    curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
-    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, discardBody);
-    curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
-    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
-    bool answered = curl_easy_perform(curl) == CURLE_OK;
-    curl_slist_free_all(headers);
-    curl_easy_cleanup(curl);
-    return answered;
+    std::chrono::seconds retryAfter{0};
+    long status = 0;
+    post(logsRequest(Json::array()), retryAfter, status);
+    return status != 0;
 }
 
-std::optional<UplinkError> OtlpHttpExporter::post(const std::string& body, std::chrono::seconds& retryAfter)
+std::optional<UplinkError> OtlpHttpExporter::post(const std::string& body, std::chrono::seconds& retryAfter,
+                                                  long& status)
 {
     CURL* curl = curl_easy_init();
     if (!curl)
@@ -190,7 +180,7 @@ std::optional<UplinkError> OtlpHttpExporter::post(const std::string& body, std::
     curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
     curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
     CURLcode result = curl_easy_perform(curl);
-    long status = 0;
+    status = 0;
     curl_off_t retry = 0;
     curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
     curl_easy_getinfo(curl, CURLINFO_RETRY_AFTER, &retry);
@@ -269,7 +259,8 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
     };
     auto send = [&](const Json& records, std::optional<UplinkError>& failure) {
         std::chrono::seconds retryAfter{0};
-        failure = post(logsRequest(records), retryAfter);
+        long status = 0;
+        failure = post(logsRequest(records), retryAfter, status);
         if (failure && retryAfter.count() > 0)
             failure->description += fmt::format(" (retry after {} s)", retryAfter.count());
         // A collector that refuses the content itself will refuse it again: it is

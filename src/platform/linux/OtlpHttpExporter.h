@@ -45,7 +45,8 @@ private:
     void run();
     // One batch; the number of messages acknowledged, or the error.
     std::optional<UplinkError> exportBatch(std::size_t& exported);
-    std::optional<UplinkError> post(const std::string& body, std::chrono::seconds& retryAfter);
+    // `status` is the HTTP status, 0 when no response came at all.
+    std::optional<UplinkError> post(const std::string& body, std::chrono::seconds& retryAfter, long& status);
 
     std::filesystem::path spool_;
     std::string url_;
