@@ -10,13 +10,17 @@ namespace mx {
 void MxReportingTallyBridge::handleEvent(const Dictionary& message, MessageCategory category, MessageType type,
                                          const MxReportingSession& session)
 {
-    // The event keeps the client's keys as sent (spaces and all), unlike the session's copy.
-    Dictionary payload = message;
     Dictionary userInfo = session.userInfo()->snapshot();
-    payload.set("HostApplicationDisplayID", MxReportingHostApplicationID(&userInfo));
     std::string name = fmt::format("com.kestrel.harmonia.{}.{}", MxReportingCategoryName(category),
                                    MxReportingMessageTypeName(type));
-    TallySendEventLazy(name, [payload = std::move(payload)]() mutable { return std::move(payload); });
+    // The payload is the message as the client sent it (spaces in keys and all) with
+    // the host set last. It is made when the analytics service asks for it, which may
+    // be on its own thread or never; the message is shared, not copied, until then.
+    TallySendEventLazy(name, [message, host = MxReportingHostApplicationID(&userInfo)]() {
+        Dictionary payload = message;
+        payload.set("HostApplicationDisplayID", host);
+        return payload;
+    });
 }
 
 } // namespace mx

@@ -1,6 +1,9 @@
 #include "platform/JsonValue.h"
 
 #include <cmath>
+#include <iterator>
+
+#include <fmt/format.h>
 
 namespace mx {
 
@@ -59,6 +62,113 @@ nlohmann::ordered_json toJson(const Value& value)
 
 namespace {
 
+// Length of the valid UTF-8 sequence at `text`, or 0 when it is not one.
+std::size_t utf8Sequence(const unsigned char* text, std::size_t left)
+{
+    unsigned char lead = text[0];
+    std::size_t length = lead < 0x80 ? 1 : (lead >> 5) == 0x6 ? 2 : (lead >> 4) == 0xE ? 3 : (lead >> 3) == 0x1E ? 4 : 0;
+    if (length == 0 || length > left)
+        return 0;
+    for (std::size_t i = 1; i < length; ++i)
+        if ((text[i] & 0xC0) != 0x80)
+            return 0;
+    std::uint32_t point = length == 1 ? lead : lead & (0x7F >> length);
+    for (std::size_t i = 1; i < length; ++i)
+        point = (point << 6) | (text[i] & 0x3F);
+    static constexpr std::uint32_t kSmallest[] = {0, 0, 0x80, 0x800, 0x10000};
+    if (point < kSmallest[length] || point > 0x10FFFF || (point >= 0xD800 && point <= 0xDFFF))
+        return 0;
+    return length;
+}
+
+void appendString(std::string& out, const std::string& text)
+{
+    out += '"';
+    auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
+    for (std::size_t i = 0; i < text.size();) {
+        unsigned char c = bytes[i];
+        if (c >= 0x80) {
+            std::size_t length = utf8Sequence(bytes + i, text.size() - i);
+            if (length == 0) {
+                out += "\ufffd";
+                ++i;
+            } else {
+                out.append(text, i, length);
+                i += length;
+            }
+            continue;
+        }
+        switch (c) {
+        case '"': out += "\\\""; break;
+        case '\\': out += "\\\\"; break;
+        case '\b': out += "\\b"; break;
+        case '\f': out += "\\f"; break;
+        case '\n': out += "\\n"; break;
+        case '\r': out += "\\r"; break;
+        case '\t': out += "\\t"; break;
+        default:
+            if (c < 0x20)
+                out += fmt::format("\\u{:04x}", c);
+            else
+                out += static_cast<char>(c);
+        }
+        ++i;
+    }
+    out += '"';
+}
+
+void appendJson(std::string& out, const Value& value)
+{
+    switch (value.kind()) {
+    case Value::Kind::Nil: out += "null"; break;
+    case Value::Kind::Bool: out += *value.asBool() ? "true" : "false"; break;
+    case Value::Kind::Int: fmt::format_to(std::back_inserter(out), "{}", *value.asInt()); break;
+    case Value::Kind::UInt: fmt::format_to(std::back_inserter(out), "{}", *value.asUInt()); break;
+    case Value::Kind::Double: {
+        double number = *value.asDouble();
+        if (!std::isfinite(number)) {
+            out += "null";
+            break;
+        }
+        std::size_t start = out.size();
+        fmt::format_to(std::back_inserter(out), "{}", number);
+        // A whole number stays recognisably a float, as JSON writers print it.
+        if (out.find_first_of(".eE", start) == std::string::npos)
+            out += ".0";
+        break;
+    }
+    case Value::Kind::String: appendString(out, *value.asString()); break;
+    case Value::Kind::Date: appendString(out, formatDate(*value.asDate())); break;
+    case Value::Kind::Data: appendString(out, base64Encode(*value.asData())); break;
+    case Value::Kind::Array: {
+        out += '[';
+        bool first = true;
+        for (const auto& item : *value.asArray()) {
+            if (!first)
+                out += ',';
+            first = false;
+            appendJson(out, item);
+        }
+        out += ']';
+        break;
+    }
+    case Value::Kind::Dictionary: {
+        out += '{';
+        bool first = true;
+        for (const auto& [key, item] : *value.asDictionary()) {
+            if (!first)
+                out += ',';
+            first = false;
+            appendString(out, key);
+            out += ':';
+            appendJson(out, item);
+        }
+        out += '}';
+        break;
+    }
+    }
+}
+
 template <class Json>
 Value fromAnyJson(const Json& json)
 {
@@ -90,6 +200,13 @@ Value fromAnyJson(const Json& json)
 }
 
 } // namespace
+
+std::string toJsonText(const Value& value)
+{
+    std::string out;
+    appendJson(out, value);
+    return out;
+}
 
 Value fromJson(const nlohmann::ordered_json& json) { return fromAnyJson(json); }
 Value fromJson(const nlohmann::json& json) { return fromAnyJson(json); }

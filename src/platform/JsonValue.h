@@ -16,4 +16,9 @@ Value fromJson(const nlohmann::json& json);
 
 std::string base64Encode(const Data& data);
 
+// The compact JSON text of a value, as toJson(value).dump() would write it but
+// without building the tree first: the stores write one of these per row. Invalid
+// UTF-8 in strings becomes U+FFFD so the text always parses.
+std::string toJsonText(const Value& value);
+
 } // namespace mx

@@ -79,3 +79,28 @@ TEST(ValueTest, NumbersReadAsIntegersLikeACastWould)
 
 } // namespace
 } // namespace mx
+
+#include <nlohmann/json.hpp>
+
+#include "platform/JsonValue.h"
+
+namespace mx {
+namespace {
+
+TEST(JsonValueTest, TextWriterMatchesTheJsonTreeAndAlwaysParses)
+{
+    Value value = Dictionary{{"text", "quote \" slash \\ tab \t bell \x07 é"},
+                             {"whole", 2.0},
+                             {"tiny", 1e-7},
+                             {"int", -3},
+                             {"big", 18446744073709551615ull},
+                             {"nan", std::nan("")},
+                             {"list", Array{nullptr, true, Data{0xff}}},
+                             {"when", Date(std::chrono::seconds(1))}};
+    EXPECT_EQ(toJsonText(value), toJson(value).dump());
+    auto broken = toJsonText(Value(std::string("a\xff\xc3")));
+    EXPECT_EQ(nlohmann::json::parse(broken), "a\xef\xbf\xbd\xef\xbf\xbd");
+}
+
+} // namespace
+} // namespace mx

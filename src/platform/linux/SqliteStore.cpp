@@ -143,8 +143,18 @@ void SqliteStore::commit(std::deque<SqliteWrite>& batch)
                     else if constexpr (std::is_same_v<T, std::string>)
                         sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()),
                                           SQLITE_STATIC);
+                    else if constexpr (std::is_same_v<T, Dictionary>)
+                    {
+                        std::string text = toJsonText(value);
+                        sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()),
+                                          SQLITE_TRANSIENT);
+                    }
                     else
-                        sqlite3_bind_text(statement, index, toJson(value).dump().c_str(), -1, SQLITE_TRANSIENT);
+                    {
+                        std::string text = toJsonText((*value)());
+                        sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()),
+                                          SQLITE_TRANSIENT);
+                    }
                 },
                 write.parameters[i]);
         }

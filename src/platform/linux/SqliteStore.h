@@ -17,6 +17,7 @@
 #include <variant>
 #include <vector>
 
+#include "platform/UniqueFunction.h"
 #include "platform/Value.h"
 
 struct sqlite3;
@@ -27,9 +28,11 @@ namespace mx {
 // The time columns' unit: seconds since the Unix epoch.
 double secondsSinceEpoch();
 
-// A Dictionary parameter is written as its JSON text; it is serialised on the
-// writer thread, off the caller's path.
-using SqliteValue = std::variant<std::nullptr_t, std::int64_t, double, std::string, Dictionary>;
+// A Dictionary parameter is written as its JSON text, and a deferred one is built
+// first: both happen on the writer thread, off the caller's path.
+using SqliteDeferredDictionary = std::shared_ptr<UniqueFunction<Dictionary()>>;
+using SqliteValue =
+    std::variant<std::nullptr_t, std::int64_t, double, std::string, Dictionary, SqliteDeferredDictionary>;
 
 struct SqliteWrite {
     std::size_t statement; // index into the statements given at open

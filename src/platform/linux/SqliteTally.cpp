@@ -57,8 +57,10 @@ void SqliteTally::sendEventLazy(std::string_view name, UniqueFunction<Dictionary
 {
     if (!wanted(name))
         return;
-    Dictionary payload = buildPayload();
-    store_->submit({0, {secondsSinceEpoch(), std::string(name), std::move(payload)}});
+    // Built on the writer thread when the row is written.
+    store_->submit({0,
+                    {secondsSinceEpoch(), std::string(name),
+                     std::make_shared<UniqueFunction<Dictionary()>>(std::move(buildPayload))}});
 }
 
 } // namespace mx
