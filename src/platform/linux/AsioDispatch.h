@@ -14,7 +14,9 @@ namespace mx {
 class AsioDispatch final : public Dispatch {
 public:
     // `threadsPerPool` 0: one thread for user-interactive work (a single serial
-    // queue), one per core (at least two) for utility work.
+    // queue) and one per two cores for utility work. Fewer threads mean fewer
+    // wake-ups under load; work that blocks is lent a spare thread, so a small pool
+    // never deadlocks on a wait.
     explicit AsioDispatch(unsigned threadsPerPool = 0);
     ~AsioDispatch() override;
 
