@@ -399,7 +399,8 @@ int main(int argc, char** argv)
                 throw UsageError{"unknown option " + option};
         }
         auto commands = splitCommands(words);
-        if (commands.empty() || commands[0][0] == "help" || commands[0][0] == "-h") {
+        bool help = std::any_of(words.begin(), words.end(), [](const auto& word) { return word == "--help" || word == "-h"; });
+        if (commands.empty() || help || commands[0][0] == "help") {
             std::fputs(kUsage, commands.empty() ? stderr : stdout);
             return commands.empty() ? kExitUsage : 0;
         }
