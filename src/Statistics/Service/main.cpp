@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <cstring>
 #include <future>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <asio/signal_set.hpp>
@@ -44,6 +45,16 @@ Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
 SIGHUP re-reads the preferences; SIGTERM commits the stores and exits.
 )";
 
+// Every client is a descriptor: take all the system allows, not the shell's default.
+void raiseDescriptorLimit()
+{
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) == 0 && limit.rlim_cur < limit.rlim_max) {
+        limit.rlim_cur = limit.rlim_max;
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
+}
+
 [[noreturn]] void fail(const std::string& message)
 {
     MXLOG(nullptr, Error, "mxreportingd cannot start: {}", message);
@@ -64,6 +75,7 @@ int main(int argc, char** argv)
         return 64;
     }
 
+    raiseDescriptorLimit();
     StderrLogSink stderrSink;
     JournalLogSink journalSink;
     ProcessWide<MxLogSink>::install(JournalLogSink::runningUnderJournal() ? static_cast<MxLogSink*>(&journalSink)

@@ -16,11 +16,14 @@ msgpack::unpack_limit limitsFor(std::size_t maximumMessageBytes)
                                  maximumMessageBytes, maximumMessageBytes, kMsgpackMaximumDepth);
 }
 
+// An idle connection costs this much; a busy one grows its buffer as it needs.
+constexpr std::size_t kInitialBufferBytes = 8 * 1024;
+
 } // namespace
 
 MsgpackRpcDecoder::MsgpackRpcDecoder(std::size_t maximumMessageBytes)
     : maximumMessageBytes_(maximumMessageBytes),
-      unpacker_(nullptr, nullptr, MSGPACK_UNPACKER_INIT_BUFFER_SIZE, limitsFor(maximumMessageBytes))
+      unpacker_(nullptr, nullptr, kInitialBufferBytes, limitsFor(maximumMessageBytes))
 {
 }
 
