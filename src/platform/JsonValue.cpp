@@ -81,11 +81,21 @@ std::size_t utf8Sequence(const unsigned char* text, std::size_t left)
     return length;
 }
 
+bool plainAscii(unsigned char c) { return c >= 0x20 && c < 0x80 && c != '"' && c != '\\'; }
+
 void appendString(std::string& out, const std::string& text)
 {
     out += '"';
     auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
     for (std::size_t i = 0; i < text.size();) {
+        // Most text needs no escaping: copy each run of it at once.
+        std::size_t run = i;
+        while (run < text.size() && plainAscii(bytes[run]))
+            ++run;
+        out.append(text, i, run - i);
+        i = run;
+        if (i == text.size())
+            break;
         unsigned char c = bytes[i];
         if (c >= 0x80) {
             std::size_t length = utf8Sequence(bytes + i, text.size() - i);
@@ -106,11 +116,7 @@ void appendString(std::string& out, const std::string& text)
         case '\n': out += "\\n"; break;
         case '\r': out += "\\r"; break;
         case '\t': out += "\\t"; break;
-        default:
-            if (c < 0x20)
-                out += fmt::format("\\u{:04x}", c);
-            else
-                out += static_cast<char>(c);
+        default: out += fmt::format("\\u{:04x}", c);
         }
         ++i;
     }
