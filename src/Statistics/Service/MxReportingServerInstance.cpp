@@ -389,11 +389,9 @@ void MxReportingServerInstance::handleDisconnection()
     for (const auto& [id, session] : clientReportingSessionMap_)
         if (session->started())
             session->stop();
-    // Removal may release the last reference to this instance: nothing touches it after.
-    std::int32_t pid = processIdentifier_;
-    auto keepAlive = shared_from_this();
+    // The queued work holds this instance, so it outlives its removal from the root.
     root->removeClient(*this);
-    MXLOG(logScope(), Default, "removing {} from the server client list", pid);
+    MXLOG(logScope(), Default, "removing {} from the server client list", processIdentifier_);
 }
 
 } // namespace mx
