@@ -3,7 +3,9 @@
 // answers discovery the way the test chooses: at once with backends, at once with
 // nothing, or only when the test calls answerDiscovery().
 
+#include <atomic>
 #include <condition_variable>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -68,7 +70,9 @@ public:
                         Dictionary payload, std::optional<UplinkError>& error) override;
 
     void setDiscovery(Discovery discovery) { discovery_ = discovery; }
-    Discovery discovery() const { return discovery_; }
+    // How a session of that reporter ID is answered; others follow setDiscovery.
+    void setDiscovery(std::int64_t sessionID, Discovery discovery);
+    Discovery discoveryFor(const Dictionary& sessionInfo) const;
     void setOneShotResult(bool accepted, std::optional<UplinkError> error);
     void setFlushError(std::optional<UplinkError> error);
     std::optional<UplinkError> flushError() const;
@@ -81,6 +85,7 @@ public:
 
 private:
     std::atomic<Discovery> discovery_{Discovery::Backends};
+    std::map<std::int64_t, Discovery> discoveryBySession_;
     mutable std::mutex mutex_;
     mutable std::condition_variable changed_;
     std::vector<std::shared_ptr<FakeUplinkSession>> sessions_;

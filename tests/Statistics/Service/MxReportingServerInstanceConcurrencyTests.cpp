@@ -155,3 +155,56 @@ TEST_F(MxReportingServerInstanceConcurrencyTest, EveryMessageIsRepliedOnceAndDel
 
 } // namespace
 } // namespace mx::testing
+
+namespace mx::testing {
+namespace {
+
+// Backend discovery blocks a session's queue for up to 9 seconds a round; sessions
+// stuck there must not hold up the deliveries of any other session, even on a pool
+// of one thread.
+TEST(MxReportingDiscoveryConcurrencyTest, SessionsWaitingOnDiscoveryDoNotDelayOtherSessions)
+{
+    FakePlatform platform;
+    AsioDispatch dispatch(1);
+    ScopedInstall<Dispatch> installDispatch(dispatch);
+    constexpr int kWaiting = 12;
+    for (ReporterID id = 1; id <= kWaiting; ++id)
+        platform.uplink.setDiscovery(id, FakeUplink::Discovery::Held);
+
+    std::vector<std::shared_ptr<MxReportingSession>> sessions;
+    for (ReporterID id = 1; id <= kWaiting + 1; ++id) {
+        sessions.push_back(std::make_shared<MxReportingSession>(id, std::vector<std::int32_t>{1}));
+        sessions.back()->start();
+    }
+    auto& free = sessions.back();
+    free->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+
+    auto delivered = [&] {
+        for (const auto& backend : platform.uplink.sessions())
+            if (*backend->sessionInfo.find("SessionID") == Value(kWaiting + 1))
+                return !backend->messages().empty();
+        return false;
+    };
+    auto began = std::chrono::steady_clock::now();
+    while (!delivered() && std::chrono::steady_clock::now() - began < std::chrono::seconds(5))
+        std::this_thread::yield();
+    EXPECT_TRUE(delivered()) << "the free session's delivery waited behind the others' discovery";
+    EXPECT_EQ(platform.log.count("waiting for uplinkd to find backends"), std::size_t(kWaiting));
+
+    // Let the waiting sessions go before the queues are torn down.
+    for (const auto& backend : platform.uplink.sessions())
+        backend->answerDiscovery(std::vector<std::string>{"spool"});
+    for (auto& session : sessions)
+        session->stop();
+    std::promise<void> drained;
+    auto remaining = std::make_shared<std::atomic<int>>(static_cast<int>(sessions.size()));
+    for (auto& session : sessions)
+        session->uplinkQueue()->dispatch([&, remaining] {
+            if (--*remaining == 0)
+                drained.set_value();
+        });
+    EXPECT_EQ(drained.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
+}
+
+} // namespace
+} // namespace mx::testing
