@@ -44,6 +44,7 @@ class Receiver:
 
     def __init__(self, port=0):
         self.records = []
+        self.refusals = 0  # answer this many requests with 503 and Retry-After: 1
         self.lock = threading.Lock()
         receiver = self
 
@@ -52,6 +53,13 @@ class Receiver:
                 body = self.rfile.read(int(self.headers["Content-Length"]))
                 request = json.loads(body)
                 with receiver.lock:
+                    if receiver.refusals > 0:
+                        receiver.refusals -= 1
+                        self.send_response(503)
+                        self.send_header("Retry-After", "1")
+                        self.send_header("Content-Length", "0")
+                        self.end_headers()
+                        return
                     for resource in request["resourceLogs"]:
                         for scope in resource["scopeLogs"]:
                             receiver.records.extend(scope["logRecords"])
@@ -157,7 +165,15 @@ def main():
 
         receiver = Receiver(receiver.port)
         check("spooled messages reach the collector once it is back",
-              wait_for(lambda: sum(1 for b in receiver.bodies() if '"reporter"' in json.dumps(b) or "reporter" in json.dumps(b)) >= 2, 90))
+              wait_for(lambda: sum(1 for b in receiver.bodies() if "reporter" in json.dumps(b)) >= 2, 90))
+
+        with receiver.lock:
+            receiver.refusals = 1
+        client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"patient": True}, 1, 0, None)
+        check("a busy collector's Retry-After is honoured",
+              wait_for(lambda: "(retry after 1 s)" in open(log_path).read()), open(log_path).read()[-2000:])
+        check("and the message arrives after it",
+              wait_for(lambda: any("patient" in json.dumps(b) for b in receiver.bodies()), 30))
     finally:
         daemon.kill()
         daemon.wait()

@@ -221,7 +221,9 @@ void OtlpHttpExporter::run()
         }
         changed_.notify_all();
         if (failure) {
-            pause = backoff;
+            // The collector's own word on when to come back wins over our backoff.
+            pause = std::max<std::chrono::milliseconds>(backoff, retryAfter_);
+            retryAfter_ = std::chrono::seconds(0);
             backoff = std::min(backoff * 2, kLongestBackoff);
         } else {
             backoff = kFirstBackoff;
@@ -261,8 +263,10 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
         std::chrono::seconds retryAfter{0};
         long status = 0;
         failure = post(logsRequest(records), retryAfter, status);
-        if (failure && retryAfter.count() > 0)
+        if (failure && retryAfter.count() > 0) {
             failure->description += fmt::format(" (retry after {} s)", retryAfter.count());
+            retryAfter_ = retryAfter;
+        }
         // A collector that refuses the content itself will refuse it again: it is
         // logged and passed over rather than retried for ever.
         if (failure && failure->code >= 400 && failure->code < 500 && failure->code != 408 && failure->code != 429) {

@@ -7,6 +7,7 @@
 // nothing. One thread per exporter; it reads the spool on a connection of its own.
 
 #include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <cstdint>
 #include <filesystem>
@@ -51,6 +52,7 @@ private:
     std::filesystem::path spool_;
     std::string url_;
     sqlite3* database_ = nullptr;
+    std::chrono::seconds retryAfter_{0}; // exporter thread only
 
     mutable std::mutex mutex_;
     std::condition_variable changed_;
