@@ -22,6 +22,7 @@ constexpr std::size_t kBatchMessages = 512;
 constexpr auto kIdlePoll = std::chrono::milliseconds(200);
 constexpr auto kFirstBackoff = std::chrono::seconds(1);
 constexpr auto kLongestBackoff = std::chrono::seconds(60);
+constexpr auto kProbeReuse = std::chrono::seconds(5);
 
 Json anyValue(const Json& value)
 {
@@ -156,10 +157,19 @@ std::optional<UplinkError> OtlpHttpExporter::currentError() const
 
 bool OtlpHttpExporter::probe()
 {
+    // Every session start asks; the collector is asked at most once a few seconds.
+    {
+        std::lock_guard lock(mutex_);
+        if (lastProbe_ && std::chrono::steady_clock::now() - *lastProbe_ < kProbeReuse)
+            return probeAnswered_;
+    }
     std::chrono::seconds retryAfter{0};
     long status = 0;
     post(logsRequest(Json::array()), retryAfter, status);
-    return status != 0;
+    std::lock_guard lock(mutex_);
+    lastProbe_ = std::chrono::steady_clock::now();
+    probeAnswered_ = status != 0;
+    return probeAnswered_;
 }
 
 std::optional<UplinkError> OtlpHttpExporter::post(const std::string& body, std::chrono::seconds& retryAfter,

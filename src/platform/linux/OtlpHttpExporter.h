@@ -61,6 +61,8 @@ private:
     std::optional<UplinkError> error_;
     std::uint64_t passes_ = 0;
     std::set<std::int64_t> deliveredSessions_;
+    std::optional<std::chrono::steady_clock::time_point> lastProbe_;
+    bool probeAnswered_ = false;
     std::thread thread_;
 };
 

@@ -189,6 +189,10 @@ TEST(MxReportingDiscoveryConcurrencyTest, SessionsWaitingOnDiscoveryDoNotDelayOt
     while (!delivered() && std::chrono::steady_clock::now() - began < std::chrono::seconds(5))
         std::this_thread::yield();
     EXPECT_TRUE(delivered()) << "the free session's delivery waited behind the others' discovery";
+    // Every other session is in its wait at the same time (none is answered yet).
+    while (platform.log.count("waiting for uplinkd to find backends") < std::size_t(kWaiting) &&
+           std::chrono::steady_clock::now() - began < std::chrono::seconds(5))
+        std::this_thread::yield();
     EXPECT_EQ(platform.log.count("waiting for uplinkd to find backends"), std::size_t(kWaiting));
 
     // Let the waiting sessions go before the queues are torn down.
