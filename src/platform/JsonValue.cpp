@@ -1,4 +1,5 @@
 #include "platform/JsonValue.h"
+#include "platform/ValueText.h"
 
 #include <cmath>
 #include <iterator>
@@ -62,68 +63,7 @@ nlohmann::ordered_json toJson(const Value& value)
 
 namespace {
 
-// Length of the valid UTF-8 sequence at `text`, or 0 when it is not one.
-std::size_t utf8Sequence(const unsigned char* text, std::size_t left)
-{
-    unsigned char lead = text[0];
-    std::size_t length = lead < 0x80 ? 1 : (lead >> 5) == 0x6 ? 2 : (lead >> 4) == 0xE ? 3 : (lead >> 3) == 0x1E ? 4 : 0;
-    if (length == 0 || length > left)
-        return 0;
-    for (std::size_t i = 1; i < length; ++i)
-        if ((text[i] & 0xC0) != 0x80)
-            return 0;
-    std::uint32_t point = length == 1 ? lead : lead & (0x7F >> length);
-    for (std::size_t i = 1; i < length; ++i)
-        point = (point << 6) | (text[i] & 0x3F);
-    static constexpr std::uint32_t kSmallest[] = {0, 0, 0x80, 0x800, 0x10000};
-    if (point < kSmallest[length] || point > 0x10FFFF || (point >= 0xD800 && point <= 0xDFFF))
-        return 0;
-    return length;
-}
-
-bool plainAscii(unsigned char c) { return c >= 0x20 && c < 0x80 && c != '"' && c != '\\'; }
-
-void appendString(std::string& out, const std::string& text)
-{
-    out += '"';
-    auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
-    for (std::size_t i = 0; i < text.size();) {
-        // Most text needs no escaping: copy each run of it at once.
-        std::size_t run = i;
-        while (run < text.size() && plainAscii(bytes[run]))
-            ++run;
-        out.append(text, i, run - i);
-        i = run;
-        if (i == text.size())
-            break;
-        unsigned char c = bytes[i];
-        if (c >= 0x80) {
-            std::size_t length = utf8Sequence(bytes + i, text.size() - i);
-            if (length == 0) {
-                out += "\ufffd";
-                ++i;
-            } else {
-                out.append(text, i, length);
-                i += length;
-            }
-            continue;
-        }
-        switch (c) {
-        case '"': out += "\\\""; break;
-        case '\\': out += "\\\\"; break;
-        case '\b': out += "\\b"; break;
-        case '\f': out += "\\f"; break;
-        case '\n': out += "\\n"; break;
-        case '\r': out += "\\r"; break;
-        case '\t': out += "\\t"; break;
-        default: out += fmt::format("\\u{:04x}", c);
-        }
-        ++i;
-    }
-    out += '"';
-}
-
-void appendJson(std::string& out, const Value& value)
+void appendJsonScalar(std::string& out, const Value& value)
 {
     switch (value.kind()) {
     case Value::Kind::Nil: out += "null"; break;
@@ -143,35 +83,10 @@ void appendJson(std::string& out, const Value& value)
             out += ".0";
         break;
     }
-    case Value::Kind::String: appendString(out, *value.asString()); break;
-    case Value::Kind::Date: appendString(out, formatDate(*value.asDate())); break;
-    case Value::Kind::Data: appendString(out, base64Encode(*value.asData())); break;
-    case Value::Kind::Array: {
-        out += '[';
-        bool first = true;
-        for (const auto& item : *value.asArray()) {
-            if (!first)
-                out += ',';
-            first = false;
-            appendJson(out, item);
-        }
-        out += ']';
-        break;
-    }
-    case Value::Kind::Dictionary: {
-        out += '{';
-        bool first = true;
-        for (const auto& [key, item] : *value.asDictionary()) {
-            if (!first)
-                out += ',';
-            first = false;
-            appendString(out, key);
-            out += ':';
-            appendJson(out, item);
-        }
-        out += '}';
-        break;
-    }
+    case Value::Kind::String: appendQuotedText(out, *value.asString()); break;
+    case Value::Kind::Date: appendQuotedText(out, formatDate(*value.asDate())); break;
+    case Value::Kind::Data: appendQuotedText(out, base64Encode(*value.asData())); break;
+    default: break; // containers are walked by appendNested
     }
 }
 
@@ -210,7 +125,7 @@ Value fromAnyJson(const Json& json)
 std::string toJsonText(const Value& value)
 {
     std::string out;
-    appendJson(out, value);
+    appendNested(out, value, appendJsonScalar);
     return out;
 }
 

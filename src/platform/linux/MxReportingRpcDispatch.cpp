@@ -96,15 +96,20 @@ MxBoolReply boolReply(const Responder& responder)
     return [responder](bool value) { responder->respond(value); };
 }
 
+// The four operations that take a reporter ID and answer with a bool.
+Operation reporterOperation(void (MxReportingServiceProtocol::*call)(ReporterID, MxBoolReply))
+{
+    return {1, [call](MxReportingServiceProtocol& service, Arguments& args, const Responder& responder) {
+                auto id = args.reporterID(0);
+                if (!args.error())
+                    (service.*call)(id, boolReply(responder));
+            }};
+}
+
 const std::map<std::string, Operation, std::less<>>& operations()
 {
     static const std::map<std::string, Operation, std::less<>> table = {
-        {"createReportingSession:reply:",
-         {1, [](auto& service, auto& args, const Responder& responder) {
-              auto id = args.reporterID(0);
-              if (!args.error())
-                  service.createReportingSession(id, boolReply(responder));
-          }}},
+        {"createReportingSession:reply:", reporterOperation(&MxReportingServiceProtocol::createReportingSession)},
         {"setServiceType:reportingSession:reply:",
          {2, [](auto& service, auto& args, const Responder& responder) {
               auto type = static_cast<ServiceType>(args.unsignedInteger(0, 0xFFFF, "an unsigned 16-bit service type"));
@@ -125,12 +130,7 @@ const std::map<std::string, Operation, std::less<>>& operations()
               if (!args.error())
                   service.setConfiguration(std::move(configuration), id, boolReply(responder));
           }}},
-        {"startReportingSessionForID:reply:",
-         {1, [](auto& service, auto& args, const Responder& responder) {
-              auto id = args.reporterID(0);
-              if (!args.error())
-                  service.startReportingSessionForID(id, boolReply(responder));
-          }}},
+        {"startReportingSessionForID:reply:", reporterOperation(&MxReportingServiceProtocol::startReportingSessionForID)},
         {"sendMessage:withCategory:andType:forReportingIDs:reply:",
          {4, [](auto& service, auto& args, const Responder& responder) {
               auto payload = args.dictionary(0);
@@ -148,18 +148,8 @@ const std::map<std::string, Operation, std::less<>>& operations()
                                                                             {"code", error->code}});
                                       });
           }}},
-        {"stopReportingSessionForID:reply:",
-         {1, [](auto& service, auto& args, const Responder& responder) {
-              auto id = args.reporterID(0);
-              if (!args.error())
-                  service.stopReportingSessionForID(id, boolReply(responder));
-          }}},
-        {"destroyReportingSession:reply:",
-         {1, [](auto& service, auto& args, const Responder& responder) {
-              auto id = args.reporterID(0);
-              if (!args.error())
-                  service.destroyReportingSession(id, boolReply(responder));
-          }}},
+        {"stopReportingSessionForID:reply:", reporterOperation(&MxReportingServiceProtocol::stopReportingSessionForID)},
+        {"destroyReportingSession:reply:", reporterOperation(&MxReportingServiceProtocol::destroyReportingSession)},
         {"reporterID:valid:",
          {1, [](auto& service, auto& args, const Responder& responder) {
               auto id = args.reporterID(0);

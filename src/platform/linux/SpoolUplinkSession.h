@@ -2,8 +2,6 @@
 // One backend session of the embedded spool backend (see SpoolUplink).
 
 #include <memory>
-#include <mutex>
-#include <vector>
 
 #include "platform/Uplink.h"
 #include "platform/linux/SqliteStore.h"
