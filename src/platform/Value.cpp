@@ -53,15 +53,6 @@ std::vector<Value>& Array::mutableItems()
 
 void Array::append(Value value) { mutableItems().push_back(std::move(value)); }
 
-void Array::insert(std::size_t index, Value value)
-{
-    auto& items = mutableItems();
-    assert(index <= items.size());
-    items.insert(items.begin() + static_cast<std::ptrdiff_t>(index), std::move(value));
-}
-
-void Array::reserve(std::size_t count) { mutableItems().reserve(count); }
-
 bool operator==(const Array& a, const Array& b)
 {
     if (a.items_ == b.items_)

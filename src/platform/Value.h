@@ -37,8 +37,6 @@ public:
     std::vector<Value>::const_iterator end() const;
 
     void append(Value value);
-    void insert(std::size_t index, Value value);
-    void reserve(std::size_t count);
 
     friend bool operator==(const Array& a, const Array& b);
 

@@ -44,12 +44,6 @@ bool FakeWorkQueue::runOne()
     return true;
 }
 
-std::size_t FakeWorkQueue::pending() const
-{
-    std::lock_guard lock(mutex_);
-    return ready_.size() + delayed_.size();
-}
-
 FakeDispatch::FakeDispatch()
     : interactive_(std::make_shared<FakeWorkQueue>("global.interactive", QueuePriority::UserInteractive, *this)),
       utility_(std::make_shared<FakeWorkQueue>("global.utility", QueuePriority::Utility, *this))

@@ -28,7 +28,6 @@ public:
 
     // Runs one ready item; false when none was ready.
     bool runOne();
-    std::size_t pending() const;
 
 private:
     friend class FakeDispatch;
@@ -62,8 +61,6 @@ public:
     void advance(std::chrono::nanoseconds by);
     std::chrono::nanoseconds now() const { return now_; }
 
-    const std::vector<std::shared_ptr<FakeWorkQueue>>& queues() const { return queues_; }
-    FakeWorkQueue& utilityQueue() { return *utility_; }
     int blockingCalls() const { return blockingCalls_; }
 
 private:

@@ -33,12 +33,6 @@ bool FakeUplinkSession::answerDiscovery(std::optional<std::vector<std::string>> 
     return true;
 }
 
-bool FakeUplinkSession::discoveryHeld() const
-{
-    std::lock_guard lock(mutex_);
-    return static_cast<bool>(heldDiscovery_);
-}
-
 void FakeUplinkSession::flushMessages(UniqueFunction<void(std::optional<UplinkError>)> completion)
 {
     {

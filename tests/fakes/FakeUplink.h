@@ -48,7 +48,6 @@ public:
     int flushes() const;
     // Answers a held discovery; false when none is held.
     bool answerDiscovery(std::optional<std::vector<std::string>> backends);
-    bool discoveryHeld() const;
 
 private:
     FakeUplink& uplink_;
