@@ -73,12 +73,5 @@ TEST(MxReportingVocabularyTest, InternalBuildIsAskedOnceHoweverManyThreadsAsk)
     EXPECT_EQ(platform.device.queries(), 1);
 }
 
-TEST(MxReportingVocabularyTest, ComparisonExemptKeysAreFixed)
-{
-    EXPECT_EQ(MxReportingComparisonExemptKeys(),
-              (std::vector<std::string>{"systemuptime_sec", "processuptime_ms", "mxreporting_timestamp",
-                                        "_comparison_field_blacklist", "_throttle_seconds"}));
-}
-
 } // namespace
 } // namespace mx::testing

@@ -17,29 +17,36 @@
 
 namespace mx::testing {
 
-// One ordered record of the effects of several fakes ("trace 0x21042838",
-// "tally com.kestrel...", "joule Tessera_Haptics"), for tests of the order of effects.
-class EffectJournal {
+// A thread-safe list of what a fake was handed, in order.
+template <class Item>
+class Recorder {
 public:
-    void record(std::string effect)
+    void record(Item item)
     {
         std::lock_guard lock(mutex_);
-        effects_.push_back(std::move(effect));
+        items_.push_back(std::move(item));
     }
-    std::vector<std::string> effects() const
+    std::vector<Item> all() const
     {
         std::lock_guard lock(mutex_);
-        return effects_;
+        return items_;
     }
     void clear()
     {
         std::lock_guard lock(mutex_);
-        effects_.clear();
+        items_.clear();
     }
 
 private:
     mutable std::mutex mutex_;
-    std::vector<std::string> effects_;
+    std::vector<Item> items_;
+};
+
+// One ordered record of the effects of several fakes ("trace 0x21042838",
+// "tally com.kestrel...", "joule Tessera_Haptics"), for tests of the order of effects.
+class EffectJournal : public Recorder<std::string> {
+public:
+    std::vector<std::string> effects() const { return all(); }
 };
 
 class RecordingTracePoints final : public TracePoints {
@@ -48,24 +55,14 @@ public:
     void emit(std::uint32_t code, std::uint64_t, std::uint64_t, std::uint64_t, std::uint64_t) override
     {
         journal_.record(fmt::format("trace {:#x}", code));
-        std::lock_guard lock(mutex_);
-        codes_.push_back(code);
+        codes_.record(code);
     }
-    std::vector<std::uint32_t> codes() const
-    {
-        std::lock_guard lock(mutex_);
-        return codes_;
-    }
-    void clear()
-    {
-        std::lock_guard lock(mutex_);
-        codes_.clear();
-    }
+    std::vector<std::uint32_t> codes() const { return codes_.all(); }
+    void clear() { codes_.clear(); }
 
 private:
     EffectJournal& journal_;
-    mutable std::mutex mutex_;
-    std::vector<std::uint32_t> codes_;
+    Recorder<std::uint32_t> codes_;
 };
 
 struct TallyEvent {
@@ -79,20 +76,13 @@ public:
     void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override
     {
         journal_.record(fmt::format("tally {}", name));
-        Dictionary payload = buildPayload();
-        std::lock_guard lock(mutex_);
-        events_.push_back({std::string(name), std::move(payload)});
+        events_.record({std::string(name), buildPayload()});
     }
-    std::vector<TallyEvent> events() const
-    {
-        std::lock_guard lock(mutex_);
-        return events_;
-    }
+    std::vector<TallyEvent> events() const { return events_.all(); }
 
 private:
     EffectJournal& journal_;
-    mutable std::mutex mutex_;
-    std::vector<TallyEvent> events_;
+    Recorder<TallyEvent> events_;
 };
 
 struct JouleEvent {
@@ -107,19 +97,13 @@ public:
     void logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event, const Dictionary*) override
     {
         journal_.record(fmt::format("joule {}", name));
-        std::lock_guard lock(mutex_);
-        events_.push_back({agent, std::string(name), std::move(event)});
+        events_.record({agent, std::string(name), std::move(event)});
     }
-    std::vector<JouleEvent> events() const
-    {
-        std::lock_guard lock(mutex_);
-        return events_;
-    }
+    std::vector<JouleEvent> events() const { return events_.all(); }
 
 private:
     EffectJournal& journal_;
-    mutable std::mutex mutex_;
-    std::vector<JouleEvent> events_;
+    Recorder<JouleEvent> events_;
 };
 
 class FakeDeviceProperties final : public DeviceProperties {

@@ -107,22 +107,6 @@ TEST_F(DaemonIntegrationTest, TwoClientsFollowTheCrossClientRules)
     EXPECT_EQ(*owner->getServiceNameForReporterID(6).value, 65535);
 }
 
-TEST_F(DaemonIntegrationTest, RequestsThatCannotBeHandedOnGetAnRpcErrorAndTheConnectionStays)
-{
-    auto client = connect();
-    auto unknown = client->call("noSuchOperation:", Array{});
-    ASSERT_TRUE(unknown.error);
-    EXPECT_EQ(unknown.error->kind, MxClientError::Kind::Rpc);
-    EXPECT_EQ(unknown.error->code, 1);
-    auto wrongCount = client->call("createReportingSession:reply:", Array{1, 2});
-    ASSERT_TRUE(wrongCount.error);
-    EXPECT_EQ(wrongCount.error->code, 2);
-    auto wrongType = client->call("setServiceType:reportingSession:reply:", Array{70000, 5});
-    ASSERT_TRUE(wrongType.error);
-    EXPECT_THAT(wrongType.error->message, HasSubstr("argument 1"));
-    EXPECT_TRUE(*client->createReportingSession(5).value);
-}
-
 TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
 {
     auto bystander = connect();

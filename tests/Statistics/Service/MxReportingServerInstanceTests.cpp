@@ -427,14 +427,5 @@ TEST_F(MxReportingServerInstanceTest, EntryLinesAreVerboseOnlyAndWorkWaitsForThe
     EXPECT_THAT(replies.values, ElementsAre(true));
 }
 
-using MxReportingServerInstanceDeathTest = MxReportingServerInstanceTest;
-
-TEST_F(MxReportingServerInstanceDeathTest, KillServiceEndsTheProcessWithStatusTwo)
-{
-    GTEST_FLAG_SET(death_test_style, "threadsafe");
-    auto client = connect(1);
-    EXPECT_EXIT(client->killService([](bool) { std::abort(); }), ::testing::ExitedWithCode(2), "");
-}
-
 } // namespace
 } // namespace mx::testing

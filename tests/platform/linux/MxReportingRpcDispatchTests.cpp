@@ -8,9 +8,6 @@
 namespace mx {
 namespace {
 
-using ::testing::_;
-using ::testing::Eq;
-using ::testing::Optional;
 
 class MockService : public MxReportingServiceProtocol {
 public:
@@ -47,30 +44,6 @@ protected:
 
     ::testing::StrictMock<MockService> service;
 };
-
-TEST_F(MxReportingRpcDispatchTest, ArgumentsArriveInDeclarationOrderAndRepliesBecomeResults)
-{
-    EXPECT_CALL(service, setServiceType(7, -3, _)).WillOnce([](auto, auto, MxBoolReply reply) { reply(true); });
-    EXPECT_EQ(dispatch("setServiceType:reportingSession:reply:", Array{7, -3})->results, std::vector<Value>{true});
-
-    EXPECT_CALL(service, sendMessage(Eq(Dictionary{{"a", 1}}), 0x80000001u, 2, Eq(std::nullopt), _))
-        .WillOnce([](auto, auto, auto, auto, MxErrorReply reply) {
-            reply(MxReportingError{"com.kestrel.audio.reporting", 1});
-        });
-    auto refused = dispatch("sendMessage:withCategory:andType:forReportingIDs:reply:",
-                            Array{Dictionary{{"a", 1}}, 0x80000001u, 2, nullptr});
-    Value refusal = Dictionary{{"domain", "com.kestrel.audio.reporting"}, {"code", 1}};
-    EXPECT_EQ(refused->results, std::vector<Value>{refusal});
-
-    EXPECT_CALL(service, setConfiguration(Eq(std::nullopt), 5, _)).WillOnce([](auto, auto, MxBoolReply reply) {
-        reply(true);
-    });
-    dispatch("setConfiguration:forReporterID:reply:", Array{nullptr, 5});
-
-    EXPECT_CALL(service, getAllReporters(_)).WillOnce([](MxReportersReply reply) { reply({3, -4}); });
-    Value reporters = Array{3, -4};
-    EXPECT_EQ(dispatch("getAllReporters:", Array{})->results, std::vector<Value>{reporters});
-}
 
 TEST_F(MxReportingRpcDispatchTest, RequestsThatCannotBeHandedOnAreAnsweredWithAnError)
 {
