@@ -99,11 +99,6 @@ std::string logsRequest(const Json& records)
 
 std::size_t discardBody(char*, std::size_t size, std::size_t count, void*) { return size * count; }
 
-constexpr const char* kSchema[] = {
-    "CREATE TABLE IF NOT EXISTS exports(backend TEXT PRIMARY KEY, stream_cursor INTEGER)",
-    "CREATE TABLE IF NOT EXISTS exported_sessions(backend TEXT, session INTEGER, PRIMARY KEY(backend, session))",
-};
-
 // One-shot messages and realtime sessions' messages, in spool order, past the cursor.
 constexpr const char* kStreamQuery =
     "SELECT m.id, m.time, m.category, m.type, m.payload, coalesce(s.session_info, m.session_info), "
@@ -210,9 +205,8 @@ void OtlpHttpExporter::run()
         MXLOG(nullptr, Error, "otlp exporter cannot open {}: {}", spool_.string(), sqlite3_errmsg(database_));
         return;
     }
+    // The spool made the exports tables before any exporter started.
     sqlite3_busy_timeout(database_, 5000);
-    for (const char* sql : kSchema)
-        sqlite3_exec(database_, sql, nullptr, nullptr, nullptr);
 
     auto backoff = kFirstBackoff;
     for (;;) {
