@@ -8,8 +8,8 @@
 #include <asio/write.hpp>
 #include <msgpack.hpp>
 
-#include "platform/linux/MsgpackRpcDecoder.h"
-#include "platform/linux/MsgpackValue.h"
+#include "wire/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcMessage.h"
 
 namespace mx::bench {
 
@@ -35,18 +35,13 @@ private:
     {
         decoder_.consumed(bytes);
         auto out = std::make_shared<msgpack::sbuffer>();
-        msgpack::packer<msgpack::sbuffer> packer(*out);
         Value message;
         std::string reason;
         while (decoder_.next(message, reason) == MsgpackRpcDecoder::Status::Message) {
             auto request = parseRpcRequest(message, reason);
             if (!request)
                 return;
-            packer.pack_array(4);
-            packer.pack_uint8(1);
-            packer.pack_uint32(request->msgid);
-            packer.pack_nil();
-            packer.pack_nil();
+            encodeRpcResponse(*out, request->msgid, Value(), Value());
         }
         asio::async_write(socket_, asio::buffer(out->data(), out->size()),
                           [self = shared_from_this(), out](const std::error_code& error, std::size_t) {

@@ -132,4 +132,31 @@ int printStore(const std::filesystem::path& storeDirectory, const MxReportStoreQ
     return 0;
 }
 
+std::optional<MxReportStoreQuery> parseStoreQuery(const std::vector<std::string>& words, std::string& error)
+{
+    static const std::vector<std::string> stores = {"events", "power", "sessions", "messages"};
+    if (words.empty() || std::find(stores.begin(), stores.end(), words[0]) == stores.end()) {
+        error = "the stores are events, power, sessions and messages";
+        return std::nullopt;
+    }
+    MxReportStoreQuery query{words[0]};
+    for (std::size_t i = 1; i < words.size(); ++i) {
+        if (words[i] == "--json") {
+            query.json = true;
+            continue;
+        }
+        char* end = nullptr;
+        if (words[i] == "--limit" && i + 1 < words.size()) {
+            long long limit = std::strtoll(words[++i].c_str(), &end, 10);
+            if (*end == '\0' && !words[i].empty()) {
+                query.limit = static_cast<std::size_t>(std::max(0LL, limit));
+                continue;
+            }
+        }
+        error = fmt::format("{} takes --limit N and --json", words[0]);
+        return std::nullopt;
+    }
+    return query;
+}
+
 } // namespace mx

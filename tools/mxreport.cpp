@@ -16,16 +16,16 @@
 #include <sstream>
 #include <string>
 #include <vector>
+#include <unistd.h>
 
 #include <fmt/format.h>
 
-#include "MxReportStoreView.h"
 #include "Statistics/MxReportingVocabulary.h"
 #include "client/MxReportingClient.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/JsonPreferences.h"
 #include "platform/JsonValue.h"
-#include "platform/linux/RootPath.h"
+#include "wire/RootPath.h"
 
 using namespace mx;
 
@@ -347,21 +347,24 @@ int demo(MxReportingClient& client)
     return 0;
 }
 
-std::optional<MxReportStoreQuery> storeQuery(const std::vector<std::string>& words)
+// The store views live in a helper of their own, so that this tool does not link
+// SQLite: it is replaced by mxreport-stores from the same directory.
+std::optional<int> viewStore(const std::vector<std::string>& words)
 {
     static const std::vector<std::string> stores = {"events", "power", "sessions", "messages"};
     if (std::find(stores.begin(), stores.end(), words[0]) == stores.end())
         return std::nullopt;
-    MxReportStoreQuery query{words[0]};
-    for (std::size_t i = 1; i < words.size(); ++i) {
-        if (words[i] == "--json")
-            query.json = true;
-        else if (words[i] == "--limit" && i + 1 < words.size())
-            query.limit = static_cast<std::size_t>(std::max<std::int64_t>(0, parseInteger(words[++i], "limit")));
-        else
-            throw UsageError{fmt::format("{} takes --limit N and --json", words[0])};
-    }
-    return query;
+    std::error_code error;
+    auto helper = std::filesystem::read_symlink("/proc/self/exe", error).parent_path() / "mxreport-stores";
+    std::string program = helper.string();
+    std::vector<std::string> copies = words;
+    std::vector<char*> arguments{program.data()};
+    for (auto& word : copies)
+        arguments.push_back(word.data());
+    arguments.push_back(nullptr);
+    execv(program.c_str(), arguments.data());
+    std::fprintf(stderr, "mxreport: cannot run %s: %s\n", program.c_str(), std::strerror(errno));
+    return kExitUnreachable;
 }
 
 std::vector<std::vector<std::string>> splitCommands(const std::vector<std::string>& words)
@@ -408,8 +411,8 @@ int main(int argc, char** argv)
             return defaults(commands[0]);
         if (commands[0][0] == "notify")
             return notify(commands[0]);
-        if (auto store = storeQuery(commands[0]))
-            return printStore(MxReportingPath("var/lib/harmonia"), *store);
+        if (auto status = viewStore(commands[0]))
+            return *status;
 
         std::string error;
         auto client = MxReportingClient::connect(socket, error);

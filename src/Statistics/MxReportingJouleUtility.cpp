@@ -1,6 +1,5 @@
 #include "Statistics/MxReportingJouleUtility.h"
 
-#include "Statistics/Service/MxReportingSession.h"
 #include "platform/Joule.h"
 #include "platform/MxLog.h"
 
@@ -12,7 +11,7 @@ constexpr const char* kJouleEventName = "Tessera_Haptics";
 } // namespace
 
 void MxReportingJouleUtility::handleEvent(const Dictionary& message, MessageCategory, MessageType,
-                                          const MxReportingSession& session)
+                                          const Dictionary& userInfo)
 {
     const Value* engineOnTime = message.find("EngineOnTime");
     if (!engineOnTime)
@@ -21,7 +20,6 @@ void MxReportingJouleUtility::handleEvent(const Dictionary& message, MessageCate
     Dictionary event;
     event.set("EngineOnDuration", *engineOnTime);
 
-    Dictionary userInfo = session.userInfo()->snapshot();
     Value application = MxReportingHostApplicationID(&userInfo);
     // The lookup falls back to "Unknown"; only a client that configured an explicit
     // null host leaves the event without an application.

@@ -8,13 +8,12 @@
 
 namespace mx {
 
-class MxReportingSession;
-
 class MxReportingJouleUtility {
 public:
     // `category` and `type` play no part; they keep the sinks' calls alike.
+    // `userInfo` is the reporter's session's user information, for the host application.
     static void handleEvent(const Dictionary& message, MessageCategory category, MessageType type,
-                            const MxReportingSession& session);
+                            const Dictionary& userInfo);
 };
 
 } // namespace mx

@@ -2,15 +2,13 @@
 
 #include <fmt/format.h>
 
-#include "Statistics/Service/MxReportingSession.h"
 #include "platform/Tally.h"
 
 namespace mx {
 
 void MxReportingTallyBridge::handleEvent(const Dictionary& message, MessageCategory category, MessageType type,
-                                         const MxReportingSession& session)
+                                         const Dictionary& userInfo)
 {
-    Dictionary userInfo = session.userInfo()->snapshot();
     std::string name = fmt::format("com.kestrel.harmonia.{}.{}", MxReportingCategoryName(category),
                                    MxReportingMessageTypeName(type));
     // The payload is the message as the client sent it (spaces in keys and all) with

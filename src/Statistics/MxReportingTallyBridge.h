@@ -1,19 +1,17 @@
 #pragma once
 // Turns one reporting message into one analytics event named after its category and
-// type, with the host application of the reporter's session added. Stateless;
-// called on the server queue beside every delivery to a session.
+// type, with the host application from the reporter's session's user information
+// added. Stateless; called on the server queue beside every delivery to a session.
 
 #include "Statistics/MxReportingVocabulary.h"
 #include "platform/Value.h"
 
 namespace mx {
 
-class MxReportingSession;
-
 class MxReportingTallyBridge {
 public:
     static void handleEvent(const Dictionary& message, MessageCategory category, MessageType type,
-                            const MxReportingSession& session);
+                            const Dictionary& userInfo);
 };
 
 } // namespace mx

@@ -11,9 +11,10 @@
 #include <asio/post.hpp>
 #include <asio/write.hpp>
 
-#include "platform/linux/MsgpackRpcDecoder.h"
-#include "platform/linux/MsgpackValue.h"
-#include "platform/linux/RootPath.h"
+#include "wire/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcMessage.h"
+#include "wire/MxReportingMethods.h"
+#include "wire/RootPath.h"
 
 namespace mx {
 
@@ -46,16 +47,11 @@ public:
         return true;
     }
 
-    void send(const std::string& method, const Array& params, Callback<Value> done)
+    void send(std::string_view method, const Array& params, Callback<Value> done)
     {
         auto bytes = std::make_shared<msgpack::sbuffer>();
         std::uint32_t msgid = nextMsgid_.fetch_add(1);
-        msgpack::packer<msgpack::sbuffer> packer(*bytes);
-        packer.pack_array(4);
-        packer.pack_uint8(0);
-        packer.pack_uint32(msgid);
-        encodeMsgpack(packer, method);
-        encodeMsgpack(packer, params);
+        encodeRpcRequest(*bytes, msgid, method, params);
         asio::post(io_, [self = shared_from_this(), msgid, bytes = std::move(bytes), done = std::move(done)]() mutable {
             if (self->closed_) {
                 if (done)
@@ -259,67 +255,67 @@ MxReportingClient::MxReportingClient(std::shared_ptr<Connection> connection) : c
 
 MxReportingClient::~MxReportingClient() = default;
 
-void MxReportingClient::call(const std::string& method, const Array& params, Callback<Value> done)
+void MxReportingClient::call(std::string_view method, const Array& params, Callback<Value> done)
 {
     connection_->send(method, params, std::move(done));
 }
 
 void MxReportingClient::createReportingSession(ReporterID reporterID, Callback<bool> done)
 {
-    call("createReportingSession:reply:", Array{reporterID}, adapt<bool>(std::move(done), toBool));
+    call(method::kCreateReportingSession, Array{reporterID}, adapt<bool>(std::move(done), toBool));
 }
 
 void MxReportingClient::setServiceType(ServiceType serviceType, ReporterID reporterID, Callback<bool> done)
 {
-    call("setServiceType:reportingSession:reply:", Array{serviceType, reporterID}, adapt<bool>(std::move(done), toBool));
+    call(method::kSetServiceType, Array{serviceType, reporterID}, adapt<bool>(std::move(done), toBool));
 }
 
 void MxReportingClient::getServiceNameForReporterID(ReporterID reporterID, Callback<ServiceType> done)
 {
-    call("getServiceNameForReporterID:reply:", Array{reporterID}, adapt<ServiceType>(std::move(done), toServiceType));
+    call(method::kGetServiceNameForReporterID, Array{reporterID}, adapt<ServiceType>(std::move(done), toServiceType));
 }
 
 void MxReportingClient::setConfiguration(const std::optional<Dictionary>& configuration, ReporterID reporterID,
                                          Callback<bool> done)
 {
-    call("setConfiguration:forReporterID:reply:", Array{optionalDictionary(configuration), reporterID},
+    call(method::kSetConfiguration, Array{optionalDictionary(configuration), reporterID},
          adapt<bool>(std::move(done), toBool));
 }
 
 void MxReportingClient::startReportingSessionForID(ReporterID reporterID, Callback<bool> done)
 {
-    call("startReportingSessionForID:reply:", Array{reporterID}, adapt<bool>(std::move(done), toBool));
+    call(method::kStartReportingSessionForID, Array{reporterID}, adapt<bool>(std::move(done), toBool));
 }
 
 void MxReportingClient::sendMessage(const Dictionary& payload, MessageCategory category, MessageType type,
                                     const std::optional<std::vector<ReporterID>>& reportingIDs,
                                     Callback<MxSendOutcome> done)
 {
-    call("sendMessage:withCategory:andType:forReportingIDs:reply:",
+    call(method::kSendMessage,
          Array{payload, category, type, reporterIDs(reportingIDs)}, adapt<MxSendOutcome>(std::move(done), toSendOutcome));
 }
 
 void MxReportingClient::stopReportingSessionForID(ReporterID reporterID, Callback<bool> done)
 {
-    call("stopReportingSessionForID:reply:", Array{reporterID}, adapt<bool>(std::move(done), toBool));
+    call(method::kStopReportingSessionForID, Array{reporterID}, adapt<bool>(std::move(done), toBool));
 }
 
 void MxReportingClient::destroyReportingSession(ReporterID reporterID, Callback<bool> done)
 {
-    call("destroyReportingSession:reply:", Array{reporterID}, adapt<bool>(std::move(done), toBool));
+    call(method::kDestroyReportingSession, Array{reporterID}, adapt<bool>(std::move(done), toBool));
 }
 
 void MxReportingClient::reporterID(ReporterID reporterID, Callback<Dictionary> valid)
 {
-    call("reporterID:valid:", Array{reporterID}, adapt<Dictionary>(std::move(valid), toDictionary));
+    call(method::kReporterIDValid, Array{reporterID}, adapt<Dictionary>(std::move(valid), toDictionary));
 }
 
 void MxReportingClient::getAllReporters(Callback<std::vector<ReporterID>> done)
 {
-    call("getAllReporters:", Array{}, adapt<std::vector<ReporterID>>(std::move(done), toReporters));
+    call(method::kGetAllReporters, Array{}, adapt<std::vector<ReporterID>>(std::move(done), toReporters));
 }
 
-void MxReportingClient::killService() { call("killService:", Array{}, nullptr); }
+void MxReportingClient::killService() { call(method::kKillService, Array{}, nullptr); }
 
 template <class T>
 MxClientResult<T> MxReportingClient::wait(const std::function<void(Callback<T>)>& start)
@@ -332,7 +328,7 @@ MxClientResult<T> MxReportingClient::wait(const std::function<void(Callback<T>)>
     return future.get();
 }
 
-MxClientResult<Value> MxReportingClient::call(const std::string& method, const Array& params)
+MxClientResult<Value> MxReportingClient::call(std::string_view method, const Array& params)
 {
     return wait<Value>([&](Callback<Value> done) { call(method, params, std::move(done)); });
 }

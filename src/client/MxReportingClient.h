@@ -12,6 +12,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <variant>
 #include <vector>
 
@@ -91,8 +92,8 @@ public:
     MxClientResult<std::vector<ReporterID>> getAllReporters();
 
     // Any method with any parameters: the raw result, for tools and tests.
-    void call(const std::string& method, const Array& params, Callback<Value> done);
-    MxClientResult<Value> call(const std::string& method, const Array& params);
+    void call(std::string_view method, const Array& params, Callback<Value> done);
+    MxClientResult<Value> call(std::string_view method, const Array& params);
 
 private:
     class Connection;

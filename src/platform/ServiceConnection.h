@@ -1,18 +1,51 @@
 #pragma once
 // The service connection layer: a named listener accepts client connections; each
-// connection exports one object implementing the request protocol and tells its
-// owner, once, when it is interrupted or invalidated. All of these calls and
-// handlers run on the connection layer's threads.
+// connection carries requests (a method name and its parameters) to the one object
+// it exports and carries that object's replies back. The layer knows no method of
+// any service. It tells its owner, once, when the connection is interrupted or
+// invalidated. All of these calls and handlers run on the connection layer's threads.
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
 #include <sys/types.h>
 
+#include "platform/Value.h"
+
 namespace mx {
 
-class MxReportingServiceProtocol;
 class ServiceListener;
+
+// Why a request could not be handed to the service. The connection stays usable.
+inline constexpr std::int64_t kServiceErrorUnknownMethod = 1;
+inline constexpr std::int64_t kServiceErrorBadArguments = 2;
+
+struct ServiceError {
+    std::int64_t code = 0;
+    std::string message;
+    friend bool operator==(const ServiceError&, const ServiceError&) = default;
+};
+
+// The way back to the client for one request. Callable from any thread, any number
+// of times: the first reply is sent, later ones are dropped, and so is every reply
+// whose connection is gone.
+class ServiceReply {
+public:
+    virtual ~ServiceReply() = default;
+    virtual void respond(const Value& result) = 0;
+    virtual void fail(const ServiceError& error) = 0;
+};
+
+// What a connection exports: it is handed every request of the connection, in the
+// order they arrived, on the connection layer's thread.
+class ServiceExportedObject {
+public:
+    virtual ~ServiceExportedObject() = default;
+    // `params` is nothing when the request's parameters are not an array.
+    virtual void handleRequest(const std::string& method, const Array* params,
+                               std::shared_ptr<ServiceReply> reply) = 0;
+};
 
 class ServiceConnection {
 public:
@@ -21,7 +54,7 @@ public:
     virtual std::string description() const = 0;
     // Requests arriving on the connection are handed to `object`, which the
     // connection holds until it is invalidated.
-    virtual void setExportedObject(std::shared_ptr<MxReportingServiceProtocol> object) = 0;
+    virtual void setExportedObject(std::shared_ptr<ServiceExportedObject> object) = 0;
     virtual void setInterruptionHandler(std::function<void()> handler) = 0;
     virtual void setInvalidationHandler(std::function<void()> handler) = 0;
     // Starts delivering requests.

@@ -71,12 +71,12 @@ public:
     explicit FakeServiceConnection(pid_t pid) : pid_(pid) {}
     pid_t processIdentifier() const override { return pid_; }
     std::string description() const override { return "<fake connection " + std::to_string(pid_) + ">"; }
-    void setExportedObject(std::shared_ptr<MxReportingServiceProtocol> object) override { exported = std::move(object); }
+    void setExportedObject(std::shared_ptr<ServiceExportedObject> object) override { exported = std::move(object); }
     void setInterruptionHandler(std::function<void()> handler) override { interruption = std::move(handler); }
     void setInvalidationHandler(std::function<void()> handler) override { invalidation = std::move(handler); }
     void resume() override { resumed = true; }
 
-    std::shared_ptr<MxReportingServiceProtocol> exported;
+    std::shared_ptr<ServiceExportedObject> exported;
     std::function<void()> interruption;
     std::function<void()> invalidation;
     bool resumed = false;

@@ -6,9 +6,10 @@
 #include <cstdint>
 #include <cstring>
 
+#include "Statistics/Service/MxReportingRequestDispatch.h"
 #include "Statistics/Service/MxReportingServiceProtocol.h"
-#include "platform/linux/MsgpackRpcDecoder.h"
-#include "platform/linux/MxReportingRpcDispatch.h"
+#include "wire/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcMessage.h"
 
 namespace {
 
@@ -33,10 +34,10 @@ public:
     void killService(MxBoolReply reply) override { reply(false); } // the real one exits
 };
 
-class CountingResponder final : public RpcResponder {
+class CountingReply final : public ServiceReply {
 public:
     void respond(const Value&) override { ++answers; }
-    void fail(const RpcError&) override { ++answers; }
+    void fail(const ServiceError&) override { ++answers; }
     int answers = 0;
 };
 
@@ -51,7 +52,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     ++data;
     --size;
     MsgpackRpcDecoder decoder(1 << 16);
-    AnsweringService service;
+    MxReportingRequestDispatch dispatch(std::make_shared<AnsweringService>());
     for (std::size_t offset = 0; offset < size; offset += chunk) {
         std::size_t count = std::min(chunk, size - offset);
         decoder.feed(reinterpret_cast<const char*>(data + offset), count);
@@ -66,9 +67,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
             auto request = parseRpcRequest(message, reason);
             if (!request)
                 return 0;
-            auto responder = std::make_shared<CountingResponder>();
-            dispatchReportingRequest(service, *request, responder);
-            if (responder->answers < 1)
+            auto reply = std::make_shared<CountingReply>();
+            dispatch.handleRequest(request->method, request->params ? &*request->params : nullptr, reply);
+            if (reply->answers < 1)
                 __builtin_trap();
         }
     }

@@ -264,8 +264,9 @@ void MxReportingServerInstance::handleSendMessage(const Dictionary& payload, Mes
         auto session = findReportingSessionForID(reporterID, true);
         if (!session)
             continue;
-        MxReportingTallyBridge::handleEvent(payload, category, type, *session);
-        MxReportingJouleUtility::handleEvent(payload, category, type, *session);
+        Dictionary userInfo = session->userInfo()->snapshot();
+        MxReportingTallyBridge::handleEvent(payload, category, type, userInfo);
+        MxReportingJouleUtility::handleEvent(payload, category, type, userInfo);
         session->sendMessage(payload, category, type, nullptr);
     }
     reply(std::nullopt);
@@ -296,8 +297,9 @@ void MxReportingServerInstance::sendToStartedSessions(const Dictionary& payload,
     }
     for (const auto& session : active) {
         session->sendMessage(payload, category, type, nullptr);
-        MxReportingTallyBridge::handleEvent(payload, category, type, *session);
-        MxReportingJouleUtility::handleEvent(payload, category, type, *session);
+        Dictionary userInfo = session->userInfo()->snapshot();
+        MxReportingTallyBridge::handleEvent(payload, category, type, userInfo);
+        MxReportingJouleUtility::handleEvent(payload, category, type, userInfo);
     }
 }
 
@@ -332,7 +334,8 @@ void MxReportingServerInstance::sendDriverStatistics(MxReportingSession& session
         return;
     }
     session.sendMessage(*statistics, message_category::kDriverStats, message_type::kGeneric, nullptr);
-    MxReportingTallyBridge::handleEvent(*statistics, message_category::kDriverStats, message_type::kGeneric, session);
+    MxReportingTallyBridge::handleEvent(*statistics, message_category::kDriverStats, message_type::kGeneric,
+                                        session.userInfo()->snapshot());
     MXLOG(logScope(), Default, "fetching driver logs {}", Value(*statistics).description());
 }
 

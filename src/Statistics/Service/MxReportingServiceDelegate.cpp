@@ -3,6 +3,7 @@
 #include <cassert>
 #include <cmath>
 
+#include "Statistics/Service/MxReportingRequestDispatch.h"
 #include "platform/MxLog.h"
 #include "platform/Tally.h"
 
@@ -46,7 +47,7 @@ bool MxReportingServiceDelegate::shouldAcceptNewConnection(ServiceListener&,
     {
         std::lock_guard lock(lock_);
         client = std::make_shared<MxReportingServerInstance>(pid, weak_from_this(), serverQueue_);
-        connection->setExportedObject(client);
+        connection->setExportedObject(std::make_shared<MxReportingRequestDispatch>(client));
     }
 
     // Requests of the new client queue up behind its registration.

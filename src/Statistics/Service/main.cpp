@@ -23,7 +23,7 @@
 #include "platform/linux/MsgpackRpcListener.h"
 #include "platform/linux/PosixFileSystem.h"
 #include "platform/linux/ProcProcessTable.h"
-#include "platform/linux/RootPath.h"
+#include "wire/RootPath.h"
 #include "platform/linux/SpoolUplink.h"
 #include "platform/linux/SqliteJoule.h"
 #include "platform/linux/SqliteTally.h"

@@ -7,10 +7,8 @@
 #include <asio/write.hpp>
 #include <fmt/format.h>
 
-#include "Statistics/Service/MxReportingServiceProtocol.h"
 #include "platform/MxLog.h"
-#include "platform/linux/MsgpackValue.h"
-#include "platform/linux/MxReportingRpcDispatch.h"
+#include "wire/MsgpackRpcMessage.h"
 
 namespace mx {
 
@@ -18,9 +16,9 @@ namespace {
 
 // Sends the first reply of one request and drops the rest: the protocol's own rules
 // allow a second reply (and a reply after the client left).
-class ConnectionResponder final : public RpcResponder {
+class ConnectionReply final : public ServiceReply {
 public:
-    ConnectionResponder(std::weak_ptr<MsgpackRpcConnection> connection, std::uint32_t msgid)
+    ConnectionReply(std::weak_ptr<MsgpackRpcConnection> connection, std::uint32_t msgid)
         : connection_(std::move(connection)), msgid_(msgid)
     {
     }
@@ -32,7 +30,7 @@ public:
                 connection->sendResponse(msgid_, Value(), result);
     }
 
-    void fail(const RpcError& error) override
+    void fail(const ServiceError& error) override
     {
         if (claim())
             if (auto connection = connection_.lock())
@@ -46,16 +44,6 @@ private:
     std::uint32_t msgid_;
     std::atomic<bool> replied_{false};
 };
-
-void encodeResponse(msgpack::sbuffer& bytes, std::uint32_t msgid, const Value& error, const Value& result)
-{
-    msgpack::packer<msgpack::sbuffer> packer(bytes);
-    packer.pack_array(4);
-    packer.pack_uint8(1);
-    packer.pack_uint32(msgid);
-    encodeMsgpack(packer, error);
-    encodeMsgpack(packer, result);
-}
 
 } // namespace
 
@@ -77,7 +65,7 @@ std::string MsgpackRpcConnection::description() const
     return fmt::format("<connection {} from pid {} uid {}>", number_, pid_, uid_);
 }
 
-void MsgpackRpcConnection::setExportedObject(std::shared_ptr<MxReportingServiceProtocol> object)
+void MsgpackRpcConnection::setExportedObject(std::shared_ptr<ServiceExportedObject> object)
 {
     exported_ = std::move(object);
 }
@@ -145,12 +133,12 @@ bool MsgpackRpcConnection::handleMessage(const Value& message)
         close(reason);
         return false;
     }
-    auto responder = std::make_shared<ConnectionResponder>(weak_from_this(), request->msgid);
+    auto reply = std::make_shared<ConnectionReply>(weak_from_this(), request->msgid);
     if (!exported_) {
-        responder->fail({kRpcErrorUnknownMethod, "nothing is exported on this connection"});
+        reply->fail({kServiceErrorUnknownMethod, "nothing is exported on this connection"});
         return true;
     }
-    dispatchReportingRequest(*exported_, *request, responder);
+    exported_->handleRequest(request->method, request->params ? &*request->params : nullptr, std::move(reply));
     return true;
 }
 
@@ -162,7 +150,7 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
     std::lock_guard lock(repliesMutex_);
     if (!replies_)
         replies_ = std::make_shared<msgpack::sbuffer>();
-    encodeResponse(*replies_, msgid, error, result);
+    encodeRpcResponse(*replies_, msgid, error, result);
     if (flushScheduled_)
         return;
     flushScheduled_ = true;
@@ -181,7 +169,7 @@ void MsgpackRpcConnection::flushReplies()
         enqueue(std::move(replies));
 }
 
-void MsgpackRpcConnection::sendError(std::uint32_t msgid, const RpcError& error)
+void MsgpackRpcConnection::sendError(std::uint32_t msgid, const ServiceError& error)
 {
     sendResponse(msgid, Dictionary{{"code", error.code}, {"message", error.message}}, Value());
 }

@@ -1,7 +1,7 @@
 #pragma once
 // One client connection of the listener: reads msgpack-rpc requests from the Unix
-// stream socket, hands them to the exported object, and writes the replies back in
-// whatever order they come. Bad input closes only this connection, with one log
+// stream socket, hands each (method name and parameters, whatever the method) to the
+// exported object, and writes the replies back in whatever order they come. Bad input closes only this connection, with one log
 // line. A client that stops reading its replies is back-pressured: its requests are
 // not read while its unsent replies exceed a bound.
 // Lives on the connection layer's I/O thread; replies may be sent from any thread.
@@ -18,11 +18,9 @@
 #include <msgpack.hpp>
 
 #include "platform/ServiceConnection.h"
-#include "platform/linux/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcDecoder.h"
 
 namespace mx {
-
-struct RpcError;
 
 class MsgpackRpcConnection final : public ServiceConnection,
                                    public std::enable_shared_from_this<MsgpackRpcConnection> {
@@ -35,14 +33,14 @@ public:
 
     pid_t processIdentifier() const override { return pid_; }
     std::string description() const override;
-    void setExportedObject(std::shared_ptr<MxReportingServiceProtocol> object) override;
+    void setExportedObject(std::shared_ptr<ServiceExportedObject> object) override;
     void setInterruptionHandler(std::function<void()> handler) override;
     void setInvalidationHandler(std::function<void()> handler) override;
     void resume() override;
 
     // Any thread. Dropped when the connection is gone.
     void sendResponse(std::uint32_t msgid, const Value& error, const Value& result);
-    void sendError(std::uint32_t msgid, const RpcError& error);
+    void sendError(std::uint32_t msgid, const ServiceError& error);
 
 private:
     void readMore();
@@ -60,7 +58,7 @@ private:
 
     // I/O thread only.
     MsgpackRpcDecoder decoder_;
-    std::shared_ptr<MxReportingServiceProtocol> exported_;
+    std::shared_ptr<ServiceExportedObject> exported_;
     std::function<void()> interruptionHandler_;
     std::function<void()> invalidationHandler_;
     std::deque<std::shared_ptr<msgpack::sbuffer>> outbox_;

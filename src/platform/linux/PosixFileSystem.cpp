@@ -6,7 +6,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "platform/linux/RootPath.h"
+#include "wire/RootPath.h"
 
 namespace mx {
 

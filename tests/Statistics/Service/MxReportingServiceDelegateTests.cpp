@@ -28,9 +28,13 @@ protected:
         return connection;
     }
 
-    static MxReportingServerInstance& instance(const FakeServiceConnection& connection)
+    // The endpoint the root made for that connection, once registered.
+    MxReportingServerInstance& instance(const FakeServiceConnection& connection)
     {
-        return static_cast<MxReportingServerInstance&>(*connection.exported);
+        for (const auto& client : clients())
+            if (client->processIdentifier() == connection.processIdentifier())
+                return *client;
+        throw std::logic_error("no endpoint for " + connection.description());
     }
 
     void run() { platform.dispatch.runUntilIdle(); }
@@ -64,7 +68,7 @@ TEST_F(MxReportingServiceDelegateTest, AcceptedClientsAreRegisteredInOrderWithNa
     run();
     auto clients = this->clients();
     ASSERT_EQ(clients.size(), 3u);
-    EXPECT_EQ(clients[0].get(), &instance(*first));
+    EXPECT_EQ(clients[0]->processIdentifier(), first->processIdentifier());
     EXPECT_EQ(clients[0]->clientProcessName(), "player");
     EXPECT_GE(*clients[0]->clientStartDate(), before);
     EXPECT_EQ(clients[1]->clientProcessName(), "mxreportingd");

@@ -1,8 +1,9 @@
-#include "platform/linux/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcMessage.h"
 
 #include <gtest/gtest.h>
 
-#include "platform/linux/MsgpackValue.h"
+#include "wire/MsgpackValue.h"
 
 namespace mx {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/MxReportingRpcDispatch.h"
+#include "Statistics/Service/MxReportingRequestDispatch.h"
 
 #include <functional>
 #include <limits>
@@ -7,6 +7,7 @@
 #include <fmt/format.h>
 
 #include "Statistics/Service/MxReportingServiceProtocol.h"
+#include "wire/MxReportingMethods.h"
 
 namespace mx {
 
@@ -68,22 +69,22 @@ public:
         return std::nullopt;
     }
 
-    const std::optional<RpcError>& error() const { return error_; }
+    const std::optional<ServiceError>& error() const { return error_; }
 
 private:
     void refuse(std::size_t index, const char* what)
     {
         if (!error_)
-            error_ = RpcError{kRpcErrorBadArguments,
+            error_ = ServiceError{kServiceErrorBadArguments,
                               fmt::format("argument {} of {} must be {}", index + 1, method_, what)};
     }
 
     const std::string& method_;
     const Array& params_;
-    std::optional<RpcError> error_;
+    std::optional<ServiceError> error_;
 };
 
-using Responder = std::shared_ptr<RpcResponder>;
+using Responder = std::shared_ptr<ServiceReply>;
 using Call = std::function<void(MxReportingServiceProtocol&, Arguments&, const Responder&)>;
 
 struct Operation {
@@ -109,29 +110,29 @@ Operation reporterOperation(void (MxReportingServiceProtocol::*call)(ReporterID,
 const std::map<std::string, Operation, std::less<>>& operations()
 {
     static const std::map<std::string, Operation, std::less<>> table = {
-        {"createReportingSession:reply:", reporterOperation(&MxReportingServiceProtocol::createReportingSession)},
-        {"setServiceType:reportingSession:reply:",
+        {std::string(method::kCreateReportingSession), reporterOperation(&MxReportingServiceProtocol::createReportingSession)},
+        {std::string(method::kSetServiceType),
          {2, [](auto& service, auto& args, const Responder& responder) {
               auto type = static_cast<ServiceType>(args.unsignedInteger(0, 0xFFFF, "an unsigned 16-bit service type"));
               auto id = args.reporterID(1);
               if (!args.error())
                   service.setServiceType(type, id, boolReply(responder));
           }}},
-        {"getServiceNameForReporterID:reply:",
+        {std::string(method::kGetServiceNameForReporterID),
          {1, [](auto& service, auto& args, const Responder& responder) {
               auto id = args.reporterID(0);
               if (!args.error())
                   service.getServiceNameForReporterID(id, [responder](ServiceType type) { responder->respond(type); });
           }}},
-        {"setConfiguration:forReporterID:reply:",
+        {std::string(method::kSetConfiguration),
          {2, [](auto& service, auto& args, const Responder& responder) {
               auto configuration = args.optionalDictionary(0);
               auto id = args.reporterID(1);
               if (!args.error())
                   service.setConfiguration(std::move(configuration), id, boolReply(responder));
           }}},
-        {"startReportingSessionForID:reply:", reporterOperation(&MxReportingServiceProtocol::startReportingSessionForID)},
-        {"sendMessage:withCategory:andType:forReportingIDs:reply:",
+        {std::string(method::kStartReportingSessionForID), reporterOperation(&MxReportingServiceProtocol::startReportingSessionForID)},
+        {std::string(method::kSendMessage),
          {4, [](auto& service, auto& args, const Responder& responder) {
               auto payload = args.dictionary(0);
               auto category =
@@ -148,21 +149,21 @@ const std::map<std::string, Operation, std::less<>>& operations()
                                                                             {"code", error->code}});
                                       });
           }}},
-        {"stopReportingSessionForID:reply:", reporterOperation(&MxReportingServiceProtocol::stopReportingSessionForID)},
-        {"destroyReportingSession:reply:", reporterOperation(&MxReportingServiceProtocol::destroyReportingSession)},
-        {"reporterID:valid:",
+        {std::string(method::kStopReportingSessionForID), reporterOperation(&MxReportingServiceProtocol::stopReportingSessionForID)},
+        {std::string(method::kDestroyReportingSession), reporterOperation(&MxReportingServiceProtocol::destroyReportingSession)},
+        {std::string(method::kReporterIDValid),
          {1, [](auto& service, auto& args, const Responder& responder) {
               auto id = args.reporterID(0);
               if (!args.error())
                   service.reporterID(id, [responder](Dictionary validity) { responder->respond(validity); });
           }}},
-        {"getAllReporters:",
+        {std::string(method::kGetAllReporters),
          {0, [](auto& service, auto&, const Responder& responder) {
               service.getAllReporters([responder](std::vector<ReporterID> reporters) {
                   responder->respond(Array(std::vector<Value>(reporters.begin(), reporters.end())));
               });
           }}},
-        {"killService:",
+        {std::string(method::kKillService),
          {0, [](auto& service, auto&, const Responder& responder) { service.killService(boolReply(responder)); }}},
     };
     return table;
@@ -170,27 +171,32 @@ const std::map<std::string, Operation, std::less<>>& operations()
 
 } // namespace
 
-void dispatchReportingRequest(MxReportingServiceProtocol& service, const RpcRequest& request,
-                              const std::shared_ptr<RpcResponder>& responder)
+MxReportingRequestDispatch::MxReportingRequestDispatch(std::shared_ptr<MxReportingServiceProtocol> service)
+    : service_(std::move(service))
 {
-    auto operation = operations().find(request.method);
+}
+
+void MxReportingRequestDispatch::handleRequest(const std::string& method, const Array* params,
+                                               std::shared_ptr<ServiceReply> reply)
+{
+    auto operation = operations().find(method);
     if (operation == operations().end()) {
-        responder->fail({kRpcErrorUnknownMethod, fmt::format("unknown method {}", request.method)});
+        reply->fail({kServiceErrorUnknownMethod, fmt::format("unknown method {}", method)});
         return;
     }
-    if (!request.params) {
-        responder->fail({kRpcErrorBadArguments, fmt::format("parameters of {} must be an array", request.method)});
+    if (!params) {
+        reply->fail({kServiceErrorBadArguments, fmt::format("parameters of {} must be an array", method)});
         return;
     }
-    if (request.params->size() != operation->second.arity) {
-        responder->fail({kRpcErrorBadArguments, fmt::format("{} takes {} arguments, not {}", request.method,
-                                                            operation->second.arity, request.params->size())});
+    if (params->size() != operation->second.arity) {
+        reply->fail({kServiceErrorBadArguments,
+                     fmt::format("{} takes {} arguments, not {}", method, operation->second.arity, params->size())});
         return;
     }
-    Arguments arguments(request.method, *request.params);
-    operation->second.call(service, arguments, responder);
+    Arguments arguments(method, *params);
+    operation->second.call(*service_, arguments, reply);
     if (arguments.error())
-        responder->fail(*arguments.error());
+        reply->fail(*arguments.error());
 }
 
 } // namespace mx

@@ -1,8 +1,8 @@
-#include "platform/linux/MsgpackRpcDecoder.h"
+#include "wire/MsgpackRpcDecoder.h"
 
 #include <cstring>
 
-#include "platform/linux/MsgpackValue.h"
+#include "wire/MsgpackValue.h"
 
 namespace mx {
 
@@ -78,51 +78,6 @@ MsgpackRpcDecoder::Status MsgpackRpcDecoder::next(Value& message, std::string& r
         return Status::Bad;
     message = std::move(*decoded);
     return Status::Message;
-}
-
-namespace {
-
-const Array* messageArray(const Value& message, std::size_t size, std::int64_t type, std::string& reason)
-{
-    const Array* array = message.asArray();
-    if (!array || array->size() != size || (*array)[0].kind() != Value::Kind::Int || *(*array)[0].asInt() != type) {
-        reason = type == 0 ? "not a msgpack-rpc request" : "not a msgpack-rpc response";
-        return nullptr;
-    }
-    const Value& msgid = (*array)[1];
-    if (msgid.kind() != Value::Kind::Int || *msgid.asInt() < 0 || *msgid.asInt() > std::int64_t(UINT32_MAX)) {
-        reason = "message id is not an unsigned 32-bit integer";
-        return nullptr;
-    }
-    return array;
-}
-
-} // namespace
-
-std::optional<RpcRequest> parseRpcRequest(const Value& message, std::string& reason)
-{
-    const Array* array = messageArray(message, 4, 0, reason);
-    if (!array)
-        return std::nullopt;
-    const std::string* method = (*array)[2].asString();
-    if (!method) {
-        reason = "method name is not a string";
-        return std::nullopt;
-    }
-    RpcRequest request{static_cast<std::uint32_t>(*(*array)[1].asInt()), *method, std::nullopt};
-    // Parameters that are not an array are the request's own problem, answered with
-    // an error; the connection stays usable.
-    if (const Array* params = (*array)[3].asArray())
-        request.params = *params;
-    return request;
-}
-
-std::optional<RpcResponse> parseRpcResponse(const Value& message, std::string& reason)
-{
-    const Array* array = messageArray(message, 4, 1, reason);
-    if (!array)
-        return std::nullopt;
-    return RpcResponse{static_cast<std::uint32_t>(*(*array)[1].asInt()), (*array)[2], (*array)[3]};
 }
 
 } // namespace mx

@@ -5,7 +5,6 @@
 // library reads responses. Not thread-safe; one per connection.
 
 #include <cstdint>
-#include <optional>
 #include <span>
 #include <string>
 
@@ -16,18 +15,6 @@
 namespace mx {
 
 inline constexpr std::size_t kMsgpackRpcMaximumMessageBytes = 1 << 20;
-
-struct RpcRequest {
-    std::uint32_t msgid = 0;
-    std::string method;
-    std::optional<Array> params; // nothing when the request's parameters are not an array
-};
-
-struct RpcResponse {
-    std::uint32_t msgid = 0;
-    Value error;
-    Value result;
-};
 
 class MsgpackRpcDecoder {
 public:
@@ -50,10 +37,5 @@ private:
     std::size_t maximumMessageBytes_;
     msgpack::unpacker unpacker_;
 };
-
-// The request or response in a decoded message; nothing, with `reason`, when the
-// message is not one.
-std::optional<RpcRequest> parseRpcRequest(const Value& message, std::string& reason);
-std::optional<RpcResponse> parseRpcResponse(const Value& message, std::string& reason);
 
 } // namespace mx

@@ -1,4 +1,4 @@
-#include "platform/linux/RootPath.h"
+#include "wire/RootPath.h"
 
 #include <cstdlib>
 

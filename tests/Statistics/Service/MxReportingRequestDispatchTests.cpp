@@ -1,4 +1,4 @@
-#include "platform/linux/MxReportingRpcDispatch.h"
+#include "Statistics/Service/MxReportingRequestDispatch.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -7,7 +7,6 @@
 
 namespace mx {
 namespace {
-
 
 class MockService : public MxReportingServiceProtocol {
 public:
@@ -25,27 +24,27 @@ public:
     MOCK_METHOD(void, killService, (MxBoolReply), (override));
 };
 
-class RecordingResponder final : public RpcResponder {
+class RecordingReply final : public ServiceReply {
 public:
     void respond(const Value& result) override { results.push_back(result); }
-    void fail(const RpcError& error) override { errors.push_back(error); }
+    void fail(const ServiceError& error) override { errors.push_back(error); }
     std::vector<Value> results;
-    std::vector<RpcError> errors;
+    std::vector<ServiceError> errors;
 };
 
-class MxReportingRpcDispatchTest : public ::testing::Test {
+class MxReportingRequestDispatchTest : public ::testing::Test {
 protected:
-    std::shared_ptr<RecordingResponder> dispatch(const std::string& method, std::optional<Array> params)
+    std::shared_ptr<RecordingReply> dispatch(const std::string& method, std::optional<Array> params)
     {
-        auto responder = std::make_shared<RecordingResponder>();
-        dispatchReportingRequest(service, RpcRequest{1, method, std::move(params)}, responder);
-        return responder;
+        auto reply = std::make_shared<RecordingReply>();
+        MxReportingRequestDispatch(service).handleRequest(method, params ? &*params : nullptr, reply);
+        return reply;
     }
 
-    ::testing::StrictMock<MockService> service;
+    std::shared_ptr<::testing::StrictMock<MockService>> service = std::make_shared<::testing::StrictMock<MockService>>();
 };
 
-TEST_F(MxReportingRpcDispatchTest, RequestsThatCannotBeHandedOnAreAnsweredWithAnError)
+TEST_F(MxReportingRequestDispatchTest, RequestsThatCannotBeHandedOnAreAnsweredWithAnError)
 {
     struct Case {
         std::string method;
@@ -53,16 +52,16 @@ TEST_F(MxReportingRpcDispatchTest, RequestsThatCannotBeHandedOnAreAnsweredWithAn
         std::int64_t code;
     };
     std::vector<Case> cases = {
-        {"unknown:", Array{}, kRpcErrorUnknownMethod},
-        {"createReportingSession:reply:", std::nullopt, kRpcErrorBadArguments},
-        {"createReportingSession:reply:", Array{}, kRpcErrorBadArguments},
-        {"createReportingSession:reply:", Array{"5"}, kRpcErrorBadArguments},
-        {"createReportingSession:reply:", Array{18446744073709551615ull}, kRpcErrorBadArguments},
-        {"setServiceType:reportingSession:reply:", Array{65536, 1}, kRpcErrorBadArguments},
+        {"unknown:", Array{}, kServiceErrorUnknownMethod},
+        {"createReportingSession:reply:", std::nullopt, kServiceErrorBadArguments},
+        {"createReportingSession:reply:", Array{}, kServiceErrorBadArguments},
+        {"createReportingSession:reply:", Array{"5"}, kServiceErrorBadArguments},
+        {"createReportingSession:reply:", Array{18446744073709551615ull}, kServiceErrorBadArguments},
+        {"setServiceType:reportingSession:reply:", Array{65536, 1}, kServiceErrorBadArguments},
         {"sendMessage:withCategory:andType:forReportingIDs:reply:", Array{Dictionary{}, -1, 0, nullptr},
-         kRpcErrorBadArguments},
-        {"sendMessage:withCategory:andType:forReportingIDs:reply:", Array{Dictionary{}, 1, 0, 5}, kRpcErrorBadArguments},
-        {"setConfiguration:forReporterID:reply:", Array{Array{}, 1}, kRpcErrorBadArguments},
+         kServiceErrorBadArguments},
+        {"sendMessage:withCategory:andType:forReportingIDs:reply:", Array{Dictionary{}, 1, 0, 5}, kServiceErrorBadArguments},
+        {"setConfiguration:forReporterID:reply:", Array{Array{}, 1}, kServiceErrorBadArguments},
     };
     for (const auto& request : cases) {
         auto responder = dispatch(request.method, request.params);

@@ -1,4 +1,4 @@
-#include "platform/linux/MsgpackValue.h"
+#include "wire/MsgpackValue.h"
 
 #include <cstring>
 
