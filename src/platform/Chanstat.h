@@ -2,6 +2,8 @@
 // Chanstat: the driver channel statistics library. Drivers publish integer counters
 // ("channels") in groups and subgroups; a subscription to a set of channels can be
 // sampled, and two samples give a delta (the growth between them).
+// Not built yet: no Linux implementation and no sampler use it, so the service root
+// takes empty driver snapshots and reports no driver statistics until they exist.
 
 #include <cstdint>
 #include <optional>

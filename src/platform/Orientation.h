@@ -1,6 +1,8 @@
 #pragma once
 // Orientation notifications of the audio toolbox: the device's physical orientation
 // and the user interface's, delivered to callbacks registered under an identifier.
+// Not built yet: no Linux implementation, and sessions do not track orientation
+// until there is one.
 
 #include <cstdint>
 #include <functional>

@@ -255,7 +255,7 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     for (int i = 0; i < 50; ++i)
         EXPECT_EQ(nlohmann::json::parse(messages[i][2])["seq"], i);
     EXPECT_EQ(messages[50][1], "65535") << "the summary event comes last";
-    auto summaries = daemon.path("private/var/mobile/Library/Logs/FaultDesk/DiagnosticLogs/Audio/Reporting");
+    auto summaries = daemon.path("var/log/harmonia/reporting");
     ASSERT_TRUE(std::filesystem::is_directory(summaries));
     auto summary = std::filesystem::directory_iterator(summaries)->path().filename().string();
     EXPECT_THAT(summary, ::testing::EndsWith("-harmonia-ExampleHost-longformaudio.json"));
@@ -338,7 +338,7 @@ TEST_F(DaemonWithoutBackendTest, SessionGivesUpOnTheBackendAfterNineSecondsAndKe
     EXPECT_TRUE(daemon.waitForLog("No valid UplinkSession")) << "the delivery queued behind the wait finds no backend";
 
     ASSERT_TRUE(*client->stopReportingSessionForID(8).value);
-    auto summaries = daemon.path("private/var/mobile/Library/Logs/FaultDesk/DiagnosticLogs/Audio/Reporting");
+    auto summaries = daemon.path("var/log/harmonia/reporting");
     ASSERT_TRUE(waitUntil([&] { return std::filesystem::exists(summaries) && !std::filesystem::is_empty(summaries); }));
     EXPECT_THAT(std::filesystem::directory_iterator(summaries)->path().filename().string(),
                 ::testing::EndsWith("-harmonia-Lonely-unknown.json"));

@@ -102,6 +102,8 @@ void MxReportingServerInstance::setServiceType(ServiceType serviceType, Reporter
 
 void MxReportingServerInstance::getServiceNameForReporterID(ReporterID reporterID, MxServiceTypeReply reply)
 {
+    // Intended: the log texts of this endpoint keep their spelling ("seviceType",
+    // "returnning", the doubled space), which log searches rely on.
     MXLOG_VERBOSE(logScope(), "fetching seviceType");
     enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleGetServiceName(reporterID, reply);
@@ -234,12 +236,7 @@ void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxBoolR
     session->start();
     if (auto root = delegate_.lock())
         session->setDriverSnapShot(root->getSnapShot());
-    // A reply still parked from an earlier start is answered before this one is parked.
-    if (auto pending = session->transactionCompleteBlock()) {
-        pending(true);
-        session->setTransactionCompleteBlock(nullptr);
-    }
-    session->setTransactionCompleteBlock(reply);
+    session->parkTransactionCompleteBlock(reply);
 }
 
 void MxReportingServerInstance::handleSendMessage(const Dictionary& payload, MessageCategory category,
@@ -314,10 +311,7 @@ void MxReportingServerInstance::handleStop(ReporterID reporterID, const MxBoolRe
         sendDriverStatistics(*session);
         session->setDriverSnapShot(nullptr);
         session->stop();
-        if (auto pending = session->transactionCompleteBlock()) {
-            pending(true);
-            session->setTransactionCompleteBlock(nullptr);
-        }
+        session->completeTransaction();
     }
     MXLOG(logScope(), Default, "stopping {}", reporterID);
     reply(true);

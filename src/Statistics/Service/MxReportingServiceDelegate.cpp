@@ -140,6 +140,8 @@ std::shared_ptr<MxReportingSession> MxReportingServiceDelegate::findReportingSes
     return nullptr;
 }
 
+// Until the driver statistics sampler exists: an empty snapshot, and no statistics,
+// so every stop logs "nothing interesting to fetch from the drivers".
 std::shared_ptr<MxReportingDriverSnapShot> MxReportingServiceDelegate::getSnapShot()
 {
     return std::make_shared<MxReportingDriverSnapShot>();

@@ -1,10 +1,10 @@
 #pragma once
 // One reporter's session: its configuration, its aggregation of the messages it is
-// sent, and its backend session. Shared: the owning endpoint's session map holds it,
-// and so does every job it queues until the job has run.
-// Configuration, start, stop and message aggregation run on the server queue;
-// backend configuration, deliveries and flush run, in that order, on the session's
-// own serial `uplinkQueue`.
+// sent, and its reporting periods from start to stop. Shared: the owning endpoint's
+// session map holds it, and so does every job it queues until the job has run.
+// Configuration, start, stop and message aggregation run on the server queue; the
+// backend work runs on the session's own serial uplink queue (MxReportingSessionUplink)
+// and the summary is written by MxReportingSessionSummary.
 
 #include <atomic>
 #include <cstdint>
@@ -21,6 +21,7 @@
 #include "Statistics/MxReportingAggregationArray.h"
 #include "Statistics/MxReportingVocabulary.h"
 #include "Statistics/Service/MxReportingServiceDelegateProtocol.h"
+#include "Statistics/Service/MxReportingSessionUplink.h"
 #include "platform/MxLog.h"
 #include "platform/UniqueFunction.h"
 #include "platform/Uplink.h"
@@ -29,8 +30,6 @@
 
 namespace mx {
 
-struct MxReportingDiscovery;
-
 // Spaces in top-level string keys become "_"; values are kept as they are. Of two
 // keys that clean to the same text, the later one's value wins.
 Dictionary MxReportingCleanKeys(const Dictionary& message);
@@ -38,7 +37,7 @@ Dictionary MxReportingCleanKeys(const Dictionary& message);
 class MxReportingSession : public std::enable_shared_from_this<MxReportingSession> {
 public:
     using TransactionCompleteBlock = std::function<void(bool)>;
-    using SendReply = UniqueFunction<void(std::optional<UplinkError>)>;
+    using SendReply = MxReportingSessionUplink::SendReply;
     using AggregationArray = std::shared_ptr<MxReportingAggregationArray>;
 
     // initWithID:processIdentifiers:
@@ -51,15 +50,13 @@ public:
     static const MxLogScope* logScope();
 
     bool started() const { return started_.load(); }
-    void setStarted(bool started) { started_.store(started); }
-    bool uplinkSessionStarted() const { return uplinkSessionStarted_.load(); }
-    void setUplinkSessionStarted(bool started) { uplinkSessionStarted_.store(started); }
+    bool uplinkSessionStarted() const { return uplink_.uplinkSessionStarted(); }
     ServiceType serviceType() const { return serviceType_.load(std::memory_order_relaxed); }
     const std::shared_ptr<MxLockedDictionary>& userInfo() const { return userInfo_; }
+    // The drivers' snapshot of the current period, kept here for the endpoint that
+    // took it; the session itself never reads it.
     std::shared_ptr<MxReportingDriverSnapShot> driverSnapShot() const { return driverSnapShot_.get(); }
     void setDriverSnapShot(std::shared_ptr<MxReportingDriverSnapShot> snapShot) { driverSnapShot_.set(std::move(snapShot)); }
-    TransactionCompleteBlock transactionCompleteBlock() const { return transactionCompleteBlock_.get(); }
-    void setTransactionCompleteBlock(TransactionCompleteBlock block) { transactionCompleteBlock_.set(std::move(block)); }
     ReporterID reporterID() const { return reporterID_; }
     const std::vector<std::int32_t>& processIdentifiers() const { return processIdentifiers_; }
     AggregationArray aggregatedPayloadData() const { return aggregatedPayloadData_.get(); }
@@ -67,12 +64,16 @@ public:
     // Server queue only.
     const std::map<std::string, std::int64_t>& messageTypeCounts() const { return messageTypeCounts_; }
     std::string serviceName() const { return serviceName_.get(); }
-    std::optional<std::string> orientationCallbackID() const { return orientationCallbackID_.get(); }
-    std::optional<Date> startDate() const { return startDate_.get(); }
-    std::shared_ptr<UplinkSession> uplinkSession() const { return uplinkSession_.get(); }
-    void setUplinkSession(std::shared_ptr<UplinkSession> session) { uplinkSession_.set(std::move(session)); }
-    std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplinkAgentToken_.get(); }
-    const std::shared_ptr<WorkQueue>& uplinkQueue() const { return uplinkQueue_; }
+    std::shared_ptr<UplinkSession> uplinkSession() const { return uplink_.uplinkSession(); }
+    std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplink_.uplinkAgentToken(); }
+    const std::shared_ptr<WorkQueue>& uplinkQueue() const { return uplink_.queue(); }
+
+    // The start request's reply waits here until the period ends. Parking a reply
+    // answers one still parked from an earlier start first (true); completing answers
+    // the parked one (true) and forgets it. Server queue only.
+    bool hasTransactionCompleteBlock() const { return static_cast<bool>(transactionCompleteBlock_.get()); }
+    void parkTransactionCompleteBlock(TransactionCompleteBlock block);
+    void completeTransaction();
 
     void setServiceType(ServiceType serviceType);
     void setConfiguration(const std::optional<Dictionary>& configuration);
@@ -90,36 +91,23 @@ public:
                      SendReply reply);
     void sendMessage(const Dictionary& message, MessageCategory category, MessageType type, SendReply reply);
 
-    // One message with a throw-away backend session of its own, sent from the global
-    // utility queue ("alarms" after a random delay of up to 59 seconds). `userInfo`
-    // is accepted and ignored. `reply`, when given, gets the backend's error or nothing.
     static void sendSingleMessage(const Dictionary& message, MessageCategory category, MessageType type,
-                                  ServiceType serviceType, const Dictionary* userInfo, SendReply reply);
+                                  ServiceType serviceType, const Dictionary* userInfo, SendReply reply)
+    {
+        MxReportingSessionUplink::sendSingleMessage(message, category, type, serviceType, userInfo, std::move(reply));
+    }
 
-    // Every key that occurred in this period's payloads, with all of its values in
-    // text form joined by ","; nothing when nothing was aggregated.
     std::optional<Dictionary> createSummaryEventForSession();
-    // On internal builds: the user information and every message of this period, as
-    // pretty-printed JSON in the summary directory. Nothing when nothing was sent.
     void writeSummaryJson();
-    // "<local time>-harmonia-<host>-<service type name>.json", the host made safe to
-    // stand in one file name.
     std::string summaryFileName(std::time_t now) const;
 
     std::string description() const;
 
 private:
-    void configureUplink(const std::shared_ptr<MxLockedDictionary>& userInfo, const std::string& serviceName,
-                         ServiceType serviceType, const std::shared_ptr<MxReportingDiscovery>& discovery);
-    void flushUplink();
-    void deliver(const Dictionary& cleaned, const Dictionary& message, bool wasStarted, MessageCategory category,
-                 MessageType type);
-
     static void appendAggregated(const MxAtomicProperty<AggregationArray>& field, Value value);
     static void dropAggregated(MxAtomicProperty<AggregationArray>& field);
 
     std::atomic<bool> started_{false};
-    std::atomic<bool> uplinkSessionStarted_{false};
     std::atomic<ServiceType> serviceType_{service_type::kUnknown};
     std::shared_ptr<MxLockedDictionary> userInfo_ = std::make_shared<MxLockedDictionary>();
     MxAtomicProperty<std::shared_ptr<MxReportingDriverSnapShot>> driverSnapShot_;
@@ -130,11 +118,7 @@ private:
     MxAtomicProperty<AggregationArray> nestedAggregatedPayloadData_;
     std::map<std::string, std::int64_t> messageTypeCounts_;
     MxAtomicProperty<std::string> serviceName_{std::string("unknown")};
-    MxAtomicProperty<std::optional<std::string>> orientationCallbackID_;
-    MxAtomicProperty<std::optional<Date>> startDate_;
-    MxAtomicProperty<std::shared_ptr<UplinkSession>> uplinkSession_;
-    MxAtomicProperty<std::optional<UplinkSecureHierarchyToken>> uplinkAgentToken_;
-    const std::shared_ptr<WorkQueue> uplinkQueue_;
+    MxReportingSessionUplink uplink_;
 };
 
 } // namespace mx

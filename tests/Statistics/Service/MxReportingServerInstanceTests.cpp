@@ -212,7 +212,7 @@ TEST_F(MxReportingServerInstanceTest, RestartAfterAStopByDestructionAnswersTheSt
     run();
     EXPECT_THAT(stale.values, ElementsAre(true));
     EXPECT_THAT(fresh.values, IsEmpty());
-    ASSERT_TRUE(reporting->transactionCompleteBlock());
+    ASSERT_TRUE(reporting->hasTransactionCompleteBlock());
 }
 
 TEST_F(MxReportingServerInstanceTest, ReporterZeroIsCreatedButNeverStartedFoundOrStopped)

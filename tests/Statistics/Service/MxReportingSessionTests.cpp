@@ -307,7 +307,7 @@ protected:
     }
 
     static constexpr const char* kDirectory =
-        "/root/private/var/mobile/Library/Logs/FaultDesk/DiagnosticLogs/Audio/Reporting";
+        "/root/var/log/harmonia/reporting";
 };
 
 TEST_F(MxReportingSummaryFileTest, FileHoldsUserInfoThenEveryMessageThenTheSummary)

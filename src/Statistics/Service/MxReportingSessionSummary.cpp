@@ -1,0 +1,112 @@
+#include "Statistics/Service/MxReportingSessionSummary.h"
+
+#include <map>
+#include <vector>
+
+#include <fmt/format.h>
+
+#include "Statistics/Service/MxReportingSession.h"
+#include "platform/FileSystem.h"
+#include "platform/JsonValue.h"
+#include "platform/MxLog.h"
+
+namespace mx {
+
+namespace {
+
+constexpr const char* kSummaryDirectory = "/var/log/harmonia/reporting";
+constexpr std::size_t kMaximumHostBytes = 128;
+
+const MxLogScope* logScope() { return MxReportingSession::logScope(); }
+
+} // namespace
+
+std::optional<Dictionary> MxReportingSessionSummary::createSummaryEvent(const MxReportingAggregationArray* aggregated,
+                                                                        ServiceType serviceType)
+{
+    if (!aggregated)
+        return std::nullopt;
+    std::lock_guard lock(aggregated->monitor());
+    if (aggregated->items().empty())
+        return std::nullopt;
+
+    // Keys keep the order of their first appearance; values keep message order.
+    std::vector<std::pair<std::string, std::string>> collected;
+    std::map<std::string, std::size_t, std::less<>> position;
+    auto collect = [&](const std::string& key, const std::string& text) {
+        auto [found, inserted] = position.try_emplace(key, collected.size());
+        if (inserted) {
+            collected.emplace_back(key, text);
+            return;
+        }
+        auto& joined = collected[found->second].second;
+        joined += ',';
+        joined += text;
+    };
+    collect("Mx_Session_Summary_Event", std::to_string(serviceType));
+    for (const auto& payload : aggregated->items())
+        if (const Dictionary* entries = payload.asDictionary())
+            for (const auto& [key, value] : *entries)
+                collect(key, value.description());
+
+    Dictionary summary;
+    for (auto& [key, joined] : collected)
+        summary.set(key, std::move(joined));
+    return summary;
+}
+
+std::string MxReportingSessionSummary::summaryFileName(std::time_t now, const Dictionary& userInfo,
+                                                       ServiceType serviceType)
+{
+    std::tm local{};
+    localtime_r(&now, &local);
+    char date[32];
+    std::strftime(date, sizeof(date), "%Y%m%d-%H%M%S%z", &local);
+
+    // Lower case on purpose, unlike the "Unknown" host of the analytics events.
+    std::string host = "unknown";
+    if (const Value* stored = userInfo.find("HostApplicationDisplayID"))
+        host = stored->description();
+    // The host is the client's text: it must not name another directory, nor make the
+    // name longer than a file name may be.
+    for (char& c : host)
+        if (c == '/' || c == '\0')
+            c = '_';
+    if (host.size() > kMaximumHostBytes)
+        host.resize(kMaximumHostBytes);
+    return fmt::format("{}-{}-{}-{}.json", date, "harmonia", host, MxReportingServiceTypeName(serviceType));
+}
+
+void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* nested, const Dictionary& userInfo,
+                                                 ServiceType serviceType)
+{
+    if (!MxReportingInternalBuild() || !nested)
+        return;
+    std::string text;
+    {
+        std::lock_guard lock(nested->monitor());
+        if (nested->items().empty())
+            return;
+        nested->insert(0, userInfo);
+        try {
+            nlohmann::ordered_json document = nlohmann::ordered_json::array();
+            for (const auto& item : nested->items())
+                document.push_back(toJson(item));
+            text = document.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+        } catch (const std::exception& error) {
+            MXLOG(logScope(), Error, "dataWithJSONObject: {}", error.what());
+        }
+    }
+
+    auto& fileSystem = ProcessWide<FileSystem>::get();
+    auto directory = fileSystem.resolve(kSummaryDirectory);
+    if (auto failure = fileSystem.createDirectories(directory, 0777))
+        MXLOG(logScope(), Error, "can't create logging directory at {}: {}", directory.string(), *failure);
+    if (text.empty())
+        return;
+    if (auto failure = fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType),
+                                                  text))
+        MXLOG(logScope(), Error, "jsonOutput writeToURL: {}", *failure);
+}
+
+} // namespace mx

@@ -1,0 +1,71 @@
+#pragma once
+// A session's side of the reporting backend: its backend session and token, and the
+// work that runs on the session's own serial uplink queue, in submission order:
+// backend configuration with the discovery wait, in-session deliveries, the flush.
+// Owned by its MxReportingSession, which queues that work holding itself, so the
+// session (and this object) outlives every queued job. Also sends single messages,
+// which go alone from the global utility queue.
+
+#include <atomic>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Statistics/MxAtomicProperty.h"
+#include "Statistics/MxLockedDictionary.h"
+#include "Statistics/MxReportingVocabulary.h"
+#include "platform/UniqueFunction.h"
+#include "platform/Uplink.h"
+#include "platform/Value.h"
+#include "platform/WorkQueue.h"
+
+namespace mx {
+
+class MxReportingSessionUplink {
+public:
+    using SendReply = UniqueFunction<void(std::optional<UplinkError>)>;
+
+    // What a start hands to its configuration job, taken when the session starts.
+    struct Configuration {
+        // The session's live user information, not a copy: configuration merged in
+        // before the job runs still reaches the backend session.
+        std::shared_ptr<MxLockedDictionary> userInfo;
+        std::string serviceName;
+        ServiceType serviceType = service_type::kUnknown;
+        // Seed of the discovery flag that the job shares with the backend's callback.
+        bool discovered = false;
+    };
+
+    explicit MxReportingSessionUplink(ReporterID reporterID);
+    MxReportingSessionUplink(const MxReportingSessionUplink&) = delete;
+    MxReportingSessionUplink& operator=(const MxReportingSessionUplink&) = delete;
+
+    const std::shared_ptr<WorkQueue>& queue() const { return queue_; }
+
+    // Any thread.
+    bool uplinkSessionStarted() const { return uplinkSessionStarted_.load(); }
+    std::shared_ptr<UplinkSession> uplinkSession() const { return uplinkSession_.get(); }
+    std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplinkAgentToken_.get(); }
+
+    // Uplink queue only. `currentType` is the session's service type as the job runs.
+    void configure(ServiceType currentType, const Configuration& configuration);
+    void deliver(ServiceType currentType, const Dictionary& cleaned, const Dictionary& message, bool wasStarted,
+                 MessageCategory category, MessageType type, const MxLockedDictionary& userInfo);
+    void flush(ServiceType currentType);
+
+    // One message with a throw-away backend session of its own, sent from the global
+    // utility queue ("alarms" after a random delay of up to 59 seconds). `userInfo`
+    // is accepted and ignored. `reply`, when given, gets the backend's error or nothing.
+    static void sendSingleMessage(const Dictionary& message, MessageCategory category, MessageType type,
+                                  ServiceType serviceType, const Dictionary* userInfo, SendReply reply);
+
+private:
+    const ReporterID reporterID_;
+    const std::shared_ptr<WorkQueue> queue_;
+    // Written on the uplink queue only; read from anywhere.
+    std::atomic<bool> uplinkSessionStarted_{false};
+    MxAtomicProperty<std::shared_ptr<UplinkSession>> uplinkSession_;
+    MxAtomicProperty<std::optional<UplinkSecureHierarchyToken>> uplinkAgentToken_;
+};
+
+} // namespace mx
