@@ -118,7 +118,8 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
         auto sent = Clock::now();
         lane.client->sendMessage(payload, 0x08000003, 1, std::vector<ReporterID>{lane.id},
                                  [&, sent, lanePointer = &lane](MxClientResult<MxSendOutcome> result) {
-                                     double micros = std::chrono::duration<double, std::micro>(Clock::now() - sent).count();
+                                     double micros =
+                                         std::chrono::duration<double, std::micro>(Clock::now() - sent).count();
                                      if (!result || *result.value)
                                          ++errors;
                                      ++completed;

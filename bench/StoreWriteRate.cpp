@@ -22,8 +22,13 @@ namespace {
 
 Dictionary payload(int i)
 {
-    return Dictionary{{"sample_rate", 48000}, {"route", "Speaker"}, {"buffer_frames", 512}, {"underruns", i % 3},
-                      {"peak_level", -12.5}, {"codec", "aac"}, {"seq", i},
+    return Dictionary{{"sample_rate", 48000},
+                      {"route", "Speaker"},
+                      {"buffer_frames", 512},
+                      {"underruns", i % 3},
+                      {"peak_level", -12.5},
+                      {"codec", "aac"},
+                      {"seq", i},
                       {"HostApplicationDisplayID", "com.example.player"}};
 }
 
@@ -31,8 +36,9 @@ double bareInsert(const std::filesystem::path& file, int events)
 {
     sqlite3* database = nullptr;
     sqlite3_open(file.c_str(), &database);
-    sqlite3_exec(database, "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; "
-                           "CREATE TABLE events(id INTEGER PRIMARY KEY, time REAL, name TEXT, payload TEXT)",
+    sqlite3_exec(database,
+                 "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; "
+                 "CREATE TABLE events(id INTEGER PRIMARY KEY, time REAL, name TEXT, payload TEXT)",
                  nullptr, nullptr, nullptr);
     sqlite3_stmt* insert = nullptr;
     sqlite3_prepare_v2(database, "INSERT INTO events(time, name, payload) VALUES(?, ?, ?)", -1, &insert, nullptr);

@@ -22,7 +22,8 @@ struct View {
 
 const View* viewFor(const std::string& store)
 {
-    static const View events{"tally.db", "SELECT id, time, name, payload FROM events ORDER BY id DESC LIMIT ?1",
+    static const View events{"tally.db",
+                             "SELECT id, time, name, payload FROM events ORDER BY id DESC LIMIT ?1",
                              {"id", "time", "name", "payload"}};
     static const View power{"joule.db",
                             "SELECT id, time, agent, name, payload FROM events ORDER BY id DESC LIMIT ?1",
@@ -49,19 +50,21 @@ const View* viewFor(const std::string& store)
 bool isTimeColumn(const char* column)
 {
     return std::string_view(column) == "time" || std::string_view(column) == "opened" ||
-           std::string_view(column) == "flushed";
+        std::string_view(column) == "flushed";
 }
 
 nlohmann::ordered_json cell(sqlite3_stmt* statement, int column, const char* name)
 {
     switch (sqlite3_column_type(statement, column)) {
-    case SQLITE_NULL: return nullptr;
-    case SQLITE_INTEGER: return sqlite3_column_int64(statement, column);
+    case SQLITE_NULL:
+        return nullptr;
+    case SQLITE_INTEGER:
+        return sqlite3_column_int64(statement, column);
     case SQLITE_FLOAT: {
         double value = sqlite3_column_double(statement, column);
         if (isTimeColumn(name))
-            return formatDate(Date(std::chrono::round<std::chrono::microseconds>(
-                std::chrono::duration<double>(value))));
+            return formatDate(
+                Date(std::chrono::round<std::chrono::microseconds>(std::chrono::duration<double>(value))));
         return value;
     }
     default: {

@@ -10,7 +10,7 @@
 namespace mx {
 
 struct MxReportStoreQuery {
-    std::string store;   // "events", "power", "sessions", "messages"
+    std::string store; // "events", "power", "sessions", "messages"
     std::size_t limit = 20;
     bool json = false;
 };

@@ -15,16 +15,16 @@
 #include <random>
 #include <sstream>
 #include <string>
-#include <vector>
 #include <unistd.h>
+#include <vector>
 
 #include <fmt/format.h>
 
 #include "Statistics/MxReportingVocabulary.h"
 #include "client/MxReportingClient.h"
+#include "platform/JsonValue.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/JsonPreferences.h"
-#include "platform/JsonValue.h"
 #include "wire/RootPath.h"
 
 using namespace mx;
@@ -35,7 +35,8 @@ constexpr int kExitRefused = 1;
 constexpr int kExitUnreachable = 2;
 constexpr int kExitUsage = 64;
 
-constexpr const char* kUsage = R"(usage: mxreport [--socket PATH] [--timeout SECONDS] COMMAND [ARGS] [-- COMMAND [ARGS]]...
+constexpr const char* kUsage =
+    R"(usage: mxreport [--socket PATH] [--timeout SECONDS] COMMAND [ARGS] [-- COMMAND [ARGS]]...
 
 Talks to mxreportingd on $MXREPORTING_ROOT/run/harmonia/reporting.sock. Commands joined
 by "--" run in order on one connection (a session lives as long as its connection).
@@ -122,8 +123,8 @@ MessageCategory parseCategory(const std::string& text)
         for (std::int64_t low = 0; low <= 11; ++low)
             codes.push_back(subsystem | low);
     return static_cast<MessageCategory>(parseNamed(
-        text, "category", 0xFFFFFFFF,
-        [](std::int64_t code) { return MxReportingCategoryName(MessageCategory(code)); }, codes));
+        text, "category", 0xFFFFFFFF, [](std::int64_t code) { return MxReportingCategoryName(MessageCategory(code)); },
+        codes));
 }
 
 MessageType parseMessageType(const std::string& text)
@@ -145,7 +146,7 @@ std::string show(const Value& value) { return toJson(value).dump(); }
 
 class Session {
 public:
-    Session(MxReportingClient& client) : client_(client) {}
+    Session(MxReportingClient& client) : client_(client) { }
 
     // Runs one command; returns false when the daemon refused or failed it.
     bool run(const std::vector<std::string>& words)
@@ -156,7 +157,9 @@ public:
                 throw UsageError{fmt::format("{} needs more arguments (see mxreport help)", command)};
             return words[index];
         };
-        auto id = [&](std::size_t index) { return parseInteger(argument(index), "reporter ID"); };
+        auto id = [&](std::size_t index) {
+            return parseInteger(argument(index), "reporter ID");
+        };
 
         if (command == "create")
             return report(command, client_.createReportingSession(id(1)));
@@ -199,7 +202,8 @@ private:
                             *result.value ? "true" : "false");
             std::fflush(stdout);
         });
-        std::printf("start %lld: sent, its reply is held until the session stops\n", static_cast<long long>(reporterID));
+        std::printf("start %lld: sent, its reply is held until the session stops\n",
+                    static_cast<long long>(reporterID));
         return true;
     }
 
@@ -323,7 +327,8 @@ int demo(MxReportingClient& client)
         {"start", reporter},
         {"send", R"({"sample rate": 48000, "codec": "aac"})", "Session_Playback", "Start", reporter},
         {"send", R"({"route": "Headphones", "reason": "new device"})", "Routing_RouteChange", "Generic", reporter},
-        {"send", R"({"EngineOnTime": 12.5, "mxreporting_timestamp": )" + timestamp + "}", "Volume", "Generic", reporter},
+        {"send", R"({"EngineOnTime": 12.5, "mxreporting_timestamp": )" + timestamp + "}", "Volume", "Generic",
+         reporter},
         {"send", R"({"sample rate": 44100, "underruns": 0})", "Session_Playback", "Stop", reporter},
         {"reporters"},
         {"valid", reporter},
@@ -402,7 +407,8 @@ int main(int argc, char** argv)
                 throw UsageError{"unknown option " + option};
         }
         auto commands = splitCommands(words);
-        bool help = std::any_of(words.begin(), words.end(), [](const auto& word) { return word == "--help" || word == "-h"; });
+        bool help =
+            std::any_of(words.begin(), words.end(), [](const auto& word) { return word == "--help" || word == "-h"; });
         if (commands.empty() || help || commands[0][0] == "help") {
             std::fputs(kUsage, commands.empty() ? stderr : stdout);
             return commands.empty() ? kExitUsage : 0;

@@ -17,7 +17,10 @@ public:
 
     // Callers hold monitor().
     void append(Value value) { items_.push_back(std::move(value)); }
-    void insert(std::size_t index, Value value) { items_.insert(items_.begin() + std::ptrdiff_t(index), std::move(value)); }
+    void insert(std::size_t index, Value value)
+    {
+        items_.insert(items_.begin() + std::ptrdiff_t(index), std::move(value));
+    }
     const std::vector<Value>& items() const { return items_; }
 
     // A copy taken under the monitor.

@@ -9,8 +9,8 @@ namespace mx {
 void MxReportingTallyBridge::handleEvent(const Dictionary& message, MessageCategory category, MessageType type,
                                          const Dictionary& userInfo)
 {
-    std::string name = fmt::format("com.kestrel.harmonia.{}.{}", MxReportingCategoryName(category),
-                                   MxReportingMessageTypeName(type));
+    std::string name =
+        fmt::format("com.kestrel.harmonia.{}.{}", MxReportingCategoryName(category), MxReportingMessageTypeName(type));
     // The payload is the message as the client sent it (spaces in keys and all) with
     // the host set last. It is made when the analytics service asks for it, which may
     // be on its own thread or never; the message is shared, not copied, until then.

@@ -13,8 +13,8 @@ bool MxReportingUtilityWait(MxReportingCondition& condition, const bool* flag, c
     if (*flag)
         return true;
     ScopedBlockingCall blocking;
-    auto timeout = std::chrono::duration_cast<std::chrono::steady_clock::duration>(
-        std::chrono::duration<double>(timeoutSeconds));
+    auto timeout =
+        std::chrono::duration_cast<std::chrono::steady_clock::duration>(std::chrono::duration<double>(timeoutSeconds));
     for (;;) {
         MXLOG(scope, Default, "{}", message);
         if (condition.condition.wait_until(lock, std::chrono::steady_clock::now() + timeout) ==

@@ -10,7 +10,7 @@ namespace mx {
 std::string MxReportingServiceTypeName(ServiceType serviceType)
 {
     static constexpr std::array<const char*, 13> kNames = {
-        "generic",  "assistant",        "telephony",         "haptics", "alarms", "standalone", "soundautoconfig",
+        "generic",       "assistant",        "telephony",        "haptics", "alarms", "standalone", "soundautoconfig",
         "longformaudio", "nonlongformaudio", "audiodeviceusage", "alerts",  "test",   "apiusage"};
     // Unlisted codes fold into "telephony" on purpose; only the all-ones code is "unknown".
     std::uint32_t code = serviceType;
@@ -24,18 +24,29 @@ std::string MxReportingServiceTypeName(ServiceType serviceType)
 std::string MxReportingCategoryName(MessageCategory category)
 {
     static constexpr std::array<const char*, 12> kCategories = {
-        "Undefined", "Generic", "Record", "Playback", "PlaybackAndRecord", "Setup",
-        "ClientRequest", "RouteChange", "Error", "DriverStats", "Performance", "Volume"};
+        "Undefined",     "Generic",     "Record", "Playback",    "PlaybackAndRecord", "Setup",
+        "ClientRequest", "RouteChange", "Error",  "DriverStats", "Performance",       "Volume"};
     std::string name;
     // The all-ones code is deliberately read as having no subsystem half.
     if (category >= 0x10000 && category != 0xFFFFFFFF) {
         switch (category & 0xFFFF0000) {
-        case 0x80000000: name = "Toolbox"; break;
-        case 0x08000000: name = "Session"; break;
-        case 0x10000000: name = "DSP"; break;
-        case 0x20000000: name = "HAL"; break;
-        case 0x40000000: name = "Routing"; break;
-        default: break;
+        case 0x80000000:
+            name = "Toolbox";
+            break;
+        case 0x08000000:
+            name = "Session";
+            break;
+        case 0x10000000:
+            name = "DSP";
+            break;
+        case 0x20000000:
+            name = "HAL";
+            break;
+        case 0x40000000:
+            name = "Routing";
+            break;
+        default:
+            break;
         }
         name += "_";
     }
@@ -46,7 +57,8 @@ std::string MxReportingCategoryName(MessageCategory category)
 
 std::string MxReportingMessageTypeName(MessageType type)
 {
-    static constexpr std::array<const char*, 6> kTypes = {"Generic", "Start", "Stop", "Setup", "Error", "IssueDetector"};
+    static constexpr std::array<const char*, 6> kTypes = {"Generic", "Start", "Stop",
+                                                          "Setup",   "Error", "IssueDetector"};
     if (type == 65535)
         return "Unknown";
     return type < kTypes.size() ? kTypes[type] : "Undefined";

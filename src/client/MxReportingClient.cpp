@@ -21,7 +21,7 @@ namespace mx {
 // The socket and everything in flight on it, owned by the client's I/O thread.
 class MxReportingClient::Connection : public std::enable_shared_from_this<Connection> {
 public:
-    Connection() : keepRunning_(io_.get_executor()), socket_(io_) {}
+    Connection() : keepRunning_(io_.get_executor()), socket_(io_) { }
 
     ~Connection()
     {
@@ -178,8 +178,8 @@ MxReportingClient::Callback<Value> adapt(MxReportingClient::Callback<T> done, Co
         }
         auto converted = convert(*result.value);
         if (!converted) {
-            done({std::nullopt, MxClientError{MxClientError::Kind::Protocol, 0,
-                                              "unexpected reply " + result.value->description()}});
+            done({std::nullopt,
+                  MxClientError{MxClientError::Kind::Protocol, 0, "unexpected reply " + result.value->description()}});
             return;
         }
         done({std::move(converted), std::nullopt});
@@ -223,8 +223,8 @@ std::optional<MxSendOutcome> toSendOutcome(const Value& value)
         return std::nullopt;
     const Value* domain = refusal->find("domain");
     const Value* code = refusal->find("code");
-    return MxSendOutcome{MxSendRefusal{domain && domain->asString() ? *domain->asString() : "",
-                                       code ? code->int64Value() : 0}};
+    return MxSendOutcome{
+        MxSendRefusal{domain && domain->asString() ? *domain->asString() : "", code ? code->int64Value() : 0}};
 }
 
 Value reporterIDs(const std::optional<std::vector<ReporterID>>& ids)
@@ -251,7 +251,7 @@ std::unique_ptr<MxReportingClient> MxReportingClient::connect(const std::filesys
     return std::unique_ptr<MxReportingClient>(new MxReportingClient(std::move(connection)));
 }
 
-MxReportingClient::MxReportingClient(std::shared_ptr<Connection> connection) : connection_(std::move(connection)) {}
+MxReportingClient::MxReportingClient(std::shared_ptr<Connection> connection) : connection_(std::move(connection)) { }
 
 MxReportingClient::~MxReportingClient() = default;
 
@@ -291,8 +291,8 @@ void MxReportingClient::sendMessage(const Dictionary& payload, MessageCategory c
                                     const std::optional<std::vector<ReporterID>>& reportingIDs,
                                     Callback<MxSendOutcome> done)
 {
-    call(method::kSendMessage,
-         Array{payload, category, type, reporterIDs(reportingIDs)}, adapt<MxSendOutcome>(std::move(done), toSendOutcome));
+    call(method::kSendMessage, Array{payload, category, type, reporterIDs(reportingIDs)},
+         adapt<MxSendOutcome>(std::move(done), toSendOutcome));
 }
 
 void MxReportingClient::stopReportingSessionForID(ReporterID reporterID, Callback<bool> done)
@@ -345,7 +345,8 @@ MxClientResult<bool> MxReportingClient::setServiceType(ServiceType serviceType, 
 
 MxClientResult<ServiceType> MxReportingClient::getServiceNameForReporterID(ReporterID reporterID)
 {
-    return wait<ServiceType>([&](Callback<ServiceType> done) { getServiceNameForReporterID(reporterID, std::move(done)); });
+    return wait<ServiceType>(
+        [&](Callback<ServiceType> done) { getServiceNameForReporterID(reporterID, std::move(done)); });
 }
 
 MxClientResult<bool> MxReportingClient::setConfiguration(const std::optional<Dictionary>& configuration,
@@ -365,8 +366,8 @@ MxClientResult<bool> MxReportingClient::destroyReportingSession(ReporterID repor
 }
 
 MxClientResult<MxSendOutcome> MxReportingClient::sendMessage(const Dictionary& payload, MessageCategory category,
-                                                            MessageType type,
-                                                            const std::optional<std::vector<ReporterID>>& reportingIDs)
+                                                             MessageType type,
+                                                             const std::optional<std::vector<ReporterID>>& reportingIDs)
 {
     return wait<MxSendOutcome>(
         [&](Callback<MxSendOutcome> done) { sendMessage(payload, category, type, reportingIDs, std::move(done)); });

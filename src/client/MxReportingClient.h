@@ -87,7 +87,7 @@ public:
     MxClientResult<bool> stopReportingSessionForID(ReporterID reporterID);
     MxClientResult<bool> destroyReportingSession(ReporterID reporterID);
     MxClientResult<MxSendOutcome> sendMessage(const Dictionary& payload, MessageCategory category, MessageType type,
-                                             const std::optional<std::vector<ReporterID>>& reportingIDs);
+                                              const std::optional<std::vector<ReporterID>>& reportingIDs);
     MxClientResult<Dictionary> reporterID(ReporterID reporterID);
     MxClientResult<std::vector<ReporterID>> getAllReporters();
 

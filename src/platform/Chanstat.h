@@ -36,8 +36,8 @@ public:
     // The channels of a group and subgroup (an absent name matches every one).
     // Nothing, with `error` set, when the query itself fails.
     virtual std::optional<ChanstatChannels> copyChannelsInGroup(const std::optional<std::string>& group,
-                                                               const std::optional<std::string>& subgroup,
-                                                               std::optional<ChanstatError>& error) = 0;
+                                                                const std::optional<std::string>& subgroup,
+                                                                std::optional<ChanstatError>& error) = 0;
     virtual std::int32_t getChannelCount(const ChanstatChannels& channels) = 0;
     virtual ChanstatSubscription createSubscription(const ChanstatChannels& channels,
                                                     ChanstatChannels& subscribedChannels) = 0;

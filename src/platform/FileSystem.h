@@ -22,7 +22,8 @@ public:
     virtual std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode) = 0;
     // Replaces `file` with `contents` so that readers see the old file or the new one,
     // never a part. The reason on failure.
-    virtual std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents) = 0;
+    virtual std::optional<std::string> writeAtomically(const std::filesystem::path& file,
+                                                       std::string_view contents) = 0;
 };
 
 } // namespace mx

@@ -38,25 +38,33 @@ nlohmann::ordered_json toJson(const Dictionary& dictionary)
 nlohmann::ordered_json toJson(const Value& value)
 {
     switch (value.kind()) {
-    case Value::Kind::Nil: return nullptr;
-    case Value::Kind::Bool: return *value.asBool();
-    case Value::Kind::Int: return *value.asInt();
-    case Value::Kind::UInt: return *value.asUInt();
+    case Value::Kind::Nil:
+        return nullptr;
+    case Value::Kind::Bool:
+        return *value.asBool();
+    case Value::Kind::Int:
+        return *value.asInt();
+    case Value::Kind::UInt:
+        return *value.asUInt();
     case Value::Kind::Double: {
         double number = *value.asDouble();
         // JSON has no NaN or infinity; they are written as null rather than as invalid text.
         return std::isfinite(number) ? nlohmann::ordered_json(number) : nlohmann::ordered_json(nullptr);
     }
-    case Value::Kind::String: return *value.asString();
-    case Value::Kind::Date: return formatDate(*value.asDate());
-    case Value::Kind::Data: return base64Encode(*value.asData());
+    case Value::Kind::String:
+        return *value.asString();
+    case Value::Kind::Date:
+        return formatDate(*value.asDate());
+    case Value::Kind::Data:
+        return base64Encode(*value.asData());
     case Value::Kind::Array: {
         auto array = nlohmann::ordered_json::array();
         for (const auto& item : *value.asArray())
             array.push_back(toJson(item));
         return array;
     }
-    case Value::Kind::Dictionary: return toJson(*value.asDictionary());
+    case Value::Kind::Dictionary:
+        return toJson(*value.asDictionary());
     }
     return nullptr;
 }
@@ -66,10 +74,18 @@ namespace {
 void appendJsonScalar(std::string& out, const Value& value)
 {
     switch (value.kind()) {
-    case Value::Kind::Nil: out += "null"; break;
-    case Value::Kind::Bool: out += *value.asBool() ? "true" : "false"; break;
-    case Value::Kind::Int: fmt::format_to(std::back_inserter(out), "{}", *value.asInt()); break;
-    case Value::Kind::UInt: fmt::format_to(std::back_inserter(out), "{}", *value.asUInt()); break;
+    case Value::Kind::Nil:
+        out += "null";
+        break;
+    case Value::Kind::Bool:
+        out += *value.asBool() ? "true" : "false";
+        break;
+    case Value::Kind::Int:
+        fmt::format_to(std::back_inserter(out), "{}", *value.asInt());
+        break;
+    case Value::Kind::UInt:
+        fmt::format_to(std::back_inserter(out), "{}", *value.asUInt());
+        break;
     case Value::Kind::Double: {
         double number = *value.asDouble();
         if (!std::isfinite(number)) {
@@ -83,10 +99,17 @@ void appendJsonScalar(std::string& out, const Value& value)
             out += ".0";
         break;
     }
-    case Value::Kind::String: appendQuotedText(out, *value.asString()); break;
-    case Value::Kind::Date: appendQuotedText(out, formatDate(*value.asDate())); break;
-    case Value::Kind::Data: appendQuotedText(out, base64Encode(*value.asData())); break;
-    default: break; // containers are walked by appendNested
+    case Value::Kind::String:
+        appendQuotedText(out, *value.asString());
+        break;
+    case Value::Kind::Date:
+        appendQuotedText(out, formatDate(*value.asDate()));
+        break;
+    case Value::Kind::Data:
+        appendQuotedText(out, base64Encode(*value.asData()));
+        break;
+    default:
+        break; // containers are walked by appendNested
     }
 }
 
@@ -94,16 +117,21 @@ template <class Json>
 Value fromAnyJson(const Json& json)
 {
     switch (json.type()) {
-    case nlohmann::json::value_t::null: return Value();
-    case nlohmann::json::value_t::boolean: return json.template get<bool>();
-    case nlohmann::json::value_t::number_integer: return json.template get<std::int64_t>();
+    case nlohmann::json::value_t::null:
+        return Value();
+    case nlohmann::json::value_t::boolean:
+        return json.template get<bool>();
+    case nlohmann::json::value_t::number_integer:
+        return json.template get<std::int64_t>();
     case nlohmann::json::value_t::number_unsigned: {
         auto number = json.template get<std::uint64_t>();
         // Small unsigned numbers read as plain integers, as a client would mean them.
         return number <= std::uint64_t(INT64_MAX) ? Value(std::int64_t(number)) : Value(number);
     }
-    case nlohmann::json::value_t::number_float: return json.template get<double>();
-    case nlohmann::json::value_t::string: return json.template get<std::string>();
+    case nlohmann::json::value_t::number_float:
+        return json.template get<double>();
+    case nlohmann::json::value_t::string:
+        return json.template get<std::string>();
     case nlohmann::json::value_t::array: {
         Array array;
         for (const auto& item : json)
@@ -116,7 +144,8 @@ Value fromAnyJson(const Json& json)
             dictionary.set(key, fromAnyJson(item));
         return dictionary;
     }
-    default: return Value();
+    default:
+        return Value();
     }
 }
 

@@ -34,8 +34,7 @@ int verboseLevelFromEnvironment(const std::string& verboseSwitch)
 } // namespace
 
 const MxLogScope* MxLogRegisterScope(int /*kind*/, std::uint32_t /*fourCharCode*/, const std::string& code,
-                                     const std::string& subsystem, const std::string& verboseSwitch,
-                                     int /*settings*/)
+                                     const std::string& subsystem, const std::string& verboseSwitch, int /*settings*/)
 {
     auto& scopes = registry();
     std::lock_guard lock(scopes.mutex);
@@ -46,10 +45,7 @@ const MxLogScope* MxLogRegisterScope(int /*kind*/, std::uint32_t /*fourCharCode*
     return scope.get();
 }
 
-bool MxLogEnabled(const MxLogScope* scope, int verboseLevel)
-{
-    return scope && scope->verboseLevel >= verboseLevel;
-}
+bool MxLogEnabled(const MxLogScope* scope, int verboseLevel) { return scope && scope->verboseLevel >= verboseLevel; }
 
 void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, const char* function,
                 std::string_view text)

@@ -57,20 +57,20 @@ void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int
 constexpr std::uint32_t MxFourCharCode(const char (&code)[5])
 {
     return (std::uint32_t(std::uint8_t(code[0])) << 24) | (std::uint32_t(std::uint8_t(code[1])) << 16) |
-           (std::uint32_t(std::uint8_t(code[2])) << 8) | std::uint32_t(std::uint8_t(code[3]));
+        (std::uint32_t(std::uint8_t(code[2])) << 8) | std::uint32_t(std::uint8_t(code[3]));
 }
 
 constexpr int kMxLogVerboseLevel = 5;
 
 } // namespace mx
 
-#define MXLOG(scope, level, ...) \
+#define MXLOG(scope, level, ...)                                                                                       \
     ::mx::MxLogWrite((scope), ::mx::MxLogLevel::level, __FILE_NAME__, __LINE__, __func__, fmt::format(__VA_ARGS__))
 
 // A debug line written only while the scope's verbose switch is on; the arguments
 // are not even formatted otherwise.
-#define MXLOG_VERBOSE(scope, ...)                                     \
-    do {                                                              \
-        if (::mx::MxLogEnabled((scope), ::mx::kMxLogVerboseLevel))    \
-            MXLOG((scope), Debug, __VA_ARGS__);                       \
+#define MXLOG_VERBOSE(scope, ...)                                                                                      \
+    do {                                                                                                               \
+        if (::mx::MxLogEnabled((scope), ::mx::kMxLogVerboseLevel))                                                     \
+            MXLOG((scope), Debug, __VA_ARGS__);                                                                        \
     } while (false)

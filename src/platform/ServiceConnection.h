@@ -43,8 +43,7 @@ class ServiceExportedObject {
 public:
     virtual ~ServiceExportedObject() = default;
     // `params` is nothing when the request's parameters are not an array.
-    virtual void handleRequest(const std::string& method, const Array* params,
-                               std::shared_ptr<ServiceReply> reply) = 0;
+    virtual void handleRequest(const std::string& method, const Array* params, std::shared_ptr<ServiceReply> reply) = 0;
 };
 
 class ServiceConnection {
@@ -65,7 +64,8 @@ class ServiceListenerDelegate {
 public:
     virtual ~ServiceListenerDelegate() = default;
     // Sets the connection up and answers whether to keep it.
-    virtual bool shouldAcceptNewConnection(ServiceListener& listener, std::shared_ptr<ServiceConnection> connection) = 0;
+    virtual bool shouldAcceptNewConnection(ServiceListener& listener,
+                                           std::shared_ptr<ServiceConnection> connection) = 0;
 };
 
 class ServiceListener {

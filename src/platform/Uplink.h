@@ -60,8 +60,8 @@ public:
                                                        std::vector<std::string> frameworksToCheck) = 0;
     // A message with a throw-away session of its own; false (and `error` set when
     // known) if refused. Callable from any thread.
-    virtual bool sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std::uint16_t category,
-                                std::uint16_t type, Dictionary payload, std::optional<UplinkError>& error) = 0;
+    virtual bool sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std::uint16_t category, std::uint16_t type,
+                                Dictionary payload, std::optional<UplinkError>& error) = 0;
 };
 
 } // namespace mx

@@ -13,7 +13,7 @@ namespace mx {
 
 // ---- Array
 
-Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) {}
+Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) { }
 
 Array::Array(std::vector<Value> values)
 {
@@ -265,7 +265,11 @@ namespace {
 std::size_t utf8Sequence(const unsigned char* text, std::size_t left)
 {
     unsigned char lead = text[0];
-    std::size_t length = lead < 0x80 ? 1 : (lead >> 5) == 0x6 ? 2 : (lead >> 4) == 0xE ? 3 : (lead >> 3) == 0x1E ? 4 : 0;
+    std::size_t length = lead < 0x80 ? 1
+        : (lead >> 5) == 0x6         ? 2
+        : (lead >> 4) == 0xE         ? 3
+        : (lead >> 3) == 0x1E        ? 4
+                                     : 0;
     if (length == 0 || length > left)
         return 0;
     for (std::size_t i = 1; i < length; ++i)
@@ -310,14 +314,29 @@ void appendQuotedText(std::string& out, std::string_view text)
             continue;
         }
         switch (c) {
-        case '"': out += "\\\""; break;
-        case '\\': out += "\\\\"; break;
-        case '\b': out += "\\b"; break;
-        case '\f': out += "\\f"; break;
-        case '\n': out += "\\n"; break;
-        case '\r': out += "\\r"; break;
-        case '\t': out += "\\t"; break;
-        default: out += fmt::format("\\u{:04x}", c);
+        case '"':
+            out += "\\\"";
+            break;
+        case '\\':
+            out += "\\\\";
+            break;
+        case '\b':
+            out += "\\b";
+            break;
+        case '\f':
+            out += "\\f";
+            break;
+        case '\n':
+            out += "\\n";
+            break;
+        case '\r':
+            out += "\\r";
+            break;
+        case '\t':
+            out += "\\t";
+            break;
+        default:
+            out += fmt::format("\\u{:04x}", c);
         }
         ++i;
     }
@@ -330,20 +349,35 @@ namespace {
 void appendDescribedScalar(std::string& out, const Value& value)
 {
     switch (value.kind()) {
-    case Value::Kind::Nil: out += "null"; break;
-    case Value::Kind::Bool: out += *value.asBool() ? "true" : "false"; break;
-    case Value::Kind::Int: out += fmt::format("{}", *value.asInt()); break;
-    case Value::Kind::UInt: out += fmt::format("{}", *value.asUInt()); break;
-    case Value::Kind::Double: out += fmt::format("{}", *value.asDouble()); break;
-    case Value::Kind::String: appendQuotedText(out, *value.asString()); break;
-    case Value::Kind::Date: out += formatDate(*value.asDate()); break;
+    case Value::Kind::Nil:
+        out += "null";
+        break;
+    case Value::Kind::Bool:
+        out += *value.asBool() ? "true" : "false";
+        break;
+    case Value::Kind::Int:
+        out += fmt::format("{}", *value.asInt());
+        break;
+    case Value::Kind::UInt:
+        out += fmt::format("{}", *value.asUInt());
+        break;
+    case Value::Kind::Double:
+        out += fmt::format("{}", *value.asDouble());
+        break;
+    case Value::Kind::String:
+        appendQuotedText(out, *value.asString());
+        break;
+    case Value::Kind::Date:
+        out += formatDate(*value.asDate());
+        break;
     case Value::Kind::Data:
         out += '<';
         for (auto byte : *value.asData())
             out += fmt::format("{:02x}", byte);
         out += '>';
         break;
-    default: break; // containers are walked by appendNested
+    default:
+        break; // containers are walked by appendNested
     }
 }
 

@@ -12,8 +12,8 @@ namespace {
 // then cannot make the unpacker reserve more than that.
 msgpack::unpack_limit limitsFor(std::size_t maximumMessageBytes)
 {
-    return msgpack::unpack_limit(maximumMessageBytes, maximumMessageBytes / 2, maximumMessageBytes,
-                                 maximumMessageBytes, maximumMessageBytes, kMsgpackMaximumDepth);
+    return msgpack::unpack_limit(maximumMessageBytes, maximumMessageBytes / 2, maximumMessageBytes, maximumMessageBytes,
+                                 maximumMessageBytes, kMsgpackMaximumDepth);
 }
 
 // An idle connection costs this much; a busy one grows its buffer as it needs.

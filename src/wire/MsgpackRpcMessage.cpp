@@ -49,7 +49,6 @@ std::optional<RpcResponse> parseRpcResponse(const Value& message, std::string& r
     return RpcResponse{static_cast<std::uint32_t>(*(*array)[1].asInt()), (*array)[2], (*array)[3]};
 }
 
-
 void encodeRpcRequest(msgpack::sbuffer& bytes, std::uint32_t msgid, std::string_view method, const Array& params)
 {
     msgpack::packer<msgpack::sbuffer> packer(bytes);

@@ -21,7 +21,9 @@ std::optional<Date> decodeTimestamp(const msgpack::object_ext& ext)
     std::int64_t seconds = 0;
     std::uint32_t nanoseconds = 0;
     switch (ext.size) {
-    case 4: seconds = static_cast<std::int64_t>(readBigEndian(ext.data(), 4)); break;
+    case 4:
+        seconds = static_cast<std::int64_t>(readBigEndian(ext.data(), 4));
+        break;
     case 8: {
         std::uint64_t packed = readBigEndian(ext.data(), 8);
         nanoseconds = static_cast<std::uint32_t>(packed >> 34);
@@ -32,7 +34,8 @@ std::optional<Date> decodeTimestamp(const msgpack::object_ext& ext)
         nanoseconds = static_cast<std::uint32_t>(readBigEndian(ext.data(), 4));
         seconds = static_cast<std::int64_t>(readBigEndian(ext.data() + 4, 8));
         break;
-    default: return std::nullopt;
+    default:
+        return std::nullopt;
     }
     // Beyond a few hundred years either way the nanosecond clock overflows.
     constexpr std::int64_t kLimit = 9'000'000'000;
@@ -48,16 +51,21 @@ std::optional<Value> decode(const msgpack::object& object, std::size_t depth, st
         return std::nullopt;
     }
     switch (object.type) {
-    case msgpack::type::NIL: return Value();
-    case msgpack::type::BOOLEAN: return Value(object.via.boolean);
+    case msgpack::type::NIL:
+        return Value();
+    case msgpack::type::BOOLEAN:
+        return Value(object.via.boolean);
     case msgpack::type::POSITIVE_INTEGER:
         if (object.via.u64 <= std::uint64_t(INT64_MAX))
             return Value(static_cast<std::int64_t>(object.via.u64));
         return Value(object.via.u64);
-    case msgpack::type::NEGATIVE_INTEGER: return Value(object.via.i64);
+    case msgpack::type::NEGATIVE_INTEGER:
+        return Value(object.via.i64);
     case msgpack::type::FLOAT32:
-    case msgpack::type::FLOAT64: return Value(object.via.f64);
-    case msgpack::type::STR: return Value(std::string(object.via.str.ptr, object.via.str.size));
+    case msgpack::type::FLOAT64:
+        return Value(object.via.f64);
+    case msgpack::type::STR:
+        return Value(std::string(object.via.str.ptr, object.via.str.size));
     case msgpack::type::BIN:
         return Value(Data(reinterpret_cast<const std::uint8_t*>(object.via.bin.ptr),
                           reinterpret_cast<const std::uint8_t*>(object.via.bin.ptr) + object.via.bin.size));
@@ -137,18 +145,30 @@ std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& r
 void encodeMsgpack(msgpack::packer<msgpack::sbuffer>& packer, const Value& value)
 {
     switch (value.kind()) {
-    case Value::Kind::Nil: packer.pack_nil(); break;
-    case Value::Kind::Bool: *value.asBool() ? packer.pack_true() : packer.pack_false(); break;
-    case Value::Kind::Int: packer.pack_int64(*value.asInt()); break;
-    case Value::Kind::UInt: packer.pack_uint64(*value.asUInt()); break;
-    case Value::Kind::Double: packer.pack_double(*value.asDouble()); break;
+    case Value::Kind::Nil:
+        packer.pack_nil();
+        break;
+    case Value::Kind::Bool:
+        *value.asBool() ? packer.pack_true() : packer.pack_false();
+        break;
+    case Value::Kind::Int:
+        packer.pack_int64(*value.asInt());
+        break;
+    case Value::Kind::UInt:
+        packer.pack_uint64(*value.asUInt());
+        break;
+    case Value::Kind::Double:
+        packer.pack_double(*value.asDouble());
+        break;
     case Value::Kind::String: {
         const auto& text = *value.asString();
         packer.pack_str(static_cast<std::uint32_t>(text.size()));
         packer.pack_str_body(text.data(), static_cast<std::uint32_t>(text.size()));
         break;
     }
-    case Value::Kind::Date: encodeDate(packer, *value.asDate()); break;
+    case Value::Kind::Date:
+        encodeDate(packer, *value.asDate());
+        break;
     case Value::Kind::Data: {
         const auto& data = *value.asData();
         packer.pack_bin(static_cast<std::uint32_t>(data.size()));

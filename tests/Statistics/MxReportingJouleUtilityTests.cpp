@@ -20,9 +20,9 @@ TEST(MxReportingJouleUtilityTest, EngineOnTimeBecomesOneEventWhateverTheCategory
     for (const auto& event : events) {
         EXPECT_EQ(event.agent, 28);
         EXPECT_EQ(event.name, "Tessera_Haptics");
-        EXPECT_EQ(event.event, (Dictionary{{"EngineOnDuration", 12.5},
-                                           {"ApplicationName", "ExampleHost"},
-                                           {"TimestampEnd", 1700000000}}));
+        EXPECT_EQ(
+            event.event,
+            (Dictionary{{"EngineOnDuration", 12.5}, {"ApplicationName", "ExampleHost"}, {"TimestampEnd", 1700000000}}));
     }
     EXPECT_TRUE(platform.log.texts(MxLogLevel::Error).empty());
 }
@@ -38,7 +38,8 @@ TEST(MxReportingJouleUtilityTest, MissingTimestampOrHostIsLoggedAndTheEventStill
     EXPECT_EQ(events[0].event, (Dictionary{{"EngineOnDuration", "3s"}, {"ApplicationName", "Unknown"}}));
     EXPECT_EQ(events[1].event, (Dictionary{{"EngineOnDuration", 3}, {"TimestampEnd", 1}}));
     EXPECT_EQ(platform.log.texts(MxLogLevel::Error),
-              (std::vector<std::string>{"failed to get MxReporting timestamp for joule", "failed to get app name for joule"}));
+              (std::vector<std::string>{"failed to get MxReporting timestamp for joule",
+                                        "failed to get app name for joule"}));
 }
 
 } // namespace

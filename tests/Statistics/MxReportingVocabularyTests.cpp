@@ -16,20 +16,24 @@ struct NameCase {
 
 void PrintTo(const NameCase& nameCase, std::ostream* out) { *out << nameCase.code << " -> " << nameCase.name; }
 
-std::string caseName(const ::testing::TestParamInfo<NameCase>& info) { return fmt::format("Code{:X}", info.param.code); }
+std::string caseName(const ::testing::TestParamInfo<NameCase>& info)
+{
+    return fmt::format("Code{:X}", info.param.code);
+}
 
-class ServiceTypeNameTest : public ::testing::TestWithParam<NameCase> {};
+class ServiceTypeNameTest : public ::testing::TestWithParam<NameCase> { };
 TEST_P(ServiceTypeNameTest, Names)
 {
     EXPECT_EQ(MxReportingServiceTypeName(static_cast<ServiceType>(GetParam().code)), GetParam().name);
 }
 INSTANTIATE_TEST_SUITE_P(Codes, ServiceTypeNameTest,
-                         ::testing::Values(NameCase{0, "generic"}, NameCase{2, "telephony"}, NameCase{7, "longformaudio"},
-                                           NameCase{11, "test"}, NameCase{12, "apiusage"}, NameCase{13, "telephony"},
-                                           NameCase{100, "telephony"}, NameCase{65534, "telephony"},
-                                           NameCase{65535, "unknown"}), caseName);
+                         ::testing::Values(NameCase{0, "generic"}, NameCase{2, "telephony"},
+                                           NameCase{7, "longformaudio"}, NameCase{11, "test"}, NameCase{12, "apiusage"},
+                                           NameCase{13, "telephony"}, NameCase{100, "telephony"},
+                                           NameCase{65534, "telephony"}, NameCase{65535, "unknown"}),
+                         caseName);
 
-class CategoryNameTest : public ::testing::TestWithParam<NameCase> {};
+class CategoryNameTest : public ::testing::TestWithParam<NameCase> { };
 TEST_P(CategoryNameTest, Names) { EXPECT_EQ(MxReportingCategoryName(GetParam().code), GetParam().name); }
 INSTANTIATE_TEST_SUITE_P(Codes, CategoryNameTest,
                          ::testing::Values(NameCase{0x00000003, "Playback"}, NameCase{0x10000008, "DSP_Error"},
@@ -37,16 +41,19 @@ INSTANTIATE_TEST_SUITE_P(Codes, CategoryNameTest,
                                            NameCase{0x80000000, "Toolbox_Undefined"}, NameCase{0, "Undefined"},
                                            NameCase{12, "Undefined"}, NameCase{0x0000FFFF, "Undefined"},
                                            NameCase{0x40000007, "Routing_RouteChange"},
-                                           NameCase{0x0800000B, "Session_Volume"}, NameCase{0x2000000A, "HAL_Performance"}), caseName);
+                                           NameCase{0x0800000B, "Session_Volume"},
+                                           NameCase{0x2000000A, "HAL_Performance"}),
+                         caseName);
 
-class MessageTypeNameTest : public ::testing::TestWithParam<NameCase> {};
+class MessageTypeNameTest : public ::testing::TestWithParam<NameCase> { };
 TEST_P(MessageTypeNameTest, Names)
 {
     EXPECT_EQ(MxReportingMessageTypeName(static_cast<MessageType>(GetParam().code)), GetParam().name);
 }
 INSTANTIATE_TEST_SUITE_P(Codes, MessageTypeNameTest,
-                         ::testing::Values(NameCase{0, "Generic"}, NameCase{5, "IssueDetector"}, NameCase{6, "Undefined"},
-                                           NameCase{65535, "Unknown"}), caseName);
+                         ::testing::Values(NameCase{0, "Generic"}, NameCase{5, "IssueDetector"},
+                                           NameCase{6, "Undefined"}, NameCase{65535, "Unknown"}),
+                         caseName);
 
 TEST(MxReportingVocabularyTest, HostApplicationFallsBackToUnknown)
 {

@@ -2,11 +2,11 @@
 // Installs a fake of every process-wide platform service for the lifetime of a test
 // fixture, and restores whatever was installed before.
 
+#include "Statistics/MxReportingVocabulary.h"
 #include "fakes/CapturingLogSink.h"
 #include "fakes/FakeDispatch.h"
 #include "fakes/FakeServices.h"
 #include "fakes/FakeUplink.h"
-#include "Statistics/MxReportingVocabulary.h"
 
 namespace mx::testing {
 

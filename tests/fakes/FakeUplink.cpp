@@ -10,8 +10,12 @@ FakeUplinkSession::FakeUplinkSession(FakeUplink& uplink, int number, Dictionary 
 void FakeUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
 {
     switch (uplink_.discoveryFor(sessionInfo)) {
-    case FakeUplink::Discovery::Backends: completion(std::vector<std::string>{"spool"}); break;
-    case FakeUplink::Discovery::NoBackends: completion(std::nullopt); break;
+    case FakeUplink::Discovery::Backends:
+        completion(std::vector<std::string>{"spool"});
+        break;
+    case FakeUplink::Discovery::NoBackends:
+        completion(std::nullopt);
+        break;
     case FakeUplink::Discovery::Held: {
         std::lock_guard lock(mutex_);
         heldDiscovery_ = std::move(completion);
@@ -80,8 +84,8 @@ std::shared_ptr<UplinkSession> FakeUplink::makeSession(Dictionary sessionInfo, D
     return session;
 }
 
-bool FakeUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std::uint16_t category,
-                                std::uint16_t type, Dictionary payload, std::optional<UplinkError>& error)
+bool FakeUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std::uint16_t category, std::uint16_t type,
+                                Dictionary payload, std::optional<UplinkError>& error)
 {
     std::lock_guard lock(mutex_);
     oneShots_.push_back({std::move(sessionInfo), std::move(userInfo), category, type, std::move(payload)});

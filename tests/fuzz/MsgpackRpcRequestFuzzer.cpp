@@ -22,7 +22,8 @@ public:
     void getServiceNameForReporterID(ReporterID, MxServiceTypeReply reply) override { reply(65535); }
     void setConfiguration(std::optional<Dictionary>, ReporterID, MxBoolReply reply) override { reply(true); }
     void startReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
-    void sendMessage(Dictionary payload, MessageCategory, MessageType, std::optional<Array>, MxErrorReply reply) override
+    void sendMessage(Dictionary payload, MessageCategory, MessageType, std::optional<Array>,
+                     MxErrorReply reply) override
     {
         (void)Value(payload).description();
         reply(std::nullopt);

@@ -40,7 +40,10 @@ public:
     ~RawConnection() { ::close(fd_); }
 
     bool connected() const { return connected_; }
-    bool send(const std::string& bytes) { return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == ssize_t(bytes.size()); }
+    bool send(const std::string& bytes)
+    {
+        return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == ssize_t(bytes.size());
+    }
 
     // True once the daemon has closed its end.
     bool waitForClose()
@@ -90,7 +93,8 @@ TEST_F(DaemonIntegrationTest, TwoClientsFollowTheCrossClientRules)
     ASSERT_TRUE(other->createReportingSession(6).value.value_or(false));
 
     std::promise<bool> started;
-    other->startReportingSessionForID(5, [&](MxClientResult<bool> result) { started.set_value(result.value.value_or(false)); });
+    other->startReportingSessionForID(
+        5, [&](MxClientResult<bool> result) { started.set_value(result.value.value_or(false)); });
     EXPECT_EQ(other->reporterID(5).value, (Dictionary{{"reporterID", 5}, {"serviceType", 65535}}));
     EXPECT_TRUE(*other->stopReportingSessionForID(5).value) << "stop of another client's session replies true";
     auto startReply = started.get_future();
@@ -172,20 +176,27 @@ TEST_F(DaemonIntegrationTest, AClientThatDoesNotReadHoldsUpNobodyElse)
 TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)
 {
     auto bystander = connect();
-    pid_t victim = daemon.spawn({MXREPORT_PATH, "create", "11", "--", "type", "11", "test", "--", "start", "11", "--wait"});
+    pid_t victim =
+        daemon.spawn({MXREPORT_PATH, "create", "11", "--", "type", "11", "test", "--", "start", "11", "--wait"});
     ASSERT_TRUE(daemon.waitForLog("session created for reporter 11"));
-    ASSERT_TRUE(waitUntil([&] { return bystander->reporterID(11).value == Dictionary{{"reporterID", 11}, {"serviceType", 11}}; }));
+    ASSERT_TRUE(waitUntil([&] {
+        return bystander->reporterID(11).value == Dictionary{{"reporterID", 11}, {"serviceType", 11}};
+    }));
     ::kill(victim, SIGKILL);
     waitpid(victim, nullptr, 0);
 
     EXPECT_TRUE(daemon.waitForLog(fmt::format("removing {} from the server client list", victim)));
     EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=mxreport"));
     EXPECT_TRUE(waitUntil([&] {
-        return !daemon.query("tally", "SELECT payload FROM events WHERE name = "
-                                      "'com.kestrel.harmonia.mxreportingclientuptime'").empty();
+        return !daemon
+                    .query("tally",
+                           "SELECT payload FROM events WHERE name = "
+                           "'com.kestrel.harmonia.mxreportingclientuptime'")
+                    .empty();
     }));
-    auto uptime = nlohmann::json::parse(daemon.query("tally", "SELECT payload FROM events WHERE name = "
-                                                              "'com.kestrel.harmonia.mxreportingclientuptime'")[0][0]);
+    auto uptime = nlohmann::json::parse(daemon.query("tally",
+                                                     "SELECT payload FROM events WHERE name = "
+                                                     "'com.kestrel.harmonia.mxreportingclientuptime'")[0][0]);
     EXPECT_EQ(uptime["processName"], "mxreport");
     EXPECT_TRUE(uptime["seconds"].is_number_float());
     EXPECT_EQ(bystander->reporterID(11).value, (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
@@ -206,7 +217,7 @@ TEST_F(DaemonIntegrationTest, ReportingSwitchFollowsThePreferencesWhenTheNotific
     auto refused = [&] {
         auto outcome = client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::nullopt);
         return outcome.value && outcome.value->has_value() && (*outcome.value)->code == 1 &&
-               (*outcome.value)->domain == "com.kestrel.audio.reporting";
+            (*outcome.value)->domain == "com.kestrel.audio.reporting";
     };
     daemon.writeFile("var/lib/harmonia/preferences/com.kestrel.harmonia.json",
                      R"({"disable_reporting": true, "device_name": "den"})");
@@ -232,15 +243,18 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     ASSERT_TRUE(*client->setConfiguration(Dictionary{{"HostApplicationDisplayID", "ExampleHost"}}, 21).value);
     client->startReportingSessionForID(21, nullptr);
     for (int i = 0; i < 50; ++i)
-        ASSERT_TRUE(client->sendMessage(Dictionary{{"seq", i}, {"EngineOnTime", 0.5}, {"mxreporting_timestamp", 100 + i}},
-                                        0x08000003, 1, std::vector<ReporterID>{21}));
+        ASSERT_TRUE(
+            client->sendMessage(Dictionary{{"seq", i}, {"EngineOnTime", 0.5}, {"mxreporting_timestamp", 100 + i}},
+                                0x08000003, 1, std::vector<ReporterID>{21}));
     ASSERT_TRUE(*client->stopReportingSessionForID(21).value);
     ASSERT_TRUE(client->sendMessage(Dictionary{{"alone", true}}, 1, 0, std::nullopt));
 
     daemon.signal(SIGTERM);
     EXPECT_EQ(daemon.waitForExit(), 0);
-    EXPECT_EQ(daemon.query("tally", "SELECT count(*) FROM events WHERE name = "
-                                    "'com.kestrel.harmonia.Session_Playback.Start'")[0][0], "50");
+    EXPECT_EQ(daemon.query("tally",
+                           "SELECT count(*) FROM events WHERE name = "
+                           "'com.kestrel.harmonia.Session_Playback.Start'")[0][0],
+              "50");
     EXPECT_EQ(daemon.query("joule", "SELECT count(*) FROM events WHERE name = 'Tessera_Haptics' AND agent = 28")[0][0],
               "50");
     auto sessions = daemon.query("uplink", "SELECT id, session_info, user_info FROM sessions");
@@ -249,8 +263,8 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     EXPECT_EQ(sessionInfo.size(), 6u);
     EXPECT_EQ(sessionInfo["SessionID"], 21);
     EXPECT_EQ(nlohmann::json::parse(sessions[0][2])["ServiceName"], "longformaudio_session");
-    auto messages = daemon.query("uplink", "SELECT category, type, payload FROM messages WHERE session = " +
-                                               sessions[0][0] + " ORDER BY id");
+    auto messages = daemon.query(
+        "uplink", "SELECT category, type, payload FROM messages WHERE session = " + sessions[0][0] + " ORDER BY id");
     ASSERT_EQ(messages.size(), 51u);
     for (int i = 0; i < 50; ++i)
         EXPECT_EQ(nlohmann::json::parse(messages[i][2])["seq"], i);
@@ -281,7 +295,8 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
         auto rows = daemon.query(store, "SELECT count(*) FROM " + table);
         return rows.empty() ? 0 : std::stoi(rows[0][0]);
     };
-    ASSERT_TRUE(waitUntil([&] { return committed("tally", "events") == 500 && committed("uplink", "messages") == 500; }));
+    ASSERT_TRUE(
+        waitUntil([&] { return committed("tally", "events") == 500 && committed("uplink", "messages") == 500; }));
     // Keep the daemon busy while it dies.
     for (int i = 0; i < 200; ++i)
         client->sendMessage(Dictionary{{"late", i}}, 3, 1, std::vector<ReporterID>{3}, nullptr);

@@ -24,14 +24,18 @@ TEST(MxLogTest, VerboseLinesNeedTheScopesSwitchAtLevelFive)
 {
     ::setenv("mxlog_test_loud", "5", 1);
     ::setenv("mxlog_test_quiet", "4", 1);
-    const MxLogScope* loud = MxLogRegisterScope(1, MxFourCharCode("loud"), "loud", "com.kestrel.harmonia", "mxlog_test_loud", 31);
-    const MxLogScope* quiet = MxLogRegisterScope(1, MxFourCharCode("quit"), "quit", "com.kestrel.harmonia", "mxlog_test_quiet", 31);
+    const MxLogScope* loud =
+        MxLogRegisterScope(1, MxFourCharCode("loud"), "loud", "com.kestrel.harmonia", "mxlog_test_loud", 31);
+    const MxLogScope* quiet =
+        MxLogRegisterScope(1, MxFourCharCode("quit"), "quit", "com.kestrel.harmonia", "mxlog_test_quiet", 31);
     EXPECT_EQ(MxLogRegisterScope(1, 0, "loud", "other", "other", 31), loud) << "registered once";
 
     CapturingLogSink sink;
     ScopedInstall<MxLogSink> install(sink);
     int formatted = 0;
-    auto count = [&] { return ++formatted; };
+    auto count = [&] {
+        return ++formatted;
+    };
     MXLOG_VERBOSE(loud, "loud {}", count());
     MXLOG_VERBOSE(quiet, "quiet {}", count());
     MXLOG_VERBOSE(nullptr, "default {}", count());

@@ -47,10 +47,16 @@ TEST(MsgpackRpcDecoderTest, PipelinedRequestsSplitAcrossReadsComeOutWholeAndInOr
 
 TEST(MsgpackRpcDecoderTest, EveryValueKindSurvivesTheWire)
 {
-    Dictionary payload{{"nil", nullptr}, {"bool", true}, {"negative", -5}, {"big", 18446744073709551615ull},
-                       {"double", 2.5}, {"text", "héllo"}, {"data", Data{1, 2, 3}},
+    Dictionary payload{{"nil", nullptr},
+                       {"bool", true},
+                       {"negative", -5},
+                       {"big", 18446744073709551615ull},
+                       {"double", 2.5},
+                       {"text", "héllo"},
+                       {"data", Data{1, 2, 3}},
                        {"date", Date(std::chrono::seconds(1700000000) + std::chrono::nanoseconds(42))},
-                       {"old date", Date(std::chrono::seconds(-86400))}, {"list", Array{1, "a"}}};
+                       {"old date", Date(std::chrono::seconds(-86400))},
+                       {"list", Array{1, "a"}}};
     MsgpackRpcDecoder decoder;
     auto bytes = encode(payload);
     decoder.feed(bytes.data(), bytes.size());

@@ -16,7 +16,7 @@ namespace {
 // Reads the arguments of one request, remembering the first that does not fit.
 class Arguments {
 public:
-    Arguments(const std::string& method, const Array& params) : method_(method), params_(params) {}
+    Arguments(const std::string& method, const Array& params) : method_(method), params_(params) { }
 
     std::int64_t integer(std::size_t index, std::int64_t minimum, std::int64_t maximum, const char* what)
     {
@@ -76,7 +76,7 @@ private:
     {
         if (!error_)
             error_ = ServiceError{kServiceErrorBadArguments,
-                              fmt::format("argument {} of {} must be {}", index + 1, method_, what)};
+                                  fmt::format("argument {} of {} must be {}", index + 1, method_, what)};
     }
 
     const std::string& method_;
@@ -94,7 +94,9 @@ struct Operation {
 
 MxBoolReply boolReply(const Responder& responder)
 {
-    return [responder](bool value) { responder->respond(value); };
+    return [responder](bool value) {
+        responder->respond(value);
+    };
 }
 
 // The four operations that take a reporter ID and answer with a bool.
@@ -110,61 +112,74 @@ Operation reporterOperation(void (MxReportingServiceProtocol::*call)(ReporterID,
 const std::map<std::string, Operation, std::less<>>& operations()
 {
     static const std::map<std::string, Operation, std::less<>> table = {
-        {std::string(method::kCreateReportingSession), reporterOperation(&MxReportingServiceProtocol::createReportingSession)},
+        {std::string(method::kCreateReportingSession),
+         reporterOperation(&MxReportingServiceProtocol::createReportingSession)},
         {std::string(method::kSetServiceType),
-         {2, [](auto& service, auto& args, const Responder& responder) {
+         {2,
+          [](auto& service, auto& args, const Responder& responder) {
               auto type = static_cast<ServiceType>(args.unsignedInteger(0, 0xFFFF, "an unsigned 16-bit service type"));
               auto id = args.reporterID(1);
               if (!args.error())
                   service.setServiceType(type, id, boolReply(responder));
           }}},
         {std::string(method::kGetServiceNameForReporterID),
-         {1, [](auto& service, auto& args, const Responder& responder) {
+         {1,
+          [](auto& service, auto& args, const Responder& responder) {
               auto id = args.reporterID(0);
               if (!args.error())
                   service.getServiceNameForReporterID(id, [responder](ServiceType type) { responder->respond(type); });
           }}},
         {std::string(method::kSetConfiguration),
-         {2, [](auto& service, auto& args, const Responder& responder) {
+         {2,
+          [](auto& service, auto& args, const Responder& responder) {
               auto configuration = args.optionalDictionary(0);
               auto id = args.reporterID(1);
               if (!args.error())
                   service.setConfiguration(std::move(configuration), id, boolReply(responder));
           }}},
-        {std::string(method::kStartReportingSessionForID), reporterOperation(&MxReportingServiceProtocol::startReportingSessionForID)},
+        {std::string(method::kStartReportingSessionForID),
+         reporterOperation(&MxReportingServiceProtocol::startReportingSessionForID)},
         {std::string(method::kSendMessage),
-         {4, [](auto& service, auto& args, const Responder& responder) {
+         {4,
+          [](auto& service, auto& args, const Responder& responder) {
               auto payload = args.dictionary(0);
               auto category =
                   static_cast<MessageCategory>(args.unsignedInteger(1, 0xFFFFFFFF, "an unsigned 32-bit category"));
               auto type = static_cast<MessageType>(args.unsignedInteger(2, 0xFFFF, "an unsigned 16-bit message type"));
               auto ids = args.optionalArray(3);
               if (!args.error())
-                  service.sendMessage(std::move(payload), category, type, std::move(ids),
-                                      [responder](std::optional<MxReportingError> error) {
-                                          if (!error)
-                                              responder->respond(Value());
-                                          else
-                                              responder->respond(Dictionary{{"domain", error->domain},
-                                                                            {"code", error->code}});
-                                      });
+                  service.sendMessage(
+                      std::move(payload), category, type, std::move(ids),
+                      [responder](std::optional<MxReportingError> error) {
+                          if (!error)
+                              responder->respond(Value());
+                          else
+                              responder->respond(Dictionary{{"domain", error->domain}, {"code", error->code}});
+                      });
           }}},
-        {std::string(method::kStopReportingSessionForID), reporterOperation(&MxReportingServiceProtocol::stopReportingSessionForID)},
-        {std::string(method::kDestroyReportingSession), reporterOperation(&MxReportingServiceProtocol::destroyReportingSession)},
+        {std::string(method::kStopReportingSessionForID),
+         reporterOperation(&MxReportingServiceProtocol::stopReportingSessionForID)},
+        {std::string(method::kDestroyReportingSession),
+         reporterOperation(&MxReportingServiceProtocol::destroyReportingSession)},
         {std::string(method::kReporterIDValid),
-         {1, [](auto& service, auto& args, const Responder& responder) {
+         {1,
+          [](auto& service, auto& args, const Responder& responder) {
               auto id = args.reporterID(0);
               if (!args.error())
                   service.reporterID(id, [responder](Dictionary validity) { responder->respond(validity); });
           }}},
         {std::string(method::kGetAllReporters),
-         {0, [](auto& service, auto&, const Responder& responder) {
+         {0,
+          [](auto& service, auto&, const Responder& responder) {
               service.getAllReporters([responder](std::vector<ReporterID> reporters) {
                   responder->respond(Array(std::vector<Value>(reporters.begin(), reporters.end())));
               });
           }}},
         {std::string(method::kKillService),
-         {0, [](auto& service, auto&, const Responder& responder) { service.killService(boolReply(responder)); }}},
+         {0,
+          [](auto& service, auto&, const Responder& responder) {
+              service.killService(boolReply(responder));
+          }}},
     };
     return table;
 }

@@ -35,8 +35,8 @@ std::string describeSessions(const std::vector<std::shared_ptr<MxReportingSessio
 
 const MxLogScope* MxReportingServerInstance::logScope()
 {
-    static const MxLogScope* scope = MxLogRegisterScope(1, MxFourCharCode("mxrs"), "mxrs", "com.kestrel.harmonia",
-                                                        "reporting_server_verbose", 31);
+    static const MxLogScope* scope =
+        MxLogRegisterScope(1, MxFourCharCode("mxrs"), "mxrs", "com.kestrel.harmonia", "reporting_server_verbose", 31);
     return scope;
 }
 
@@ -70,7 +70,7 @@ void MxReportingServerInstance::enqueue(Work work)
 }
 
 std::shared_ptr<MxReportingSession> MxReportingServerInstance::findReportingSessionForID(ReporterID reporterID,
-                                                                                       bool acrossAllClients)
+                                                                                         bool acrossAllClients)
 {
     assert(serverQueue_->isCurrent());
     auto own = clientReportingSessionMap_.find(reporterID);
@@ -114,10 +114,8 @@ void MxReportingServerInstance::setConfiguration(std::optional<Dictionary> confi
                                                  MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "setting configuration");
-    enqueue([configuration = std::move(configuration), reporterID,
-             reply = std::move(reply)](MxReportingServerInstance& self) {
-        self.handleSetConfiguration(configuration, reporterID, reply);
-    });
+    enqueue([configuration = std::move(configuration), reporterID, reply = std::move(reply)](
+                MxReportingServerInstance& self) { self.handleSetConfiguration(configuration, reporterID, reply); });
 }
 
 void MxReportingServerInstance::startReportingSessionForID(ReporterID reporterID, MxBoolReply reply)
@@ -239,9 +237,8 @@ void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxBoolR
     session->parkTransactionCompleteBlock(reply);
 }
 
-void MxReportingServerInstance::handleSendMessage(const Dictionary& payload, MessageCategory category,
-                                                  MessageType type, const std::optional<Array>& reportingIDs,
-                                                  const MxErrorReply& reply)
+void MxReportingServerInstance::handleSendMessage(const Dictionary& payload, MessageCategory category, MessageType type,
+                                                  const std::optional<Array>& reportingIDs, const MxErrorReply& reply)
 {
     MxTrace(kTraceMessage);
     auto root = delegate_.lock();
@@ -377,8 +374,8 @@ void MxReportingServerInstance::handleDisconnection()
     if (!root)
         return;
     const auto& clients = root->getAllClients();
-    bool registered = std::any_of(clients.begin(), clients.end(),
-                                  [this](const auto& client) { return client.get() == this; });
+    bool registered =
+        std::any_of(clients.begin(), clients.end(), [this](const auto& client) { return client.get() == this; });
     if (!registered)
         return;
     // Sessions stay in the map; held start replies are never answered for a client

@@ -52,8 +52,8 @@ public:
     void getServiceNameForReporterID(ReporterID reporterID, MxServiceTypeReply reply) override;
     void setConfiguration(std::optional<Dictionary> configuration, ReporterID reporterID, MxBoolReply reply) override;
     void startReportingSessionForID(ReporterID reporterID, MxBoolReply reply) override;
-    void sendMessage(Dictionary payload, MessageCategory category, MessageType type,
-                     std::optional<Array> reportingIDs, MxErrorReply reply) override;
+    void sendMessage(Dictionary payload, MessageCategory category, MessageType type, std::optional<Array> reportingIDs,
+                     MxErrorReply reply) override;
     void stopReportingSessionForID(ReporterID reporterID, MxBoolReply reply) override;
     void destroyReportingSession(ReporterID reporterID, MxBoolReply reply) override;
     void reporterID(ReporterID reporterID, MxDictionaryReply valid) override;

@@ -111,8 +111,9 @@ void MxReportingServiceDelegate::reportClientUptime(const std::weak_ptr<MxReport
         MXLOG(scope, Default, "clientProcessName is nil. clientpid={}", pid);
         return;
     }
-    TallySendEventLazy("com.kestrel.harmonia.mxreportingclientuptime",
-                       [name = *processName, seconds] { return Dictionary{{"processName", name}, {"seconds", seconds}}; });
+    TallySendEventLazy("com.kestrel.harmonia.mxreportingclientuptime", [name = *processName, seconds] {
+        return Dictionary{{"processName", name}, {"seconds", seconds}};
+    });
 }
 
 std::optional<Dictionary> MxReportingServiceDelegate::getDefaults() { return defaults_; }
@@ -171,12 +172,11 @@ Dictionary MxReportingServiceDelegate::MxReportingDefaults()
 
 void MxReportingServiceDelegate::listenForDefaultsNotification()
 {
-    std::uint32_t status = notifications_.registerDispatch(
-        kMxReportingDefaultsNotification, notifyToken_, serverQueue_,
-        [weakSelf = weak_from_this()](int token) {
-            if (auto self = weakSelf.lock())
-                self->handleDefaultsNotification(token);
-        });
+    std::uint32_t status = notifications_.registerDispatch(kMxReportingDefaultsNotification, notifyToken_, serverQueue_,
+                                                           [weakSelf = weak_from_this()](int token) {
+                                                               if (auto self = weakSelf.lock())
+                                                                   self->handleDefaultsNotification(token);
+                                                           });
     MXLOG(MxReportingServerInstance::logScope(), Default, "notify setup result {}", status);
 }
 

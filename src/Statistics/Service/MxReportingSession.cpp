@@ -43,8 +43,8 @@ Dictionary MxReportingCleanKeys(const Dictionary& message)
 
 const MxLogScope* MxReportingSession::logScope()
 {
-    static const MxLogScope* scope = MxLogRegisterScope(1, MxFourCharCode("mxrr"), "mxrr", "com.kestrel.harmonia",
-                                                        "reporting_session_verbose", 31);
+    static const MxLogScope* scope =
+        MxLogRegisterScope(1, MxFourCharCode("mxrr"), "mxrr", "com.kestrel.harmonia", "reporting_session_verbose", 31);
     return scope;
 }
 

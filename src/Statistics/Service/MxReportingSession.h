@@ -56,7 +56,10 @@ public:
     // The drivers' snapshot of the current period, kept here for the endpoint that
     // took it; the session itself never reads it.
     std::shared_ptr<MxReportingDriverSnapShot> driverSnapShot() const { return driverSnapShot_.get(); }
-    void setDriverSnapShot(std::shared_ptr<MxReportingDriverSnapShot> snapShot) { driverSnapShot_.set(std::move(snapShot)); }
+    void setDriverSnapShot(std::shared_ptr<MxReportingDriverSnapShot> snapShot)
+    {
+        driverSnapShot_.set(std::move(snapShot));
+    }
     ReporterID reporterID() const { return reporterID_; }
     const std::vector<std::int32_t>& processIdentifiers() const { return processIdentifiers_; }
     AggregationArray aggregatedPayloadData() const { return aggregatedPayloadData_.get(); }
@@ -87,8 +90,7 @@ public:
     // Cleans, counts and aggregates the message on the calling thread, then queues its
     // delivery. `sync` is accepted and ignored: delivery is always asynchronous.
     // `reply`, when given, is answered at once with no error.
-    void sendMessage(const Dictionary& message, MessageCategory category, MessageType type, bool sync,
-                     SendReply reply);
+    void sendMessage(const Dictionary& message, MessageCategory category, MessageType type, bool sync, SendReply reply);
     void sendMessage(const Dictionary& message, MessageCategory category, MessageType type, SendReply reply);
 
     static void sendSingleMessage(const Dictionary& message, MessageCategory category, MessageType type,

@@ -104,8 +104,8 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
         MXLOG(logScope(), Error, "can't create logging directory at {}: {}", directory.string(), *failure);
     if (text.empty())
         return;
-    if (auto failure = fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType),
-                                                  text))
+    if (auto failure =
+            fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text))
         MXLOG(logScope(), Error, "jsonOutput writeToURL: {}", *failure);
 }
 

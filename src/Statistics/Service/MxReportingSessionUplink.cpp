@@ -33,15 +33,15 @@ std::int64_t randomAlarmDelaySeconds()
 // The backend-list callback and the configuration job meet here: the flag says that
 // backends were found, and is read and written only under the condition's lock.
 struct MxReportingDiscovery {
-    explicit MxReportingDiscovery(bool seed) : found(seed) {}
+    explicit MxReportingDiscovery(bool seed) : found(seed) { }
     MxReportingCondition condition;
     bool found;
 };
 
 MxReportingSessionUplink::MxReportingSessionUplink(ReporterID reporterID)
     : reporterID_(reporterID),
-      queue_(ProcessWide<Dispatch>::get().makeSerialQueue("com.kestrel.harmonia.session.uplink",
-                                                          QueuePriority::Utility))
+      queue_(
+          ProcessWide<Dispatch>::get().makeSerialQueue("com.kestrel.harmonia.session.uplink", QueuePriority::Utility))
 {
 }
 
@@ -57,12 +57,9 @@ void MxReportingSessionUplink::configure(ServiceType currentType, const Configur
 
     bool realtime = configuration.serviceType == service_type::kAPIUsage;
     Dictionary sessionInfo{
-        {kUplinkSessionInfoClientType, kUplinkClientType},
-        {kUplinkSessionInfoClientVersion, kUplinkClientVersion},
-        {kUplinkSessionInfoSessionID, reporterID_},
-        {kUplinkSessionInfoBatchEvent, !realtime},
-        {kUplinkSessionInfoHierarchyToken, token.text()},
-        {kUplinkSessionInfoContainsRealtimeEvents, realtime},
+        {kUplinkSessionInfoClientType, kUplinkClientType}, {kUplinkSessionInfoClientVersion, kUplinkClientVersion},
+        {kUplinkSessionInfoSessionID, reporterID_},        {kUplinkSessionInfoBatchEvent, !realtime},
+        {kUplinkSessionInfoHierarchyToken, token.text()},  {kUplinkSessionInfoContainsRealtimeEvents, realtime},
     };
     Dictionary backendUserInfo{
         {kUplinkUserInfoClientName, kUplinkClientName},
@@ -138,9 +135,9 @@ void MxReportingSessionUplink::flush(ServiceType currentType)
     uplinkSession_.set(nullptr);
 }
 
-void MxReportingSessionUplink::sendSingleMessage(const Dictionary& message, MessageCategory category,
-                                                 MessageType type, ServiceType serviceType,
-                                                 const Dictionary* /*userInfo*/, SendReply reply)
+void MxReportingSessionUplink::sendSingleMessage(const Dictionary& message, MessageCategory category, MessageType type,
+                                                 ServiceType serviceType, const Dictionary* /*userInfo*/,
+                                                 SendReply reply)
 {
     std::int64_t delta = serviceType == service_type::kAlarms ? randomAlarmDelaySeconds() : 0;
     MXLOG_VERBOSE(logScope(), "sending single message after delta {} for service {}", delta, serviceType);

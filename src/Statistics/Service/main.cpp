@@ -23,12 +23,12 @@
 #include "platform/linux/MsgpackRpcListener.h"
 #include "platform/linux/PosixFileSystem.h"
 #include "platform/linux/ProcProcessTable.h"
-#include "wire/RootPath.h"
 #include "platform/linux/SpoolUplink.h"
 #include "platform/linux/SqliteJoule.h"
 #include "platform/linux/SqliteTally.h"
 #include "platform/linux/StderrLogSink.h"
 #include "platform/linux/UsdtTracePoints.h"
+#include "wire/RootPath.h"
 
 using namespace mx;
 
@@ -60,7 +60,6 @@ void raiseDescriptorLimit()
     MXLOG(nullptr, Error, "mxreportingd cannot start: {}", message);
     std::exit(1);
 }
-
 
 } // namespace
 

@@ -17,7 +17,8 @@ constexpr int kUtilityNiceness = 5;
 AsioDispatch::AsioDispatch(unsigned threadsPerPool)
     // Request work is one serial queue: a second thread would only bounce it between cores.
     : interactivePool_("mx-interactive", threadsPerPool != 0 ? threadsPerPool : 1, 0),
-      utilityPool_("mx-utility", threadsPerPool != 0 ? threadsPerPool : std::max(1u, std::thread::hardware_concurrency() / 2),
+      utilityPool_("mx-utility",
+                   threadsPerPool != 0 ? threadsPerPool : std::max(1u, std::thread::hardware_concurrency() / 2),
                    kUtilityNiceness),
       interactiveQueue_("com.kestrel.harmonia.global.interactive", interactivePool_),
       utilityQueue_("com.kestrel.harmonia.global.utility", utilityPool_)

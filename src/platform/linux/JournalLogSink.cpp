@@ -15,10 +15,14 @@ namespace {
 int priority(MxLogLevel level)
 {
     switch (level) {
-    case MxLogLevel::Debug: return LOG_DEBUG;
-    case MxLogLevel::Info: return LOG_INFO;
-    case MxLogLevel::Default: return LOG_NOTICE;
-    case MxLogLevel::Error: return LOG_ERR;
+    case MxLogLevel::Debug:
+        return LOG_DEBUG;
+    case MxLogLevel::Info:
+        return LOG_INFO;
+    case MxLogLevel::Default:
+        return LOG_NOTICE;
+    case MxLogLevel::Error:
+        return LOG_ERR;
     }
     return LOG_NOTICE;
 }
@@ -29,9 +33,9 @@ void JournalLogSink::write(const MxLogRecord& record)
 {
     const char* subsystem = record.scope ? record.scope->subsystem.c_str() : "";
     const char* scope = record.scope ? record.scope->code.c_str() : "default";
-    sd_journal_send("MESSAGE=%s", record.message.c_str(), "PRIORITY=%i", priority(record.level),
-                    "MXLOG_SUBSYSTEM=%s", subsystem, "MXLOG_SCOPE=%s", scope, "CODE_FILE=%s", record.file,
-                    "CODE_LINE=%i", record.line, "CODE_FUNC=%s", record.function, nullptr);
+    sd_journal_send("MESSAGE=%s", record.message.c_str(), "PRIORITY=%i", priority(record.level), "MXLOG_SUBSYSTEM=%s",
+                    subsystem, "MXLOG_SCOPE=%s", scope, "CODE_FILE=%s", record.file, "CODE_LINE=%i", record.line,
+                    "CODE_FUNC=%s", record.function, nullptr);
 }
 
 bool JournalLogSink::runningUnderJournal()
@@ -39,7 +43,7 @@ bool JournalLogSink::runningUnderJournal()
     const char* stream = std::getenv("JOURNAL_STREAM");
     if (!stream)
         return false;
-    struct stat status {};
+    struct stat status { };
     if (fstat(STDERR_FILENO, &status) != 0)
         return false;
     std::string expected = std::to_string(status.st_dev) + ":" + std::to_string(status.st_ino);

@@ -2,12 +2,12 @@
 
 #include <fstream>
 
-#include "platform/MxLog.h"
 #include "platform/JsonValue.h"
+#include "platform/MxLog.h"
 
 namespace mx {
 
-JsonPreferences::JsonPreferences(std::filesystem::path directory) : directory_(std::move(directory)) {}
+JsonPreferences::JsonPreferences(std::filesystem::path directory) : directory_(std::move(directory)) { }
 
 std::filesystem::path JsonPreferences::domainPath(const std::string& domain) const
 {

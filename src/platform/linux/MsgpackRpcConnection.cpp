@@ -113,8 +113,12 @@ void MsgpackRpcConnection::handleRead(std::size_t bytes)
     std::string reason;
     for (;;) {
         switch (decoder_.next(message, reason)) {
-        case MsgpackRpcDecoder::Status::NeedMore: readMore(); return;
-        case MsgpackRpcDecoder::Status::Bad: close(reason); return;
+        case MsgpackRpcDecoder::Status::NeedMore:
+            readMore();
+            return;
+        case MsgpackRpcDecoder::Status::Bad:
+            close(reason);
+            return;
         case MsgpackRpcDecoder::Status::Message:
             if (!handleMessage(message))
                 return;

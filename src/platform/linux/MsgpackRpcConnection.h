@@ -1,10 +1,9 @@
 #pragma once
 // One client connection of the listener: reads msgpack-rpc requests from the Unix
 // stream socket, hands each (method name and parameters, whatever the method) to the
-// exported object, and writes the replies back in whatever order they come. Bad input closes only this connection, with one log
-// line. A client that stops reading its replies is back-pressured: its requests are
-// not read while its unsent replies exceed a bound.
-// Lives on the connection layer's I/O thread; replies may be sent from any thread.
+// exported object, and writes the replies back in whatever order they come. Bad input closes only this connection, with
+// one log line. A client that stops reading its replies is back-pressured: its requests are not read while its unsent
+// replies exceed a bound. Lives on the connection layer's I/O thread; replies may be sent from any thread.
 
 #include <atomic>
 #include <deque>
@@ -22,8 +21,7 @@
 
 namespace mx {
 
-class MsgpackRpcConnection final : public ServiceConnection,
-                                   public std::enable_shared_from_this<MsgpackRpcConnection> {
+class MsgpackRpcConnection final : public ServiceConnection, public std::enable_shared_from_this<MsgpackRpcConnection> {
 public:
     // Unsent reply bytes above which the client's requests are no longer read.
     static constexpr std::size_t kBackPressureBytes = 4 << 20;

@@ -92,8 +92,8 @@ std::string logsRequest(const Json& records)
     Json request = {
         {"resourceLogs",
          Json::array({{{"resource", {{"attributes", Json::array({attribute("service.name", "mxreportingd")})}}},
-                       {"scopeLogs", Json::array({{{"scope", {{"name", "com.kestrel.harmonia"}}},
-                                                   {"logRecords", records}}})}}})}};
+                       {"scopeLogs",
+                        Json::array({{{"scope", {{"name", "com.kestrel.harmonia"}}}, {"logRecords", records}}})}}})}};
     return request.dump(-1, ' ', false, Json::error_handler_t::replace);
 }
 
@@ -256,12 +256,13 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
         return true;
     };
     auto record = [&](const char* sql, std::int64_t number) {
-        query(sql,
-              [&](sqlite3_stmt* s) {
-                  sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT);
-                  sqlite3_bind_int64(s, 2, number);
-              },
-              [](sqlite3_stmt*) {});
+        query(
+            sql,
+            [&](sqlite3_stmt* s) {
+                sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT);
+                sqlite3_bind_int64(s, 2, number);
+            },
+            [](sqlite3_stmt*) {});
     };
     auto send = [&](const Json& records, std::optional<UplinkError>& failure) {
         std::chrono::seconds retryAfter{0};
@@ -282,21 +283,23 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
     };
 
     std::int64_t cursor = 0;
-    query("SELECT stream_cursor FROM exports WHERE backend = ?1",
-          [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
-          [&](sqlite3_stmt* s) { cursor = sqlite3_column_int64(s, 0); });
+    query(
+        "SELECT stream_cursor FROM exports WHERE backend = ?1",
+        [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
+        [&](sqlite3_stmt* s) { cursor = sqlite3_column_int64(s, 0); });
 
     Json records = Json::array();
     std::int64_t last = cursor;
-    query(kStreamQuery,
-          [&](sqlite3_stmt* s) {
-              sqlite3_bind_int64(s, 1, cursor);
-              sqlite3_bind_int64(s, 2, kBatchMessages);
-          },
-          [&](sqlite3_stmt* s) {
-              records.push_back(logRecord(s));
-              last = sqlite3_column_int64(s, 0);
-          });
+    query(
+        kStreamQuery,
+        [&](sqlite3_stmt* s) {
+            sqlite3_bind_int64(s, 1, cursor);
+            sqlite3_bind_int64(s, 2, kBatchMessages);
+        },
+        [&](sqlite3_stmt* s) {
+            records.push_back(logRecord(s));
+            last = sqlite3_column_int64(s, 0);
+        });
     std::optional<UplinkError> failure;
     if (!records.empty()) {
         if (!send(records, failure))
@@ -308,22 +311,24 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
     }
 
     std::vector<std::int64_t> sessions;
-    query(kFlushedSessionsQuery, [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
-          [&](sqlite3_stmt* s) { sessions.push_back(sqlite3_column_int64(s, 0)); });
+    query(
+        kFlushedSessionsQuery, [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
+        [&](sqlite3_stmt* s) { sessions.push_back(sqlite3_column_int64(s, 0)); });
     for (auto session : sessions) {
         std::int64_t after = 0;
         for (;;) {
             Json chunk = Json::array();
-            query(kSessionMessagesQuery,
-                  [&](sqlite3_stmt* s) {
-                      sqlite3_bind_int64(s, 1, session);
-                      sqlite3_bind_int64(s, 2, after);
-                      sqlite3_bind_int64(s, 3, kBatchMessages);
-                  },
-                  [&](sqlite3_stmt* s) {
-                      chunk.push_back(logRecord(s));
-                      after = sqlite3_column_int64(s, 0);
-                  });
+            query(
+                kSessionMessagesQuery,
+                [&](sqlite3_stmt* s) {
+                    sqlite3_bind_int64(s, 1, session);
+                    sqlite3_bind_int64(s, 2, after);
+                    sqlite3_bind_int64(s, 3, kBatchMessages);
+                },
+                [&](sqlite3_stmt* s) {
+                    chunk.push_back(logRecord(s));
+                    after = sqlite3_column_int64(s, 0);
+                });
             if (chunk.empty())
                 break;
             if (!send(chunk, failure))

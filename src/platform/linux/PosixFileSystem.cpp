@@ -24,14 +24,15 @@ std::optional<std::string> PosixFileSystem::createDirectories(const std::filesys
         }
         if (errno != EEXIST)
             return std::string(std::strerror(errno));
-        struct stat status {};
+        struct stat status { };
         if (stat(partial.c_str(), &status) != 0 || !S_ISDIR(status.st_mode))
             return partial.string() + " exists and is not a directory";
     }
     return std::nullopt;
 }
 
-std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesystem::path& file, std::string_view contents)
+std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesystem::path& file,
+                                                            std::string_view contents)
 {
     std::string temporary = (file.parent_path() / ("." + file.filename().string() + ".XXXXXX")).string();
     int fd = mkstemp(temporary.data());

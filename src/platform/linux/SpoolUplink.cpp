@@ -70,7 +70,8 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
     return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store), spoolListed, collectors));
 }
 
-SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed, const std::vector<std::string>& collectors)
+SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed,
+                         const std::vector<std::string>& collectors)
     : store_(std::move(store)),
       lastSessionID_(store_->queryInteger("SELECT max(id) FROM sessions")),
       spoolListed_(spoolListed)

@@ -2,8 +2,8 @@
 
 #include <fmt/format.h>
 
-#include "platform/WorkQueue.h"
 #include "platform/JsonValue.h"
+#include "platform/WorkQueue.h"
 #include "platform/linux/SpoolUplink.h"
 
 namespace mx {
@@ -22,14 +22,15 @@ SpoolUplinkSession::SpoolUplinkSession(std::shared_ptr<SpoolUplink> uplink, std:
                                        Dictionary userInfo)
     : uplink_(std::move(uplink)), store_(uplink_->store()), id_(id), realtime_(containsRealtimeEvents(sessionInfo))
 {
-    store_.submit({SpoolUplink::kInsertSession,
-                   {id_, std::move(sessionInfo), std::move(userInfo), secondsSinceEpoch()}});
+    store_.submit(
+        {SpoolUplink::kInsertSession, {id_, std::move(sessionInfo), std::move(userInfo), secondsSinceEpoch()}});
 }
 
 void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
 {
-    ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
-        [uplink = uplink_, completion = std::move(completion)]() mutable {
+    ProcessWide<Dispatch>::get()
+        .globalQueue(QueuePriority::Utility)
+        .dispatch([uplink = uplink_, completion = std::move(completion)]() mutable {
             ScopedBlockingCall probing;
             auto backends = uplink->discoverBackends();
             if (backends.empty())
@@ -42,8 +43,7 @@ void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<st
 SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const
 {
     return {SpoolUplink::kInsertMessage,
-            {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, payload, nullptr,
-             nullptr}};
+            {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, payload, nullptr, nullptr}};
 }
 
 bool SpoolUplinkSession::sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,
@@ -56,8 +56,9 @@ bool SpoolUplinkSession::sendMessage(std::uint16_t category, std::uint16_t type,
 void SpoolUplinkSession::flushMessages(UniqueFunction<void(std::optional<UplinkError>)> completion)
 {
     store_.submit({SpoolUplink::kFlushSession, {secondsSinceEpoch(), id_}});
-    ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch(
-        [uplink = uplink_, id = id_, realtime = realtime_, completion = std::move(completion)]() mutable {
+    ProcessWide<Dispatch>::get()
+        .globalQueue(QueuePriority::Utility)
+        .dispatch([uplink = uplink_, id = id_, realtime = realtime_, completion = std::move(completion)]() mutable {
             ScopedBlockingCall settling;
             completion(uplink->settleSession(id, realtime));
         });

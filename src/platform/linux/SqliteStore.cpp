@@ -4,8 +4,8 @@
 #include <pthread.h>
 #include <sqlite3.h>
 
-#include "platform/MxLog.h"
 #include "platform/JsonValue.h"
+#include "platform/MxLog.h"
 
 namespace mx {
 
@@ -42,7 +42,8 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
     std::vector<sqlite3_stmt*> prepared;
     for (const auto& sql : statements) {
         sqlite3_stmt* statement = nullptr;
-        if (sqlite3_prepare_v3(database, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &statement, nullptr) != SQLITE_OK) {
+        if (sqlite3_prepare_v3(database, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &statement, nullptr) !=
+            SQLITE_OK) {
             error = path.string() + ": " + sqlite3_errmsg(database) + " in: " + sql;
             for (auto* done : prepared)
                 sqlite3_finalize(done);
@@ -143,14 +144,11 @@ void SqliteStore::commit(std::deque<SqliteWrite>& batch)
                     else if constexpr (std::is_same_v<T, std::string>)
                         sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()),
                                           SQLITE_STATIC);
-                    else if constexpr (std::is_same_v<T, Dictionary>)
-                    {
+                    else if constexpr (std::is_same_v<T, Dictionary>) {
                         std::string text = toJsonText(value);
                         sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()),
                                           SQLITE_TRANSIENT);
-                    }
-                    else
-                    {
+                    } else {
                         std::string text = toJsonText((*value)());
                         sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()),
                                           SQLITE_TRANSIENT);

@@ -3,8 +3,8 @@
 #include <chrono>
 #include <fstream>
 
-#include "platform/MxLog.h"
 #include "platform/JsonValue.h"
+#include "platform/MxLog.h"
 
 namespace mx {
 

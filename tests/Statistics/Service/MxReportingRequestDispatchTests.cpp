@@ -41,7 +41,8 @@ protected:
         return reply;
     }
 
-    std::shared_ptr<::testing::StrictMock<MockService>> service = std::make_shared<::testing::StrictMock<MockService>>();
+    std::shared_ptr<::testing::StrictMock<MockService>> service =
+        std::make_shared<::testing::StrictMock<MockService>>();
 };
 
 TEST_F(MxReportingRequestDispatchTest, RequestsThatCannotBeHandedOnAreAnsweredWithAnError)
@@ -60,7 +61,8 @@ TEST_F(MxReportingRequestDispatchTest, RequestsThatCannotBeHandedOnAreAnsweredWi
         {"setServiceType:reportingSession:reply:", Array{65536, 1}, kServiceErrorBadArguments},
         {"sendMessage:withCategory:andType:forReportingIDs:reply:", Array{Dictionary{}, -1, 0, nullptr},
          kServiceErrorBadArguments},
-        {"sendMessage:withCategory:andType:forReportingIDs:reply:", Array{Dictionary{}, 1, 0, 5}, kServiceErrorBadArguments},
+        {"sendMessage:withCategory:andType:forReportingIDs:reply:", Array{Dictionary{}, 1, 0, 5},
+         kServiceErrorBadArguments},
         {"setConfiguration:forReporterID:reply:", Array{Array{}, 1}, kServiceErrorBadArguments},
     };
     for (const auto& request : cases) {

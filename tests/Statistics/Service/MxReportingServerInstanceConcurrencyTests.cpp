@@ -20,7 +20,7 @@ constexpr auto kBound = std::chrono::seconds(60);
 
 class Countdown {
 public:
-    explicit Countdown(int count) : count_(count) {}
+    explicit Countdown(int count) : count_(count) { }
     void arrive()
     {
         std::lock_guard lock(mutex_);
@@ -102,8 +102,8 @@ TEST_F(MxReportingServerInstanceConcurrencyTest, EveryMessageIsRepliedOnceAndDel
             auto neighbour = ownIDs((c + 1) % kClients)[0];
             for (int seq = 0; seq < kMessagesPerClient; ++seq) {
                 Array ids{ownIDs(c)[0], ownIDs(c)[1], neighbour};
-                clients[c]->sendMessage(Dictionary{{"sender", c}, {"seq", seq}, {"peak level", seq % 7}}, 0x08000003,
-                                        1, ids, [&](std::optional<MxReportingError> error) {
+                clients[c]->sendMessage(Dictionary{{"sender", c}, {"seq", seq}, {"peak level", seq % 7}}, 0x08000003, 1,
+                                        ids, [&](std::optional<MxReportingError> error) {
                                             errors += error ? 1 : 0;
                                             replies.arrive();
                                         });
@@ -149,8 +149,7 @@ TEST_F(MxReportingServerInstanceConcurrencyTest, EveryMessageIsRepliedOnceAndDel
     std::size_t alone = 0;
     for (const auto& oneShot : platform.uplink.oneShots())
         alone += oneShot.payload.contains("sender") ? 1 : 0;
-    EXPECT_EQ(delivered + alone, expected)
-        << "every message reaches the backend, in a session or alone";
+    EXPECT_EQ(delivered + alone, expected) << "every message reaches the backend, in a session or alone";
 }
 
 } // namespace

@@ -17,7 +17,9 @@ struct Replies {
     std::vector<T> values;
     auto callback()
     {
-        return [this](T value) { values.push_back(std::move(value)); };
+        return [this](T value) {
+            values.push_back(std::move(value));
+        };
     }
 };
 
@@ -118,8 +120,8 @@ TEST_F(MxReportingServerInstanceTest, SessionLifeAsAClientDrivesIt)
     EXPECT_FALSE(reporting->started());
     EXPECT_EQ(reporting->driverSnapShot(), nullptr);
     EXPECT_THAT(root->statisticsAskedAgainst, ElementsAre(snapShot));
-    EXPECT_THAT(tallyNames(), ElementsAre("com.kestrel.harmonia.Session_Playback.Start",
-                                          "com.kestrel.harmonia.DriverStats.Generic"));
+    EXPECT_THAT(tallyNames(),
+                ElementsAre("com.kestrel.harmonia.Session_Playback.Start", "com.kestrel.harmonia.DriverStats.Generic"));
     EXPECT_EQ(platform.joule.events().size(), 1u) << "driver statistics never reach the power log";
     EXPECT_EQ(reporting->messageTypeCounts().at("DriverStats_Generic"), 1);
     EXPECT_TRUE(platform.log.contains("fetching driver logs {\"Speaker_underruns\":3}"));
@@ -135,7 +137,9 @@ TEST_F(MxReportingServerInstanceTest, SessionLifeAsAClientDrivesIt)
     EXPECT_TRUE(platform.log.contains("deallocing this session 5"));
 
     auto codes = platform.trace.codes();
-    auto position = [&](std::uint32_t code) { return std::find(codes.begin(), codes.end(), code) - codes.begin(); };
+    auto position = [&](std::uint32_t code) {
+        return std::find(codes.begin(), codes.end(), code) - codes.begin();
+    };
     EXPECT_LT(position(0x21042814), position(0x21042828)) << "create handled, then session created";
     EXPECT_LT(position(0x21042818), position(0x2104282C));
     EXPECT_LT(position(0x2104281C), position(0x21042830));
@@ -278,8 +282,9 @@ TEST_F(MxReportingServerInstanceTest, QueriesFindSessionsOfAnyClientInConnection
 
     EXPECT_THAT(serviceTypes.values, ElementsAre(12, 4, 65535)) << "own sessions come before other clients'";
     EXPECT_TRUE(platform.log.contains("returnning service type 12 for reporter  5"));
-    EXPECT_THAT(validity.values, ElementsAre(Dictionary{{"reporterID", 5}, {"serviceType", 12}},
-                                             Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
+    EXPECT_THAT(validity.values,
+                ElementsAre(Dictionary{{"reporterID", 5}, {"serviceType", 12}},
+                            Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
     EXPECT_THAT(reporters.values, ElementsAre(std::vector<ReporterID>{6, 5, 6}));
     EXPECT_TRUE(platform.log.contains("validating reporter 5"));
 }
@@ -347,7 +352,8 @@ TEST_F(MxReportingServerInstanceTest, MessageWithoutIdListAndNoStartedSessionGoe
     EXPECT_EQ(oneShots[0].category, 1);
     EXPECT_EQ(oneShots[0].type, 4);
     EXPECT_EQ(oneShots[0].payload, (Dictionary{{"peak_level", 3}}));
-    EXPECT_EQ(oneShots[0].userInfo, (Dictionary{{"ClientName", "com.kestrel.harmonia"}, {"ServiceName", "standalone"}}));
+    EXPECT_EQ(oneShots[0].userInfo,
+              (Dictionary{{"ClientName", "com.kestrel.harmonia"}, {"ServiceName", "standalone"}}));
     EXPECT_EQ(*oneShots[0].sessionInfo.find("SessionID"), Value(-1));
 }
 

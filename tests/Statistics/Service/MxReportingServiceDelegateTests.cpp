@@ -14,8 +14,8 @@ using ::testing::IsEmpty;
 
 class NoListener final : public ServiceListener {
 public:
-    void setDelegate(std::shared_ptr<ServiceListenerDelegate>) override {}
-    void resume() override {}
+    void setDelegate(std::shared_ptr<ServiceListenerDelegate>) override { }
+    void resume() override { }
 };
 
 class MxReportingServiceDelegateTest : public ::testing::Test {
@@ -93,8 +93,8 @@ TEST_F(MxReportingServiceDelegateTest, LookupAcrossClientsFollowsConnectionOrder
     EXPECT_EQ(found->reporterID(), 5);
     EXPECT_FALSE(zero);
     EXPECT_FALSE(missing);
-    EXPECT_THAT(platform.log.texts(), ElementsAre("found reporting session 5 for client 2",
-                                                  "failed to find reporting session 9"));
+    EXPECT_THAT(platform.log.texts(),
+                ElementsAre("found reporting session 5 for client 2", "failed to find reporting session 9"));
 }
 
 TEST_F(MxReportingServiceDelegateTest, NotificationReReadsDefaultsPushesThemAndSetsTheSwitch)

@@ -98,8 +98,8 @@ TEST_F(MxReportingSessionTest, IdentifiersCountOnAcrossRestartsWhileStoresStartA
 TEST_F(MxReportingSessionTest, KeysAreCleanedAtTheTopLevelOnly)
 {
     Dictionary nested{{"inner key", 1}};
-    Dictionary cleaned = MxReportingCleanKeys(
-        Dictionary{{"peak level", 3}, {"rate", 48000}, {"a  b", nested}, {"x y", 1}, {"x_y", 2}});
+    Dictionary cleaned =
+        MxReportingCleanKeys(Dictionary{{"peak level", 3}, {"rate", 48000}, {"a  b", nested}, {"x y", 1}, {"x_y", 2}});
     EXPECT_EQ(cleaned, (Dictionary{{"peak_level", 3}, {"rate", 48000}, {"a__b", nested}, {"x_y", 2}}));
 
     auto session = makeSession();
@@ -126,11 +126,16 @@ TEST_F(MxReportingSessionTest, BackendGetsSessionDescriptionAndMessagesInOrderTh
     auto backend = onlyBackendSession();
     ASSERT_TRUE(backend);
     EXPECT_EQ(backend->sessionInfo,
-              (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", 5}, {"BatchEvent", false},
-                          {"HierarchyToken", session->uplinkAgentToken()->text()}, {"ContainsRealtimeEvents", true}}));
-    EXPECT_EQ(backend->userInfo, (Dictionary{{"ClientName", "com.kestrel.harmonia"},
-                                             {"ServiceName", "custom"},
-                                             {"HostApplicationDisplayID", "ExampleHost"}}));
+              (Dictionary{{"ClientType", 19},
+                          {"ClientVersion", 2.0},
+                          {"SessionID", 5},
+                          {"BatchEvent", false},
+                          {"HierarchyToken", session->uplinkAgentToken()->text()},
+                          {"ContainsRealtimeEvents", true}}));
+    EXPECT_EQ(backend->userInfo,
+              (Dictionary{{"ClientName", "com.kestrel.harmonia"},
+                          {"ServiceName", "custom"},
+                          {"HostApplicationDisplayID", "ExampleHost"}}));
     auto messages = backend->messages();
     ASSERT_EQ(messages.size(), 3u);
     EXPECT_EQ(messages[0].category, 3) << "the subsystem half is cut off";
@@ -211,8 +216,8 @@ TEST_F(MxReportingSessionTest, SummaryListsEveryValueOfEveryKeyInMessageOrder)
     session->start();
     EXPECT_FALSE(session->createSummaryEventForSession());
     session->sendMessage(Dictionary{{"rate", 48000}, {"output route", "Speaker"}}, 3, 1, nullptr);
-    session->sendMessage(Dictionary{{"rate", 44100}, {"list", Array{1, "two"}}, {"Mx_Session_Summary_Event", "x"}},
-                         3, 1, nullptr);
+    session->sendMessage(Dictionary{{"rate", 44100}, {"list", Array{1, "two"}}, {"Mx_Session_Summary_Event", "x"}}, 3,
+                         1, nullptr);
     EXPECT_EQ(*session->createSummaryEventForSession(),
               (Dictionary{{"Mx_Session_Summary_Event", "7,x"},
                           {"rate", "48000,44100"},
@@ -306,8 +311,7 @@ protected:
         return {path.string(), nlohmann::json::parse(text)};
     }
 
-    static constexpr const char* kDirectory =
-        "/root/var/log/harmonia/reporting";
+    static constexpr const char* kDirectory = "/root/var/log/harmonia/reporting";
 };
 
 TEST_F(MxReportingSummaryFileTest, FileHoldsUserInfoThenEveryMessageThenTheSummary)
@@ -321,8 +325,9 @@ TEST_F(MxReportingSummaryFileTest, FileHoldsUserInfoThenEveryMessageThenTheSumma
 
     EXPECT_EQ(platform.files.directories.at(kDirectory), 0777);
     auto [path, document] = onlyFile();
-    EXPECT_THAT(path, ::testing::MatchesRegex(std::string(kDirectory) +
-                                              "/[0-9]{8}-[0-9]{6}[-+][0-9]{4}-harmonia-ExampleHost-longformaudio\\.json"));
+    EXPECT_THAT(path,
+                ::testing::MatchesRegex(std::string(kDirectory) +
+                                        "/[0-9]{8}-[0-9]{6}[-+][0-9]{4}-harmonia-ExampleHost-longformaudio\\.json"));
     EXPECT_EQ(document, nlohmann::json::parse(R"([
         {"HostApplicationDisplayID": "ExampleHost"},
         {"Session_Playback_Start_1": {"output_route": "Speaker", "rate": 48000}},
@@ -366,10 +371,10 @@ TEST_F(MxReportingSummaryFileTest, UnwritableDirectoryIsLoggedTwiceAndStopGoesOn
     session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
     session->stop();
     run();
-    EXPECT_THAT(platform.log.texts(MxLogLevel::Error),
-                ::testing::ElementsAre(std::string("can't create logging directory at ") + kDirectory +
-                                           ": Permission denied",
-                                       "jsonOutput writeToURL: No such file or directory"));
+    EXPECT_THAT(
+        platform.log.texts(MxLogLevel::Error),
+        ::testing::ElementsAre(std::string("can't create logging directory at ") + kDirectory + ": Permission denied",
+                               "jsonOutput writeToURL: No such file or directory"));
     EXPECT_EQ(onlyBackendSession()->flushes(), 1);
 }
 

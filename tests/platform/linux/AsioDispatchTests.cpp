@@ -80,7 +80,9 @@ TEST(AsioDispatchTest, DelayedWorkRunsAfterItsDelayOnItsQueue)
     EXPECT_GE(future.get() - began, std::chrono::milliseconds(50));
 
     std::promise<void> global;
-    dispatch.globalQueue(QueuePriority::Utility).dispatchAfter(std::chrono::milliseconds(1), [&] { global.set_value(); });
+    dispatch.globalQueue(QueuePriority::Utility).dispatchAfter(std::chrono::milliseconds(1), [&] {
+        global.set_value();
+    });
     EXPECT_EQ(global.get_future().wait_for(kBound), std::future_status::ready);
 }
 
