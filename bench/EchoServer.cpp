@@ -17,7 +17,7 @@ namespace {
 
 class EchoConnection : public std::enable_shared_from_this<EchoConnection> {
 public:
-    explicit EchoConnection(asio::local::stream_protocol::socket socket) : socket_(std::move(socket)) { }
+    explicit EchoConnection(asio::local::stream_protocol::socket socket) : socket_(std::move(socket)) {}
 
     void read()
     {

@@ -146,7 +146,7 @@ std::string show(const Value& value) { return toJson(value).dump(); }
 
 class Session {
 public:
-    Session(MxReportingClient& client) : client_(client) { }
+    Session(MxReportingClient& client) : client_(client) {}
 
     // Runs one command; returns false when the daemon refused or failed it.
     bool run(const std::vector<std::string>& words)

@@ -12,7 +12,7 @@ template <class T>
 class MxAtomicProperty {
 public:
     MxAtomicProperty() = default;
-    explicit MxAtomicProperty(T value) : value_(std::move(value)) { }
+    explicit MxAtomicProperty(T value) : value_(std::move(value)) {}
 
     T get() const
     {

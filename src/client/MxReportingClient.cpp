@@ -21,7 +21,7 @@ namespace mx {
 // The socket and everything in flight on it, owned by the client's I/O thread.
 class MxReportingClient::Connection : public std::enable_shared_from_this<Connection> {
 public:
-    Connection() : keepRunning_(io_.get_executor()), socket_(io_) { }
+    Connection() : keepRunning_(io_.get_executor()), socket_(io_) {}
 
     ~Connection()
     {
@@ -251,7 +251,7 @@ std::unique_ptr<MxReportingClient> MxReportingClient::connect(const std::filesys
     return std::unique_ptr<MxReportingClient>(new MxReportingClient(std::move(connection)));
 }
 
-MxReportingClient::MxReportingClient(std::shared_ptr<Connection> connection) : connection_(std::move(connection)) { }
+MxReportingClient::MxReportingClient(std::shared_ptr<Connection> connection) : connection_(std::move(connection)) {}
 
 MxReportingClient::~MxReportingClient() = default;
 

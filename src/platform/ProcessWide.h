@@ -35,7 +35,7 @@ private:
 template <class Service>
 class ScopedInstall {
 public:
-    explicit ScopedInstall(Service& service) : previous_(ProcessWide<Service>::install(&service)) { }
+    explicit ScopedInstall(Service& service) : previous_(ProcessWide<Service>::install(&service)) {}
     ~ScopedInstall() { ProcessWide<Service>::install(previous_); }
     ScopedInstall(const ScopedInstall&) = delete;
     ScopedInstall& operator=(const ScopedInstall&) = delete;

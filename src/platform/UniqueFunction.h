@@ -17,7 +17,7 @@ template <class R, class... Args>
 class UniqueFunction<R(Args...)> {
 public:
     UniqueFunction() = default;
-    UniqueFunction(std::nullptr_t) { }
+    UniqueFunction(std::nullptr_t) {}
 
     template <class F>
     requires(!std::is_same_v<std::decay_t<F>, UniqueFunction> && std::is_invocable_r_v<R, F&, Args...>)
@@ -46,8 +46,8 @@ private:
     };
     template <class F>
     struct Holder final : Callable {
-        explicit Holder(F&& f) : function(std::move(f)) { }
-        explicit Holder(const F& f) : function(f) { }
+        explicit Holder(F&& f) : function(std::move(f)) {}
+        explicit Holder(const F& f) : function(f) {}
         R call(Args... args) override { return std::invoke(function, std::forward<Args>(args)...); }
         F function;
     };

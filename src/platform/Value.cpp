@@ -13,7 +13,7 @@ namespace mx {
 
 // ---- Array
 
-Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) { }
+Array::Array(std::initializer_list<Value> values) : Array(std::vector<Value>(values)) {}
 
 Array::Array(std::vector<Value> values)
 {

@@ -79,26 +79,31 @@ private:
 
 class Value {
 public:
+// GCC takes scoped enumerators for declarations that shadow the types of the same
+// name, although they can only be named as Kind::Date and Kind::Data.
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wshadow"
     enum class Kind { Nil, Bool, Int, UInt, Double, String, Date, Data, Array, Dictionary };
+#pragma GCC diagnostic pop
 
     Value() = default;
-    Value(std::nullptr_t) { }
-    Value(bool value) : value_(value) { }
-    Value(int value) : value_(std::int64_t{value}) { }
-    Value(long value) : value_(std::int64_t{value}) { }
-    Value(long long value) : value_(std::int64_t{value}) { }
-    Value(unsigned value) : value_(std::uint64_t{value}) { }
-    Value(unsigned long value) : value_(std::uint64_t{value}) { }
-    Value(unsigned long long value) : value_(std::uint64_t{value}) { }
-    Value(float value) : value_(double{value}) { }
-    Value(double value) : value_(value) { }
-    Value(const char* value) : value_(std::string(value)) { }
-    Value(std::string_view value) : value_(std::string(value)) { }
-    Value(std::string value) : value_(std::move(value)) { }
-    Value(Date value) : value_(value) { }
-    Value(Data value) : value_(std::move(value)) { }
-    Value(Array value) : value_(std::move(value)) { }
-    Value(Dictionary value) : value_(std::move(value)) { }
+    Value(std::nullptr_t) {}
+    Value(bool value) : value_(value) {}
+    Value(int value) : value_(std::int64_t{value}) {}
+    Value(long value) : value_(std::int64_t{value}) {}
+    Value(long long value) : value_(std::int64_t{value}) {}
+    Value(unsigned value) : value_(std::uint64_t{value}) {}
+    Value(unsigned long value) : value_(std::uint64_t{value}) {}
+    Value(unsigned long long value) : value_(std::uint64_t{value}) {}
+    Value(float value) : value_(double{value}) {}
+    Value(double value) : value_(value) {}
+    Value(const char* value) : value_(std::string(value)) {}
+    Value(std::string_view value) : value_(std::string(value)) {}
+    Value(std::string value) : value_(std::move(value)) {}
+    Value(Date value) : value_(value) {}
+    Value(Data value) : value_(std::move(value)) {}
+    Value(Array value) : value_(std::move(value)) {}
+    Value(Dictionary value) : value_(std::move(value)) {}
 
     Kind kind() const { return static_cast<Kind>(value_.index()); }
     bool isNil() const { return kind() == Kind::Nil; }

@@ -21,7 +21,7 @@ std::string caseName(const ::testing::TestParamInfo<NameCase>& info)
     return fmt::format("Code{:X}", info.param.code);
 }
 
-class ServiceTypeNameTest : public ::testing::TestWithParam<NameCase> { };
+class ServiceTypeNameTest : public ::testing::TestWithParam<NameCase> {};
 TEST_P(ServiceTypeNameTest, Names)
 {
     EXPECT_EQ(MxReportingServiceTypeName(static_cast<ServiceType>(GetParam().code)), GetParam().name);
@@ -33,7 +33,7 @@ INSTANTIATE_TEST_SUITE_P(Codes, ServiceTypeNameTest,
                                            NameCase{65534, "telephony"}, NameCase{65535, "unknown"}),
                          caseName);
 
-class CategoryNameTest : public ::testing::TestWithParam<NameCase> { };
+class CategoryNameTest : public ::testing::TestWithParam<NameCase> {};
 TEST_P(CategoryNameTest, Names) { EXPECT_EQ(MxReportingCategoryName(GetParam().code), GetParam().name); }
 INSTANTIATE_TEST_SUITE_P(Codes, CategoryNameTest,
                          ::testing::Values(NameCase{0x00000003, "Playback"}, NameCase{0x10000008, "DSP_Error"},
@@ -45,7 +45,7 @@ INSTANTIATE_TEST_SUITE_P(Codes, CategoryNameTest,
                                            NameCase{0x2000000A, "HAL_Performance"}),
                          caseName);
 
-class MessageTypeNameTest : public ::testing::TestWithParam<NameCase> { };
+class MessageTypeNameTest : public ::testing::TestWithParam<NameCase> {};
 TEST_P(MessageTypeNameTest, Names)
 {
     EXPECT_EQ(MxReportingMessageTypeName(static_cast<MessageType>(GetParam().code)), GetParam().name);

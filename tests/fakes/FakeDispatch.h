@@ -51,7 +51,7 @@ public:
     std::shared_ptr<WorkQueue> makeSerialQueue(std::string label, QueuePriority priority) override;
     WorkQueue& globalQueue(QueuePriority priority) override;
     void beginBlocking() override { ++blockingCalls_; }
-    void endBlocking() override { }
+    void endBlocking() override {}
 
     // Runs ready work of every queue, round robin, until none is left.
     void runUntilIdle();

@@ -68,7 +68,7 @@ public:
 
 class FakeServiceConnection final : public ServiceConnection {
 public:
-    explicit FakeServiceConnection(pid_t pid) : pid_(pid) { }
+    explicit FakeServiceConnection(pid_t pid) : pid_(pid) {}
     pid_t processIdentifier() const override { return pid_; }
     std::string description() const override { return "<fake connection " + std::to_string(pid_) + ">"; }
     void setExportedObject(std::shared_ptr<ServiceExportedObject> object) override { exported = std::move(object); }

@@ -51,7 +51,7 @@ public:
 
 class RecordingTracePoints final : public TracePoints {
 public:
-    explicit RecordingTracePoints(EffectJournal& journal) : journal_(journal) { }
+    explicit RecordingTracePoints(EffectJournal& journal) : journal_(journal) {}
     void emit(std::uint32_t code, std::uint64_t, std::uint64_t, std::uint64_t, std::uint64_t) override
     {
         journal_.record(fmt::format("trace {:#x}", code));
@@ -72,7 +72,7 @@ struct TallyEvent {
 
 class FakeTally final : public Tally {
 public:
-    explicit FakeTally(EffectJournal& journal) : journal_(journal) { }
+    explicit FakeTally(EffectJournal& journal) : journal_(journal) {}
     void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override
     {
         journal_.record(fmt::format("tally {}", name));
@@ -93,7 +93,7 @@ struct JouleEvent {
 
 class FakeJoule final : public Joule {
 public:
-    explicit FakeJoule(EffectJournal& journal) : journal_(journal) { }
+    explicit FakeJoule(EffectJournal& journal) : journal_(journal) {}
     void logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event, const Dictionary*) override
     {
         journal_.record(fmt::format("joule {}", name));

@@ -2,8 +2,8 @@
 
 namespace mx::testing {
 
-FakeUplinkSession::FakeUplinkSession(FakeUplink& uplink, int number, Dictionary sessionInfo, Dictionary userInfo)
-    : sessionInfo(std::move(sessionInfo)), userInfo(std::move(userInfo)), uplink_(uplink), number_(number)
+FakeUplinkSession::FakeUplinkSession(FakeUplink& uplink, int number, Dictionary givenSessionInfo, Dictionary givenUserInfo)
+    : sessionInfo(std::move(givenSessionInfo)), userInfo(std::move(givenUserInfo)), uplink_(uplink), number_(number)
 {
 }
 

@@ -16,7 +16,7 @@ namespace {
 // Reads the arguments of one request, remembering the first that does not fit.
 class Arguments {
 public:
-    Arguments(const std::string& method, const Array& params) : method_(method), params_(params) { }
+    Arguments(const std::string& method, const Array& params) : method_(method), params_(params) {}
 
     std::int64_t integer(std::size_t index, std::int64_t minimum, std::int64_t maximum, const char* what)
     {

@@ -53,14 +53,14 @@ bool MxReportingServiceDelegate::shouldAcceptNewConnection(ServiceListener&,
     // Requests of the new client queue up behind its registration.
     std::weak_ptr<MxReportingServerInstance> weakClient = client;
     serverQueue_->dispatch([self = shared_from_this(), weakClient, pid, accepted] {
-        if (auto client = weakClient.lock())
-            self->registerClient(client, pid, accepted);
+        if (auto live = weakClient.lock())
+            self->registerClient(live, pid, accepted);
     });
 
     connection->setInterruptionHandler([weakClient] {
         MXLOG(MxReportingServerInstance::logScope(), Default, "InterruptionHandler: connection exited");
-        if (auto client = weakClient.lock())
-            client->handleConnectionError();
+        if (auto live = weakClient.lock())
+            live->handleConnectionError();
     });
     connection->setInvalidationHandler([weakSelf = weak_from_this(), weakClient, pid] {
         if (auto self = weakSelf.lock())

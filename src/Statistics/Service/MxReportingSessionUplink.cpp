@@ -33,7 +33,7 @@ std::int64_t randomAlarmDelaySeconds()
 // The backend-list callback and the configuration job meet here: the flag says that
 // backends were found, and is read and written only under the condition's lock.
 struct MxReportingDiscovery {
-    explicit MxReportingDiscovery(bool seed) : found(seed) { }
+    explicit MxReportingDiscovery(bool seed) : found(seed) {}
     MxReportingCondition condition;
     bool found;
 };

@@ -5,7 +5,7 @@
 
 namespace mx {
 
-AsioGlobalQueue::AsioGlobalQueue(std::string label, AsioWorkerPool& pool) : label_(std::move(label)), pool_(pool) { }
+AsioGlobalQueue::AsioGlobalQueue(std::string label, AsioWorkerPool& pool) : label_(std::move(label)), pool_(pool) {}
 
 void AsioGlobalQueue::dispatch(UniqueFunction<void()> work) { asio::post(pool_.executor(), std::move(work)); }
 

@@ -10,7 +10,7 @@
 
 namespace mx {
 
-DatagramNotifications::DatagramNotifications(std::filesystem::path endpoint) : endpoint_(std::move(endpoint)) { }
+DatagramNotifications::DatagramNotifications(std::filesystem::path endpoint) : endpoint_(std::move(endpoint)) {}
 
 bool DatagramNotifications::listen(asio::io_context& io, std::string& error)
 {

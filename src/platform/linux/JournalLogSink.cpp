@@ -43,7 +43,7 @@ bool JournalLogSink::runningUnderJournal()
     const char* stream = std::getenv("JOURNAL_STREAM");
     if (!stream)
         return false;
-    struct stat status { };
+    struct stat status {};
     if (fstat(STDERR_FILENO, &status) != 0)
         return false;
     std::string expected = std::to_string(status.st_dev) + ":" + std::to_string(status.st_ino);

@@ -26,7 +26,7 @@ nlohmann::json readProperty(const std::filesystem::path& file, std::string_view 
 
 } // namespace
 
-JsonDeviceProperties::JsonDeviceProperties(std::filesystem::path file) : file_(std::move(file)) { }
+JsonDeviceProperties::JsonDeviceProperties(std::filesystem::path file) : file_(std::move(file)) {}
 
 bool JsonDeviceProperties::boolProperty(std::string_view key)
 {

@@ -7,7 +7,7 @@
 
 namespace mx {
 
-JsonPreferences::JsonPreferences(std::filesystem::path directory) : directory_(std::move(directory)) { }
+JsonPreferences::JsonPreferences(std::filesystem::path directory) : directory_(std::move(directory)) {}
 
 std::filesystem::path JsonPreferences::domainPath(const std::string& domain) const
 {

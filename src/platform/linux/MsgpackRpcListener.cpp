@@ -10,7 +10,7 @@
 
 namespace mx {
 
-MsgpackRpcListener::MsgpackRpcListener() : keepRunning_(io_.get_executor()), acceptor_(io_), retry_(io_) { }
+MsgpackRpcListener::MsgpackRpcListener() : keepRunning_(io_.get_executor()), acceptor_(io_), retry_(io_) {}
 
 MsgpackRpcListener::~MsgpackRpcListener()
 {

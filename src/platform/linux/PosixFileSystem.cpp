@@ -24,7 +24,7 @@ std::optional<std::string> PosixFileSystem::createDirectories(const std::filesys
         }
         if (errno != EEXIST)
             return std::string(std::strerror(errno));
-        struct stat status { };
+        struct stat status {};
         if (stat(partial.c_str(), &status) != 0 || !S_ISDIR(status.st_mode))
             return partial.string() + " exists and is not a directory";
     }

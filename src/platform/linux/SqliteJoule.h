@@ -18,7 +18,7 @@ public:
     SqliteStore& store() { return *store_; }
 
 private:
-    explicit SqliteJoule(std::unique_ptr<SqliteStore> store) : store_(std::move(store)) { }
+    explicit SqliteJoule(std::unique_ptr<SqliteStore> store) : store_(std::move(store)) {}
 
     std::unique_ptr<SqliteStore> store_;
 };

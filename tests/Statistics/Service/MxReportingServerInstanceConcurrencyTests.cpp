@@ -20,7 +20,7 @@ constexpr auto kBound = std::chrono::seconds(60);
 
 class Countdown {
 public:
-    explicit Countdown(int count) : count_(count) { }
+    explicit Countdown(int count) : count_(count) {}
     void arrive()
     {
         std::lock_guard lock(mutex_);

@@ -14,8 +14,8 @@ using ::testing::IsEmpty;
 
 class NoListener final : public ServiceListener {
 public:
-    void setDelegate(std::shared_ptr<ServiceListenerDelegate>) override { }
-    void resume() override { }
+    void setDelegate(std::shared_ptr<ServiceListenerDelegate>) override {}
+    void resume() override {}
 };
 
 class MxReportingServiceDelegateTest : public ::testing::Test {
