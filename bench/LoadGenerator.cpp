@@ -52,7 +52,7 @@ Dictionary realisticPayload(std::mt19937& random, int seq)
         {"route", routes[random() % 4]},
         {"buffer_frames", 512},
         {"underruns", static_cast<int>(random() % 3)},
-        {"peak level", -12.5 + (random() % 100) / 10.0},
+        {"peak level", -12.5 + static_cast<double>(random() % 100) / 10.0},
         {"codec", "aac"},
         {"seq", seq},
     };
@@ -84,7 +84,7 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
         auto client = MxReportingClient::connect(socket, error);
         if (!client) {
             std::fprintf(stderr, "cannot connect: %s\n", error.c_str());
-            std::exit(1);
+            std::_Exit(1); // the clients already connected run I/O threads
         }
         if (withSessions) {
             client->createReportingSession(c + 1);
@@ -108,6 +108,7 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
         int seq = 0;
     };
     std::vector<std::unique_ptr<Lane>> lanes;
+    lanes.reserve(std::size_t(options.connections));
     for (int c = 0; c < options.connections; ++c)
         lanes.push_back(std::make_unique<Lane>(Lane{clients[c].get(), c + 1, std::mt19937(c)}));
 
@@ -143,7 +144,7 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
     std::this_thread::sleep_for(std::chrono::milliseconds(500));
 
     Figures figures;
-    figures.reportsPerSecond = done / elapsed;
+    figures.reportsPerSecond = static_cast<double>(done) / elapsed;
     figures.errors = errors;
     std::lock_guard lock(latencyMutex);
     std::sort(latencies.begin(), latencies.end());
@@ -202,8 +203,9 @@ int main(int argc, char** argv)
         bench::runEchoServer(echoSocket);
     pid_t daemon = fork();
     if (daemon == 0) {
-        setenv("MXREPORTING_ROOT", root.c_str(), 1);
-        unsetenv("JOURNAL_STREAM");
+        // The child of a process that has started no thread yet.
+        setenv("MXREPORTING_ROOT", root.c_str(), 1); // NOLINT(concurrency-mt-unsafe)
+        unsetenv("JOURNAL_STREAM");                  // NOLINT(concurrency-mt-unsafe)
         freopen((root / "daemon.log").c_str(), "w", stderr);
         execl(MXREPORTINGD_PATH, MXREPORTINGD_PATH, nullptr);
         _exit(127);

@@ -73,9 +73,7 @@ double storeInsert(const std::filesystem::path& directory, int events)
     return events / std::chrono::duration<double>(Clock::now() - began).count();
 }
 
-} // namespace
-
-int main(int argc, char** argv)
+int run(int argc, char** argv)
 {
     int events = 500000;
     if (argc == 3 && std::string(argv[1]) == "--events")
@@ -89,4 +87,16 @@ int main(int argc, char** argv)
     std::printf("tally store (writer thread) %10.0f rows/s   ratio %.2f\n", store, store / bare);
     std::filesystem::remove_all(directory);
     return 0;
+}
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    try {
+        return run(argc, argv);
+    } catch (const std::exception& error) {
+        std::fprintf(stderr, "mxreporting_store_rate: %s\n", error.what());
+        return 1;
+    }
 }

@@ -210,7 +210,8 @@ private:
     MxClientResult<bool> waitForStart(ReporterID reporterID)
     {
         std::promise<MxClientResult<bool>> reply;
-        client_.startReportingSessionForID(reporterID, [&](MxClientResult<bool> result) { reply.set_value(result); });
+        client_.startReportingSessionForID(reporterID,
+                                           [&](const MxClientResult<bool>& result) { reply.set_value(result); });
         return reply.get_future().get();
     }
 
@@ -307,7 +308,8 @@ int notify(const std::vector<std::string>& words)
     DatagramNotifications notifications(MxReportingPath("run/harmonia/notify.sock"));
     std::uint32_t status = notifications.post(name);
     if (status != 0) {
-        std::fprintf(stderr, "notify: cannot post %s: %s\n", name.c_str(), std::strerror(static_cast<int>(status)));
+        std::fprintf(stderr, "notify: cannot post %s: %s\n", name.c_str(),
+                     std::generic_category().message(static_cast<int>(status)).c_str());
         return kExitUnreachable;
     }
     std::printf("notify: posted %s\n", name.c_str());
@@ -368,7 +370,8 @@ std::optional<int> viewStore(const std::vector<std::string>& words)
         arguments.push_back(word.data());
     arguments.push_back(nullptr);
     execv(program.c_str(), arguments.data());
-    std::fprintf(stderr, "mxreport: cannot run %s: %s\n", program.c_str(), std::strerror(errno));
+    std::fprintf(stderr, "mxreport: cannot run %s: %s\n", program.c_str(),
+                 std::generic_category().message(errno).c_str());
     return kExitUnreachable;
 }
 
@@ -386,9 +389,7 @@ std::vector<std::vector<std::string>> splitCommands(const std::vector<std::strin
     return commands;
 }
 
-} // namespace
-
-int main(int argc, char** argv)
+int run(int argc, char** argv)
 {
     std::vector<std::string> words(argv + 1, argv + argc);
     std::filesystem::path socket = MxReportingClient::defaultSocketPath();
@@ -437,5 +438,17 @@ int main(int argc, char** argv)
     } catch (const UsageError& usage) {
         std::fprintf(stderr, "mxreport: %s\n", usage.message.c_str());
         return kExitUsage;
+    }
+}
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    try {
+        return run(argc, argv);
+    } catch (const std::exception& error) {
+        std::fprintf(stderr, "mxreport: %s\n", error.what());
+        return 1;
     }
 }

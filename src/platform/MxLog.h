@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
 
 #include <fmt/format.h>
 
@@ -30,8 +31,8 @@ struct MxLogRecord {
     MxLogLevel level = MxLogLevel::Default;
     const char* file = "";
     int line = 0;
-    const char* function = "";
-    std::string message; // prefix included
+    std::string function; // the enclosing function's name, also for lines written in a lambda
+    std::string message;  // prefix included
 };
 
 class MxLogSink {
@@ -51,8 +52,14 @@ const MxLogScope* MxLogRegisterScope(int kind, std::uint32_t fourCharCode, const
 // default log (nullptr) is never verbose.
 bool MxLogEnabled(const MxLogScope* scope, int verboseLevel);
 
-void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, const char* function,
+// `signature` is the writing function's __PRETTY_FUNCTION__: the prefix names the
+// function it declares, or for a lambda the function the lambda is written in.
+void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, std::string_view signature,
                 std::string_view text);
+
+// "start" of "void mx::MxReportingSession::start()", "configure" of the signature of a
+// lambda inside configure.
+std::string_view MxLogFunctionName(std::string_view signature);
 
 constexpr std::uint32_t MxFourCharCode(const char (&code)[5])
 {
@@ -65,7 +72,8 @@ constexpr int kMxLogVerboseLevel = 5;
 } // namespace mx
 
 #define MXLOG(scope, level, ...)                                                                                       \
-    ::mx::MxLogWrite((scope), ::mx::MxLogLevel::level, __FILE_NAME__, __LINE__, __func__, fmt::format(__VA_ARGS__))
+    ::mx::MxLogWrite((scope), ::mx::MxLogLevel::level, __FILE_NAME__, __LINE__, __PRETTY_FUNCTION__,                   \
+                     fmt::format(__VA_ARGS__))
 
 // A debug line written only while the scope's verbose switch is on; the arguments
 // are not even formatted otherwise.

@@ -19,9 +19,11 @@ public:
     UniqueFunction() = default;
     UniqueFunction(std::nullptr_t) {}
 
+    // Constrained so that it never hides the move constructor (clang-tidy does not
+    // read the constraint).
     template <class F>
     requires(!std::is_same_v<std::decay_t<F>, UniqueFunction> && std::is_invocable_r_v<R, F&, Args...>)
-        UniqueFunction(F&& f)
+        UniqueFunction(F&& f) // NOLINT(bugprone-forwarding-reference-overload)
         : callable_(std::make_unique<Holder<std::decay_t<F>>>(std::forward<F>(f)))
     {
     }

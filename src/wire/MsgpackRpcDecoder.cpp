@@ -17,7 +17,7 @@ msgpack::unpack_limit limitsFor(std::size_t maximumMessageBytes)
 }
 
 // An idle connection costs this much; a busy one grows its buffer as it needs.
-constexpr std::size_t kInitialBufferBytes = 8 * 1024;
+constexpr std::size_t kInitialBufferBytes = std::size_t{8} * 1024;
 
 } // namespace
 

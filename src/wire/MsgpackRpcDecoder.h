@@ -23,7 +23,7 @@ public:
     explicit MsgpackRpcDecoder(std::size_t maximumMessageBytes = kMsgpackRpcMaximumMessageBytes);
 
     // Where the next bytes read from the stream go; at least `atLeast` bytes long.
-    std::span<char> buffer(std::size_t atLeast = 16 * 1024);
+    std::span<char> buffer(std::size_t atLeast = std::size_t{16} * 1024);
     void consumed(std::size_t count);
 
     // The next complete message, or NeedMore, or Bad with `reason` set. After Bad

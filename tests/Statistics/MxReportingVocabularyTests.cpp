@@ -70,6 +70,7 @@ TEST(MxReportingVocabularyTest, InternalBuildIsAskedOnceHoweverManyThreadsAsk)
     platform.device.setBool("InternalBuild", true);
     std::vector<std::thread> threads;
     std::atomic<int> internal{0};
+    threads.reserve(8);
     for (int i = 0; i < 8; ++i)
         threads.emplace_back([&] { internal += MxReportingInternalBuild() ? 1 : 0; });
     for (auto& thread : threads)

@@ -2,7 +2,8 @@
 
 namespace mx::testing {
 
-FakeUplinkSession::FakeUplinkSession(FakeUplink& uplink, int number, Dictionary givenSessionInfo, Dictionary givenUserInfo)
+FakeUplinkSession::FakeUplinkSession(FakeUplink& uplink, int number, Dictionary givenSessionInfo,
+                                     Dictionary givenUserInfo)
     : sessionInfo(std::move(givenSessionInfo)), userInfo(std::move(givenUserInfo)), uplink_(uplink), number_(number)
 {
 }

@@ -8,8 +8,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <future>
-
 #include <fmt/format.h>
 
 #include <gmock/gmock.h>
@@ -22,9 +20,6 @@
 
 namespace mx::testing {
 namespace {
-
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
 
 // A connection that speaks bytes, for what no well-behaved client would send.
 class RawConnection {
@@ -84,32 +79,6 @@ protected:
 
     DaemonProcess daemon;
 };
-
-TEST_F(DaemonIntegrationTest, TwoClientsFollowTheCrossClientRules)
-{
-    auto owner = connect();
-    auto other = connect();
-    ASSERT_TRUE(owner->createReportingSession(5).value.value_or(false));
-    ASSERT_TRUE(other->createReportingSession(6).value.value_or(false));
-
-    std::promise<bool> started;
-    other->startReportingSessionForID(
-        5, [&](MxClientResult<bool> result) { started.set_value(result.value.value_or(false)); });
-    EXPECT_EQ(other->reporterID(5).value, (Dictionary{{"reporterID", 5}, {"serviceType", 65535}}));
-    EXPECT_TRUE(*other->stopReportingSessionForID(5).value) << "stop of another client's session replies true";
-    auto startReply = started.get_future();
-    EXPECT_EQ(startReply.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout)
-        << "and does nothing: the start reply stays held";
-    EXPECT_THAT(*owner->getAllReporters().value, ElementsAre(5, 6)) << "clients in connection order";
-
-    EXPECT_TRUE(*owner->stopReportingSessionForID(5).value);
-    ASSERT_EQ(startReply.wait_for(DaemonProcess::kBound), std::future_status::ready);
-    EXPECT_TRUE(startReply.get());
-
-    auto raw = owner->call("getServiceNameForReporterID:reply:", Array{0});
-    EXPECT_EQ(raw.value, Value(65535)) << "the first of the two replies";
-    EXPECT_EQ(*owner->getServiceNameForReporterID(6).value, 65535);
-}
 
 TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
 {
@@ -203,14 +172,6 @@ TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)
     EXPECT_TRUE(*bystander->createReportingSession(12).value);
 }
 
-TEST_F(DaemonIntegrationTest, KillServiceEndsTheDaemonWithStatusTwo)
-{
-    auto client = connect();
-    client->killService();
-    EXPECT_EQ(daemon.waitForExit(), 2);
-    EXPECT_THAT(daemon.log(), HasSubstr("DESTROYING SERVICE"));
-}
-
 TEST_F(DaemonIntegrationTest, ReportingSwitchFollowsThePreferencesWhenTheNotificationIsPosted)
 {
     auto client = connect();
@@ -227,11 +188,6 @@ TEST_F(DaemonIntegrationTest, ReportingSwitchFollowsThePreferencesWhenTheNotific
     waitpid(poster, nullptr, 0);
     EXPECT_TRUE(waitUntil(refused));
     EXPECT_TRUE(daemon.waitForLog("defaults {\"device_name\":\"den\",\"disable_reporting\":1}"));
-
-    daemon.writeFile("var/lib/harmonia/preferences/com.kestrel.harmonia.json", "{}");
-    daemon.signal(SIGHUP);
-    EXPECT_TRUE(waitUntil([&] { return !refused(); })) << "SIGHUP posts the notification too";
-    EXPECT_TRUE(daemon.waitForLog("defaults {\"disable_reporting\":0}"));
 }
 
 TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
@@ -278,12 +234,6 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     EXPECT_EQ(nlohmann::json::parse(alone[0][1])["ServiceName"], "standalone");
 }
 
-} // namespace
-} // namespace mx::testing
-
-namespace mx::testing {
-namespace {
-
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();
@@ -316,12 +266,6 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
     EXPECT_TRUE(waitUntil([&] { return daemon.query("uplink", "SELECT count(*) FROM sessions")[0][0] == "2"; }))
         << "backend sessions go on numbering after the crash";
 }
-
-} // namespace
-} // namespace mx::testing
-
-namespace mx::testing {
-namespace {
 
 class DaemonWithoutBackendTest : public ::testing::Test {
 protected:

@@ -15,6 +15,44 @@
 
 namespace mx::testing {
 
+namespace {
+
+// Everything the child needs is made before fork: the test's other threads may hold
+// the allocator's locks, so the child calls nothing but what is async-signal-safe.
+pid_t forkExec(const std::filesystem::path& root, const std::vector<std::string>& arguments, const std::string& log,
+               int logFlags)
+{
+    std::vector<std::string> environment;
+    for (char** entry = environ; *entry != nullptr; ++entry) {
+        std::string_view text(*entry);
+        if (!text.starts_with("MXREPORTING_ROOT=") && !text.starts_with("JOURNAL_STREAM=") &&
+            !text.starts_with("LISTEN_FDS="))
+            environment.emplace_back(text);
+    }
+    environment.push_back("MXREPORTING_ROOT=" + root.string());
+    auto pointers = [](const std::vector<std::string>& strings) {
+        std::vector<char*> result;
+        result.reserve(strings.size() + 1);
+        for (const auto& text : strings)
+            result.push_back(const_cast<char*>(text.c_str()));
+        result.push_back(nullptr);
+        return result;
+    };
+    std::vector<char*> argv = pointers(arguments);
+    std::vector<char*> envp = pointers(environment);
+    pid_t child = fork();
+    if (child == 0) {
+        int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | logFlags, 0644);
+        dup2(fd, STDOUT_FILENO);
+        dup2(fd, STDERR_FILENO);
+        execve(argv[0], argv.data(), envp.data());
+        _exit(127);
+    }
+    return child;
+}
+
+} // namespace
+
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds bound)
 {
     auto deadline = std::chrono::steady_clock::now() + bound;
@@ -50,21 +88,7 @@ void DaemonProcess::writeFile(const std::string& relative, const std::string& co
 
 pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments) const
 {
-    std::string log = (root_ / "spawned.log").string();
-    pid_t child = fork();
-    if (child == 0) {
-        setenv("MXREPORTING_ROOT", root_.c_str(), 1);
-        int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
-        dup2(fd, STDOUT_FILENO);
-        dup2(fd, STDERR_FILENO);
-        std::vector<char*> argv;
-        for (const auto& argument : arguments)
-            argv.push_back(const_cast<char*>(argument.c_str()));
-        argv.push_back(nullptr);
-        execv(argv[0], argv.data());
-        _exit(127);
-    }
-    return child;
+    return forkExec(root_, arguments, (root_ / "spawned.log").string(), O_APPEND);
 }
 
 void DaemonProcess::start()
@@ -72,17 +96,7 @@ void DaemonProcess::start()
     std::string log = (root_ / "daemon.log").string();
     // Emptied here, not in the child: a restart must not find the last run's banner.
     std::ofstream(log, std::ios::trunc).close();
-    pid_ = fork();
-    if (pid_ == 0) {
-        setenv("MXREPORTING_ROOT", root_.c_str(), 1);
-        unsetenv("JOURNAL_STREAM");
-        unsetenv("LISTEN_FDS");
-        int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-        dup2(fd, STDERR_FILENO);
-        dup2(fd, STDOUT_FILENO);
-        execl(MXREPORTINGD_PATH, MXREPORTINGD_PATH, nullptr);
-        _exit(127);
-    }
+    pid_ = forkExec(root_, {MXREPORTINGD_PATH}, log, O_TRUNC);
     waitForLog("listening on");
 }
 

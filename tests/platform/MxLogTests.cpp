@@ -18,12 +18,21 @@ TEST(MxLogTest, EveryLineCarriesFileLineAndFunctionPrefix)
     ASSERT_EQ(lines.size(), 1u);
     EXPECT_EQ(lines[0].message, fmt::format("MxLogTests.cpp:{}:TestBody: value 7", __LINE__ - 3));
     EXPECT_EQ(lines[0].level, MxLogLevel::Error);
+
+    [] {
+        MXLOG(nullptr, Default, "from a lambda");
+    }();
+    EXPECT_EQ(sink.lines().back().function, "TestBody") << "a lambda's line names the function it is written in";
+    EXPECT_EQ(MxLogFunctionName("std::optional<int> mx::A<T>::get(int (*)(int)) const [with T = int]"), "get");
+    EXPECT_EQ(MxLogFunctionName("auto mx::B::run()::(anonymous class)::operator()() const"), "run");
+    EXPECT_EQ(MxLogFunctionName("mx::C::C(std::function<void(int)>)::<lambda(int)>::<lambda()>"), "C");
 }
 
 TEST(MxLogTest, VerboseLinesNeedTheScopesSwitchAtLevelFive)
 {
-    ::setenv("mxlog_test_loud", "5", 1);
-    ::setenv("mxlog_test_quiet", "4", 1);
+    // Before any scope reads the environment, and no other thread of this test runs.
+    ::setenv("mxlog_test_loud", "5", 1);  // NOLINT(concurrency-mt-unsafe)
+    ::setenv("mxlog_test_quiet", "4", 1); // NOLINT(concurrency-mt-unsafe)
     const MxLogScope* loud =
         MxLogRegisterScope(1, MxFourCharCode("loud"), "loud", "com.kestrel.harmonia", "mxlog_test_loud", 31);
     const MxLogScope* quiet =

@@ -166,7 +166,7 @@ const std::map<std::string, Operation, std::less<>>& operations()
           [](auto& service, auto& args, const Responder& responder) {
               auto id = args.reporterID(0);
               if (!args.error())
-                  service.reporterID(id, [responder](Dictionary validity) { responder->respond(validity); });
+                  service.reporterID(id, [responder](const Dictionary& validity) { responder->respond(validity); });
           }}},
         {std::string(method::kGetAllReporters),
          {0,

@@ -58,12 +58,11 @@ void raiseDescriptorLimit()
 [[noreturn]] void fail(const std::string& message)
 {
     MXLOG(nullptr, Error, "mxreportingd cannot start: {}", message);
-    std::exit(1);
+    // Worker threads already run: no static destructor may pull the world from under them.
+    std::_Exit(1);
 }
 
-} // namespace
-
-int main(int argc, char** argv)
+int run(int argc, char** argv)
 {
     for (int i = 1; i < argc; ++i) {
         if (std::strcmp(argv[i], "--help") == 0 || std::strcmp(argv[i], "-h") == 0) {
@@ -150,4 +149,15 @@ int main(int argc, char** argv)
     // Queues and connections are not torn down: the process simply ends, as it
     // would at any other moment.
     std::_Exit(0);
+}
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    try {
+        return run(argc, argv);
+    } catch (const std::exception& error) {
+        fail(std::string("unexpected failure: ") + error.what());
+    }
 }

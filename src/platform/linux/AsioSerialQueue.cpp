@@ -5,7 +5,7 @@
 
 namespace mx {
 
-AsioSerialQueue::AsioSerialQueue(std::string label, asio::io_context::executor_type executor)
+AsioSerialQueue::AsioSerialQueue(std::string label, const asio::io_context::executor_type& executor)
     : label_(std::move(label)), strand_(asio::make_strand(executor))
 {
 }

@@ -11,7 +11,7 @@ namespace mx {
 
 class AsioSerialQueue final : public WorkQueue {
 public:
-    AsioSerialQueue(std::string label, asio::io_context::executor_type executor);
+    AsioSerialQueue(std::string label, const asio::io_context::executor_type& executor);
 
     const std::string& label() const override { return label_; }
     void dispatch(UniqueFunction<void()> work) override;

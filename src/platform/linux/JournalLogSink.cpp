@@ -35,7 +35,7 @@ void JournalLogSink::write(const MxLogRecord& record)
     const char* scope = record.scope ? record.scope->code.c_str() : "default";
     sd_journal_send("MESSAGE=%s", record.message.c_str(), "PRIORITY=%i", priority(record.level), "MXLOG_SUBSYSTEM=%s",
                     subsystem, "MXLOG_SCOPE=%s", scope, "CODE_FILE=%s", record.file, "CODE_LINE=%i", record.line,
-                    "CODE_FUNC=%s", record.function, nullptr);
+                    "CODE_FUNC=%s", record.function.c_str(), nullptr);
 }
 
 bool JournalLogSink::runningUnderJournal()

@@ -10,6 +10,17 @@
 
 namespace mx {
 
+namespace {
+
+// strerror shares one buffer between threads; the GNU strerror_r does not.
+std::string errnoText(int error)
+{
+    char buffer[256];
+    return strerror_r(error, buffer, sizeof(buffer));
+}
+
+} // namespace
+
 std::filesystem::path PosixFileSystem::resolve(const std::string& path) { return MxReportingPath(path); }
 
 std::optional<std::string> PosixFileSystem::createDirectories(const std::filesystem::path& directory, mode_t mode)
@@ -23,7 +34,7 @@ std::optional<std::string> PosixFileSystem::createDirectories(const std::filesys
             continue;
         }
         if (errno != EEXIST)
-            return std::string(std::strerror(errno));
+            return errnoText(errno);
         struct stat status {};
         if (stat(partial.c_str(), &status) != 0 || !S_ISDIR(status.st_mode))
             return partial.string() + " exists and is not a directory";
@@ -37,7 +48,7 @@ std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesyste
     std::string temporary = (file.parent_path() / ("." + file.filename().string() + ".XXXXXX")).string();
     int fd = mkstemp(temporary.data());
     if (fd < 0)
-        return std::string(std::strerror(errno));
+        return errnoText(errno);
     const char* data = contents.data();
     std::size_t left = contents.size();
     while (left > 0) {
@@ -45,7 +56,7 @@ std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesyste
         if (written < 0 && errno == EINTR)
             continue;
         if (written < 0) {
-            std::string reason = std::strerror(errno);
+            std::string reason = errnoText(errno);
             ::close(fd);
             unlink(temporary.c_str());
             return reason;
@@ -57,7 +68,7 @@ std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesyste
     bool synced = fsync(fd) == 0;
     ::close(fd);
     if (!synced || rename(temporary.c_str(), file.c_str()) != 0) {
-        std::string reason = std::strerror(errno);
+        std::string reason = errnoText(errno);
         unlink(temporary.c_str());
         return reason;
     }

@@ -96,6 +96,7 @@ TEST_F(MxReportingServerInstanceConcurrencyTest, EveryMessageIsRepliedOnceAndDel
     Countdown replies(kClients * kMessagesPerClient);
     std::atomic<int> errors{0};
     std::vector<std::thread> senders;
+    senders.reserve(kClients);
     for (int c = 0; c < kClients; ++c)
         senders.emplace_back([&, c] {
             // Each client reports to its own sessions and to one of its neighbour's.
@@ -103,7 +104,7 @@ TEST_F(MxReportingServerInstanceConcurrencyTest, EveryMessageIsRepliedOnceAndDel
             for (int seq = 0; seq < kMessagesPerClient; ++seq) {
                 Array ids{ownIDs(c)[0], ownIDs(c)[1], neighbour};
                 clients[c]->sendMessage(Dictionary{{"sender", c}, {"seq", seq}, {"peak level", seq % 7}}, 0x08000003, 1,
-                                        ids, [&](std::optional<MxReportingError> error) {
+                                        ids, [&](const std::optional<MxReportingError>& error) {
                                             errors += error ? 1 : 0;
                                             replies.arrive();
                                         });
@@ -143,7 +144,7 @@ TEST_F(MxReportingServerInstanceConcurrencyTest, EveryMessageIsRepliedOnceAndDel
             EXPECT_TRUE(message.payload.contains("peak_level"));
         }
     }
-    std::size_t expected = kClients * kMessagesPerClient * 3;
+    std::size_t expected = std::size_t{kClients} * kMessagesPerClient * 3;
     ASSERT_LE(delivered, expected);
     platform.uplink.waitForOneShots(expected - delivered, kBound);
     std::size_t alone = 0;

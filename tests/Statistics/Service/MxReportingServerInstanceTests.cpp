@@ -159,17 +159,20 @@ TEST_F(MxReportingServerInstanceTest, NothingIsReportedWhenNoDriverGrew)
     EXPECT_THAT(started.values, ElementsAre(true));
 }
 
-TEST_F(MxReportingServerInstanceTest, StopAndDestroyActOnOwnSessionsOnlyWhileStartFindsAnyClients)
+TEST_F(MxReportingServerInstanceTest, HeldStartRepliesAreAnsweredOnceByTheOwnersStopOrTheNextStart)
 {
     auto owner = connect(1);
     auto other = connect(2);
     create(*owner, 5);
 
-    Replies<bool> started;
+    Replies<bool> started, repeated;
     other->startReportingSessionForID(5, started.callback());
+    other->startReportingSessionForID(5, repeated.callback());
     run();
     auto reporting = session(*owner, 5);
     EXPECT_TRUE(reporting->started()) << "start looks across clients";
+    EXPECT_THAT(repeated.values, ElementsAre(true)) << "a started session's start replies at once";
+    EXPECT_EQ(platform.uplink.sessions().size(), 1u);
 
     Replies<bool> otherStop, otherDestroy;
     other->stopReportingSessionForID(5, otherStop.callback());
@@ -177,46 +180,23 @@ TEST_F(MxReportingServerInstanceTest, StopAndDestroyActOnOwnSessionsOnlyWhileSta
     run();
     EXPECT_THAT(otherStop.values, ElementsAre(true));
     EXPECT_THAT(otherDestroy.values, ElementsAre(true));
-    EXPECT_TRUE(reporting->started());
+    EXPECT_TRUE(reporting->started()) << "stop and destroy act on the caller's own sessions only";
     EXPECT_THAT(started.values, IsEmpty());
-    EXPECT_EQ(session(*owner, 5), reporting);
+
+    // A stop that is not a stop request (as at a disconnection) leaves the held reply
+    // in the session; the next start answers it before parking its own.
+    reporting->stop();
+    Replies<bool> fresh;
+    other->startReportingSessionForID(5, fresh.callback());
+    run();
+    EXPECT_THAT(started.values, ElementsAre(true));
+    EXPECT_THAT(fresh.values, IsEmpty());
 
     Replies<bool> ownerStop;
     stop(*owner, 5, ownerStop);
-    EXPECT_THAT(started.values, ElementsAre(true)) << "the other client's held start reply is answered";
-    EXPECT_FALSE(reporting->started());
-}
-
-TEST_F(MxReportingServerInstanceTest, RepeatedStartOfAStartedSessionRepliesAtOnce)
-{
-    auto client = connect(1);
-    create(*client, 5);
-    Replies<bool> first, second;
-    client->startReportingSessionForID(5, first.callback());
-    client->startReportingSessionForID(5, second.callback());
-    run();
-    EXPECT_THAT(first.values, IsEmpty());
-    EXPECT_THAT(second.values, ElementsAre(true));
-    EXPECT_EQ(platform.uplink.sessions().size(), 1u);
-}
-
-TEST_F(MxReportingServerInstanceTest, RestartAfterAStopByDestructionAnswersTheStaleReplyFirst)
-{
-    auto owner = connect(1);
-    auto other = connect(2);
-    create(*owner, 5);
-    Replies<bool> stale, fresh;
-    other->startReportingSessionForID(5, stale.callback());
-    run();
-    // A stop that is not a stop request (as at a disconnection) leaves the held
-    // reply in the session.
-    auto reporting = session(*owner, 5);
-    reporting->stop();
-    other->startReportingSessionForID(5, [&](bool value) { fresh.values.push_back(value); });
-    run();
-    EXPECT_THAT(stale.values, ElementsAre(true));
-    EXPECT_THAT(fresh.values, IsEmpty());
-    ASSERT_TRUE(reporting->hasTransactionCompleteBlock());
+    EXPECT_THAT(fresh.values, ElementsAre(true)) << "the other client's held start reply is answered";
+    EXPECT_THAT(started.values, ElementsAre(true)) << "and only once";
+    EXPECT_FALSE(reporting->hasTransactionCompleteBlock());
 }
 
 TEST_F(MxReportingServerInstanceTest, ReporterZeroIsCreatedButNeverStartedFoundOrStopped)
@@ -409,19 +389,7 @@ TEST_F(MxReportingServerInstanceTest, DisconnectionStopsSessionsOnceAndNeverAnsw
     EXPECT_FALSE(session(*client, 5)->started());
 }
 
-TEST_F(MxReportingServerInstanceTest, RequestsOfAVanishedEndpointAreDropped)
-{
-    auto client = connect(42);
-    Replies<bool> replies;
-    client->createReportingSession(5, replies.callback());
-    root->clients.clear();
-    client.reset();
-    run();
-    EXPECT_THAT(replies.values, IsEmpty());
-    EXPECT_TRUE(platform.log.contains("dealloc 42 from the server client list"));
-}
-
-TEST_F(MxReportingServerInstanceTest, EntryLinesAreVerboseOnlyAndWorkWaitsForTheServerQueue)
+TEST_F(MxReportingServerInstanceTest, EntryOnlyLogsAndQueuesAndAVanishedEndpointsRequestsAreDropped)
 {
     auto client = connect(1);
     Replies<bool> replies;
@@ -431,6 +399,13 @@ TEST_F(MxReportingServerInstanceTest, EntryLinesAreVerboseOnlyAndWorkWaitsForThe
     EXPECT_TRUE(platform.trace.codes().empty());
     run();
     EXPECT_THAT(replies.values, ElementsAre(true));
+
+    client->createReportingSession(6, replies.callback());
+    root->clients.clear();
+    client.reset();
+    run();
+    EXPECT_THAT(replies.values, ElementsAre(true)) << "no reply for a vanished endpoint";
+    EXPECT_TRUE(platform.log.contains("dealloc 1 from the server client list"));
 }
 
 } // namespace

@@ -117,7 +117,7 @@ TEST_F(MxReportingSessionTest, BackendGetsSessionDescriptionAndMessagesInOrderTh
     // Merged after start, before the configuration job runs: still reaches the backend.
     session->setConfiguration(Dictionary{{"ServiceName", "custom"}});
     session->sendMessage(Dictionary{{"rate", 48000}, {"route", "Speaker"}}, 0x08000003, 1,
-                         [&](std::optional<UplinkError> error) { replied = !error; });
+                         [&](const std::optional<UplinkError>& error) { replied = !error; });
     EXPECT_TRUE(replied) << "the reply reports acceptance before delivery";
     session->sendMessage(Dictionary{{"rate", 44100}}, 0x08000003, 2, nullptr);
     session->stop();
@@ -197,11 +197,11 @@ TEST_F(MxReportingSessionTest, SingleMessageReportsTheBackendsRefusal)
     platform.uplink.setOneShotResult(false, UplinkError{7, "refused"});
     std::vector<std::optional<UplinkError>> replies;
     MxReportingSession::sendSingleMessage(Dictionary{}, 1, 0, service_type::kStandalone, nullptr,
-                                          [&](std::optional<UplinkError> error) { replies.push_back(error); });
+                                          [&](const std::optional<UplinkError>& error) { replies.push_back(error); });
     run();
     platform.uplink.setOneShotResult(false, std::nullopt);
     MxReportingSession::sendSingleMessage(Dictionary{}, 1, 0, service_type::kStandalone, nullptr,
-                                          [&](std::optional<UplinkError> error) { replies.push_back(error); });
+                                          [&](const std::optional<UplinkError>& error) { replies.push_back(error); });
     run();
     ASSERT_EQ(replies.size(), 2u);
     EXPECT_EQ(replies[0]->description, "refused");
