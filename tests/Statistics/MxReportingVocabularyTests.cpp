@@ -9,51 +9,33 @@
 namespace mx::testing {
 namespace {
 
-struct NameCase {
-    std::uint32_t code;
-    const char* name;
-};
-
-void PrintTo(const NameCase& nameCase, std::ostream* out) { *out << nameCase.code << " -> " << nameCase.name; }
-
-std::string caseName(const ::testing::TestParamInfo<NameCase>& info)
+TEST(MxReportingVocabularyTest, NamesOfServiceTypesCategoriesAndMessageTypes)
 {
-    return fmt::format("Code{:X}", info.param.code);
-}
+    std::vector<std::pair<ServiceType, std::string>> serviceTypes = {
+        {0, "generic"},    {2, "telephony"},   {7, "longformaudio"}, {11, "test"},      {12, "apiusage"},
+        {13, "telephony"}, {100, "telephony"}, {65534, "telephony"}, {65535, "unknown"}};
+    for (const auto& [code, name] : serviceTypes)
+        EXPECT_EQ(MxReportingServiceTypeName(code), name) << code;
 
-class ServiceTypeNameTest : public ::testing::TestWithParam<NameCase> {};
-TEST_P(ServiceTypeNameTest, Names)
-{
-    EXPECT_EQ(MxReportingServiceTypeName(static_cast<ServiceType>(GetParam().code)), GetParam().name);
-}
-INSTANTIATE_TEST_SUITE_P(Codes, ServiceTypeNameTest,
-                         ::testing::Values(NameCase{0, "generic"}, NameCase{2, "telephony"},
-                                           NameCase{7, "longformaudio"}, NameCase{11, "test"}, NameCase{12, "apiusage"},
-                                           NameCase{13, "telephony"}, NameCase{100, "telephony"},
-                                           NameCase{65534, "telephony"}, NameCase{65535, "unknown"}),
-                         caseName);
+    std::vector<std::pair<MessageCategory, std::string>> categories = {{0x00000003, "Playback"},
+                                                                       {0x10000008, "DSP_Error"},
+                                                                       {0x30000002, "_Record"},
+                                                                       {0xFFFFFFFF, "Undefined"},
+                                                                       {0x80000000, "Toolbox_Undefined"},
+                                                                       {0, "Undefined"},
+                                                                       {12, "Undefined"},
+                                                                       {0x0000FFFF, "Undefined"},
+                                                                       {0x40000007, "Routing_RouteChange"},
+                                                                       {0x0800000B, "Session_Volume"},
+                                                                       {0x2000000A, "HAL_Performance"}};
+    for (const auto& [code, name] : categories)
+        EXPECT_EQ(MxReportingCategoryName(code), name) << std::hex << code;
 
-class CategoryNameTest : public ::testing::TestWithParam<NameCase> {};
-TEST_P(CategoryNameTest, Names) { EXPECT_EQ(MxReportingCategoryName(GetParam().code), GetParam().name); }
-INSTANTIATE_TEST_SUITE_P(Codes, CategoryNameTest,
-                         ::testing::Values(NameCase{0x00000003, "Playback"}, NameCase{0x10000008, "DSP_Error"},
-                                           NameCase{0x30000002, "_Record"}, NameCase{0xFFFFFFFF, "Undefined"},
-                                           NameCase{0x80000000, "Toolbox_Undefined"}, NameCase{0, "Undefined"},
-                                           NameCase{12, "Undefined"}, NameCase{0x0000FFFF, "Undefined"},
-                                           NameCase{0x40000007, "Routing_RouteChange"},
-                                           NameCase{0x0800000B, "Session_Volume"},
-                                           NameCase{0x2000000A, "HAL_Performance"}),
-                         caseName);
-
-class MessageTypeNameTest : public ::testing::TestWithParam<NameCase> {};
-TEST_P(MessageTypeNameTest, Names)
-{
-    EXPECT_EQ(MxReportingMessageTypeName(static_cast<MessageType>(GetParam().code)), GetParam().name);
+    std::vector<std::pair<MessageType, std::string>> types = {
+        {0, "Generic"}, {5, "IssueDetector"}, {6, "Undefined"}, {65535, "Unknown"}};
+    for (const auto& [code, name] : types)
+        EXPECT_EQ(MxReportingMessageTypeName(code), name) << code;
 }
-INSTANTIATE_TEST_SUITE_P(Codes, MessageTypeNameTest,
-                         ::testing::Values(NameCase{0, "Generic"}, NameCase{5, "IssueDetector"},
-                                           NameCase{6, "Undefined"}, NameCase{65535, "Unknown"}),
-                         caseName);
 
 TEST(MxReportingVocabularyTest, HostApplicationFallsBackToUnknown)
 {

@@ -6,37 +6,12 @@ what it could not send reaches the receiver once it is back."""
 
 import http.server
 import json
-import os
-import shutil
-import socket
-import subprocess
 import sys
-import tempfile
 import threading
-import time
 
-import msgpack
+from harness import Checks, Daemon, wait_for
 
 DAEMON = sys.argv[1]
-BOUND = 20.0
-checks = {"passed": 0, "failed": 0}
-
-
-def check(name, condition, detail=""):
-    if condition:
-        checks["passed"] += 1
-    else:
-        checks["failed"] += 1
-        print(f"FAILED {name} {detail}")
-
-
-def wait_for(condition, bound=BOUND):
-    deadline = time.time() + bound
-    while time.time() < deadline:
-        if condition():
-            return True
-        time.sleep(0.02)
-    return False
 
 
 class Receiver:
@@ -88,29 +63,6 @@ def attributes(record):
     return {a["key"]: a["value"] for a in record["attributes"]}
 
 
-class Client:
-    def __init__(self, path):
-        self.sock = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
-        self.sock.connect(path)
-        self.sock.settimeout(BOUND)
-        self.unpacker = msgpack.Unpacker(raw=False)
-        self.msgid = 0
-        self.replies = {}
-
-    def send(self, method, *params):
-        self.msgid += 1
-        self.sock.sendall(msgpack.packb([0, self.msgid, method, list(params)]))
-        return self.msgid
-
-    def call(self, method, *params):
-        msgid = self.send(method, *params)
-        while msgid not in self.replies:
-            self.unpacker.feed(self.sock.recv(65536))
-            for message in self.unpacker:
-                self.replies[message[1]] = message[3]
-        return self.replies.pop(msgid)
-
-
 def session(client, reporter, reports):
     client.call("createReportingSession:reply:", reporter)
     client.call("setServiceType:reportingSession:reply:", 7, reporter)
@@ -123,21 +75,13 @@ def session(client, reporter, reports):
 
 def main():
     receiver = Receiver()
-    root = tempfile.mkdtemp(prefix="mxreporting-otlp-")
-    os.makedirs(os.path.join(root, "etc/harmonia"))
-    with open(os.path.join(root, "etc/harmonia/uplink.json"), "w") as config:
-        json.dump({"backends": [{"type": "spool"},
-                                {"type": "otlp-http", "url": f"http://127.0.0.1:{receiver.port}/v1/logs"}]}, config)
-    env = dict(os.environ, MXREPORTING_ROOT=root)
-    env.pop("JOURNAL_STREAM", None)
-    log_path = os.path.join(root, "daemon.log")
-    log = open(log_path, "w")
-    daemon = subprocess.Popen([DAEMON], env=env, stderr=log, stdout=log)
+    backends = {"backends": [{"type": "spool"},
+                             {"type": "otlp-http", "url": f"http://127.0.0.1:{receiver.port}/v1/logs"}]}
+    daemon = Daemon(DAEMON, {"etc/harmonia/uplink.json": json.dumps(backends)})
+    checks = Checks()
+    check = checks.check
     try:
-        path = os.path.join(root, "run/harmonia/reporting.sock")
-        wait_for(lambda: os.path.exists(path))
-        time.sleep(0.1)
-        client = Client(path)
+        client = daemon.connect()
 
         session(client, 1, 3)
         check("batch session exported after its flush",
@@ -160,7 +104,7 @@ def main():
         receiver.stop()
         session(client, 2, 2)
         check("flush reports the error",
-              wait_for(lambda: "flush error" in open(log_path).read()), open(log_path).read()[-2000:])
+              wait_for(lambda: "flush error" in daemon.log()))
         check("daemon goes on", client.call("reporterID:valid:", 2) == {"reporterID": 2, "serviceType": 7})
 
         receiver = Receiver(receiver.port)
@@ -171,18 +115,12 @@ def main():
             receiver.refusals = 1
         client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"patient": True}, 1, 0, None)
         check("a busy collector's Retry-After is honoured",
-              wait_for(lambda: "(retry after 1 s)" in open(log_path).read()), open(log_path).read()[-2000:])
+              wait_for(lambda: "(retry after 1 s)" in daemon.log()))
         check("and the message arrives after it",
               wait_for(lambda: any("patient" in json.dumps(b) for b in receiver.bodies()), 30))
     finally:
-        daemon.kill()
-        daemon.wait()
-        log.close()
-        if checks["failed"]:
-            print(open(log_path).read()[-3000:])
-        shutil.rmtree(root, ignore_errors=True)
-    print(f"{checks['passed']} passed, {checks['failed']} failed")
-    return 1 if checks["failed"] else 0
+        daemon.close(checks.failed)
+    return checks.summary()
 
 
 if __name__ == "__main__":

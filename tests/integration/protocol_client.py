@@ -4,80 +4,20 @@ with python3-msgpack and checks the replies the protocol promises. Written from
 the wire protocol alone, so it catches what a shared client library would hide."""
 
 import datetime
-import os
-import shutil
-import socket
-import subprocess
 import sys
-import tempfile
-import time
 
-import msgpack
+from harness import BOUND, Checks, Daemon, wait_for
 
 DAEMON = sys.argv[1]
-BOUND = 20.0
-
-
-class Client:
-    def __init__(self, path):
-        self.sock = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
-        self.sock.connect(path)
-        self.sock.settimeout(BOUND)
-        self.unpacker = msgpack.Unpacker(raw=False, timestamp=3)
-        self.msgid = 0
-        self.early = {}
-
-    def send(self, method, *params):
-        self.msgid += 1
-        self.sock.sendall(msgpack.packb([0, self.msgid, method, list(params)], datetime=True))
-        return self.msgid
-
-    def reply(self, msgid):
-        while msgid not in self.early:
-            data = self.sock.recv(65536)
-            if not data:
-                raise ConnectionError("daemon closed the connection")
-            self.unpacker.feed(data)
-            for message in self.unpacker:
-                assert message[0] == 1, message
-                self.early[message[1]] = (message[2], message[3])
-        return self.early.pop(msgid)
-
-    def call(self, method, *params):
-        error, result = self.reply(self.send(method, *params))
-        assert error is None, (method, error)
-        return result
-
-
-checks = {"passed": 0, "failed": 0}
-
-
-def check(name, actual, expected):
-    if actual == expected:
-        checks["passed"] += 1
-    else:
-        checks["failed"] += 1
-        print(f"FAILED {name}: got {actual!r}, expected {expected!r}")
 
 
 def main():
-    root = tempfile.mkdtemp(prefix="mxreporting-python-")
-    env = dict(os.environ, MXREPORTING_ROOT=root)
-    env.pop("JOURNAL_STREAM", None)
-    log = open(os.path.join(root, "daemon.log"), "w")
-    daemon = subprocess.Popen([DAEMON], env=env, stderr=log, stdout=log)
-    path = os.path.join(root, "run/harmonia/reporting.sock")
+    daemon = Daemon(DAEMON)
+    checks = Checks()
+    check = checks.equal
     try:
-        deadline = time.time() + BOUND
-        while True:
-            try:
-                a = Client(path)
-                break
-            except OSError:
-                if time.time() > deadline:
-                    raise
-                time.sleep(0.01)
-        b = Client(path)
+        a = daemon.connect()
+        b = daemon.connect()
 
         check("create", a.call("createReportingSession:reply:", 5), True)
         check("create zero", a.call("createReportingSession:reply:", 0), True)
@@ -110,30 +50,17 @@ def main():
         error, _ = a.reply(a.send("frobnicate:"))
         check("unknown method", error["code"], 1)
 
-        os.makedirs(os.path.join(root, "var/lib/harmonia/preferences"), exist_ok=True)
-        with open(os.path.join(root, "var/lib/harmonia/preferences/com.kestrel.harmonia.json"), "w") as prefs:
-            prefs.write('{"disable_reporting": true}')
-        daemon.send_signal(1)  # SIGHUP posts the preferences notification
+        daemon.write("var/lib/harmonia/preferences/com.kestrel.harmonia.json", '{"disable_reporting": true}')
+        daemon.process.send_signal(1)  # SIGHUP posts the preferences notification
         refusal = {"domain": "com.kestrel.audio.reporting", "code": 1}
-        deadline = time.time() + BOUND
-        while a.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {}, 1, 0, None) != refusal:
-            if time.time() > deadline:
-                break
-            time.sleep(0.01)
-        check("refused while reporting is off", a.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {}, 1, 0, None), refusal)
+        send_anything = lambda: a.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {}, 1, 0, None)
+        checks.check("refused while reporting is off", wait_for(lambda: send_anything() == refusal))
 
         a.send("killService:")
-        check("kill service exit status", daemon.wait(timeout=BOUND), 2)
+        check("kill service exit status", daemon.process.wait(timeout=BOUND), 2)
     finally:
-        if daemon.poll() is None:
-            daemon.kill()
-            daemon.wait()
-        log.close()
-        if checks["failed"]:
-            print(open(os.path.join(root, "daemon.log")).read()[-4000:])
-        shutil.rmtree(root, ignore_errors=True)
-    print(f"{checks['passed']} passed, {checks['failed']} failed")
-    return 1 if checks["failed"] else 0
+        daemon.close(checks.failed)
+    return checks.summary()
 
 
 if __name__ == "__main__":

@@ -7,8 +7,6 @@
 
 #include "fakes/FakePlatform.h"
 
-#include <nlohmann/json.hpp>
-
 namespace mx::testing {
 namespace {
 
@@ -150,16 +148,19 @@ TEST_F(MxReportingSessionTest, BackendGetsSessionDescriptionAndMessagesInOrderTh
     EXPECT_FALSE(platform.log.contains("waiting for uplinkd to find backends")) << "backends were already known";
 }
 
-TEST_F(MxReportingSessionTest, BatchSessionOfUnsetTypeIsNamedUnknown)
+TEST_F(MxReportingSessionTest, BatchSessionOfUnsetTypeIsNamedUnknownAndItsFlushErrorIsLogged)
 {
+    platform.uplink.setFlushError(UplinkError{5, "collector unreachable"});
     auto session = makeSession(8, service_type::kUnknown);
     session->start();
+    session->stop();
     run();
     auto backend = onlyBackendSession();
     ASSERT_TRUE(backend);
     EXPECT_EQ(*backend->sessionInfo.find("BatchEvent"), Value(true));
     EXPECT_EQ(*backend->sessionInfo.find("ContainsRealtimeEvents"), Value(false));
     EXPECT_EQ(*backend->userInfo.find("ServiceName"), Value("unknown_session"));
+    EXPECT_TRUE(platform.log.contains("flush error collector unreachable"));
 }
 
 TEST_F(MxReportingSessionTest, TestSessionsAggregateButNeverTouchTheBackend)
@@ -209,24 +210,6 @@ TEST_F(MxReportingSessionTest, SingleMessageReportsTheBackendsRefusal)
     EXPECT_EQ(platform.log.texts(MxLogLevel::Error), std::vector<std::string>{"sendOneMessageWithSessionInfo refused"});
 }
 
-TEST_F(MxReportingSessionTest, SummaryListsEveryValueOfEveryKeyInMessageOrder)
-{
-    auto session = makeSession();
-    EXPECT_FALSE(session->createSummaryEventForSession()) << "nothing aggregated, no summary";
-    session->start();
-    EXPECT_FALSE(session->createSummaryEventForSession());
-    session->sendMessage(Dictionary{{"rate", 48000}, {"output route", "Speaker"}}, 3, 1, nullptr);
-    session->sendMessage(Dictionary{{"rate", 44100}, {"list", Array{1, "two"}}, {"Mx_Session_Summary_Event", "x"}}, 3,
-                         1, nullptr);
-    EXPECT_EQ(*session->createSummaryEventForSession(),
-              (Dictionary{{"Mx_Session_Summary_Event", "7,x"},
-                          {"rate", "48000,44100"},
-                          {"output_route", "Speaker"},
-                          {"list", "[1,\"two\"]"}}));
-    session->stop();
-    EXPECT_TRUE(platform.log.contains("sending summary event for reporter 5"));
-}
-
 TEST_F(MxReportingSessionTest, FailedDiscoveryDropsTheBackendSessionAfterNineSeconds)
 {
     platform.uplink.setDiscovery(FakeUplink::Discovery::NoBackends);
@@ -270,16 +253,6 @@ TEST_F(MxReportingSessionTest, DiscoveryAnsweredDuringTheWaitContinuesWithTheBac
     EXPECT_FALSE(session->uplinkSessionStarted()) << "nothing ever sets the seed";
 }
 
-TEST_F(MxReportingSessionTest, FlushErrorIsLogged)
-{
-    platform.uplink.setFlushError(UplinkError{5, "collector unreachable"});
-    auto session = makeSession();
-    session->start();
-    session->stop();
-    run();
-    EXPECT_TRUE(platform.log.contains("flush error collector unreachable"));
-}
-
 TEST_F(MxReportingSessionTest, LastReferenceToAStartedSessionGoesWithoutStopping)
 {
     auto session = makeSession();
@@ -290,92 +263,6 @@ TEST_F(MxReportingSessionTest, LastReferenceToAStartedSessionGoesWithoutStopping
     EXPECT_THAT(platform.trace.codes(), ElementsAre(0x21042834));
     EXPECT_TRUE(platform.log.contains("deallocing this session 5"));
     EXPECT_EQ(onlyBackendSession()->flushes(), 0);
-}
-
-} // namespace
-} // namespace mx::testing
-
-namespace mx::testing {
-namespace {
-
-class MxReportingSummaryFileTest : public MxReportingSessionTest {
-protected:
-    void SetUp() override { platform.device.setBool("InternalBuild", true); }
-
-    std::pair<std::string, nlohmann::json> onlyFile()
-    {
-        EXPECT_EQ(platform.files.files.size(), 1u);
-        if (platform.files.files.empty())
-            return {};
-        auto& [path, text] = *platform.files.files.begin();
-        return {path.string(), nlohmann::json::parse(text)};
-    }
-
-    static constexpr const char* kDirectory = "/root/var/log/harmonia/reporting";
-};
-
-TEST_F(MxReportingSummaryFileTest, FileHoldsUserInfoThenEveryMessageThenTheSummary)
-{
-    auto session = makeSession(5, 7);
-    session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "ExampleHost"}});
-    session->start();
-    session->sendMessage(Dictionary{{"output route", "Speaker"}, {"rate", 48000}}, 0x08000003, 1, nullptr);
-    session->sendMessage(Dictionary{{"rate", 44100}}, 0x08000003, 2, nullptr);
-    session->stop();
-
-    EXPECT_EQ(platform.files.directories.at(kDirectory), 0777);
-    auto [path, document] = onlyFile();
-    EXPECT_THAT(path,
-                ::testing::MatchesRegex(std::string(kDirectory) +
-                                        "/[0-9]{8}-[0-9]{6}[-+][0-9]{4}-harmonia-ExampleHost-longformaudio\\.json"));
-    EXPECT_EQ(document, nlohmann::json::parse(R"([
-        {"HostApplicationDisplayID": "ExampleHost"},
-        {"Session_Playback_Start_1": {"output_route": "Speaker", "rate": 48000}},
-        {"Session_Playback_Stop_1": {"rate": 44100}},
-        {"Undefined_Unknown_1": {"Mx_Session_Summary_Event": "7", "output_route": "Speaker", "rate": "48000,44100"}}
-    ])"));
-}
-
-TEST_F(MxReportingSummaryFileTest, HostNamesNeverLeaveTheDirectoryAndUnnamedHostsAreUnknown)
-{
-    auto session = makeSession(5, 2);
-    EXPECT_THAT(session->summaryFileName(0), ::testing::EndsWith("-harmonia-unknown-telephony.json"));
-    session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "../../etc/passwd"}});
-    auto name = session->summaryFileName(0);
-    EXPECT_EQ(name.find('/'), std::string::npos);
-    EXPECT_THAT(name, ::testing::EndsWith("-harmonia-.._.._etc_passwd-telephony.json"));
-}
-
-TEST_F(MxReportingSummaryFileTest, NothingIsWrittenWithoutMessagesOrOnCustomerBuilds)
-{
-    auto quiet = makeSession(5, 7);
-    quiet->start();
-    quiet->stop();
-    EXPECT_TRUE(platform.files.files.empty());
-
-    MxReportingResetInternalBuildForTesting();
-    platform.device.setBool("InternalBuild", false);
-    auto customer = makeSession(6, 7);
-    customer->start();
-    customer->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
-    customer->stop();
-    EXPECT_TRUE(platform.files.files.empty());
-    EXPECT_TRUE(platform.log.contains("sending summary event for reporter 6")) << "the summary event still goes out";
-}
-
-TEST_F(MxReportingSummaryFileTest, UnwritableDirectoryIsLoggedTwiceAndStopGoesOn)
-{
-    platform.files.directoryFailure = "Permission denied";
-    auto session = makeSession(5, 7);
-    session->start();
-    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
-    session->stop();
-    run();
-    EXPECT_THAT(
-        platform.log.texts(MxLogLevel::Error),
-        ::testing::ElementsAre(std::string("can't create logging directory at ") + kDirectory + ": Permission denied",
-                               "jsonOutput writeToURL: No such file or directory"));
-    EXPECT_EQ(onlyBackendSession()->flushes(), 1);
 }
 
 } // namespace
