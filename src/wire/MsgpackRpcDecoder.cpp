@@ -23,7 +23,8 @@ constexpr std::size_t kInitialBufferBytes = std::size_t{8} * 1024;
 
 MsgpackRpcDecoder::MsgpackRpcDecoder(std::size_t maximumMessageBytes)
     : maximumMessageBytes_(maximumMessageBytes),
-      unpacker_(nullptr, nullptr, kInitialBufferBytes, limitsFor(maximumMessageBytes))
+      unpacker_(nullptr, nullptr, kInitialBufferBytes, limitsFor(maximumMessageBytes)),
+      guard_(maximumMessageBytes, kMsgpackMaximumDepth)
 {
 }
 
@@ -33,7 +34,12 @@ std::span<char> MsgpackRpcDecoder::buffer(std::size_t atLeast)
     return {unpacker_.buffer(), unpacker_.buffer_capacity()};
 }
 
-void MsgpackRpcDecoder::consumed(std::size_t count) { unpacker_.buffer_consumed(count); }
+void MsgpackRpcDecoder::consumed(std::size_t count)
+{
+    if (guardReason_.empty() && !guard_.check({unpacker_.buffer(), count}, guardReason_) && guardReason_.empty())
+        guardReason_ = "malformed MessagePack";
+    unpacker_.buffer_consumed(count);
+}
 
 void MsgpackRpcDecoder::feed(const char* bytes, std::size_t count)
 {
@@ -44,6 +50,10 @@ void MsgpackRpcDecoder::feed(const char* bytes, std::size_t count)
 
 MsgpackRpcDecoder::Status MsgpackRpcDecoder::next(Value& message, std::string& reason)
 {
+    if (!guardReason_.empty()) {
+        reason = guardReason_;
+        return Status::Bad;
+    }
     msgpack::object_handle handle;
     // The unpacker counts the bytes of a message that spans several reads in
     // parsed_size() until the message completes, and then starts again at zero.
@@ -69,7 +79,8 @@ MsgpackRpcDecoder::Status MsgpackRpcDecoder::next(Value& message, std::string& r
         }
         return Status::NeedMore;
     }
-    if (partial + (pending - unpacker_.nonparsed_size()) > maximumMessageBytes_) {
+    lastMessageBytes_ = partial + (pending - unpacker_.nonparsed_size());
+    if (lastMessageBytes_ > maximumMessageBytes_) {
         reason = "message larger than 1 MiB";
         return Status::Bad;
     }

@@ -1,7 +1,8 @@
 #pragma once
 // Cuts a byte stream into msgpack-rpc messages and checks each against the limits of
 // the connection layer: at most 1 MiB a message, nesting at most 64 deep, string
-// map keys only. Used on both ends: the daemon reads requests with it, the client
+// map keys only. Declared sizes are checked as their headers arrive, before anything
+// is reserved for them. Used on both ends: the daemon reads requests with it, the client
 // library reads responses. Not thread-safe; one per connection.
 
 #include <cstdint>
@@ -11,6 +12,7 @@
 #include <msgpack.hpp>
 
 #include "platform/Value.h"
+#include "wire/MsgpackSizeGuard.h"
 
 namespace mx {
 
@@ -30,12 +32,18 @@ public:
     // the stream cannot be trusted and must be closed.
     Status next(Value& message, std::string& reason);
 
+    // The wire size of the message `next` returned last.
+    std::size_t lastMessageBytes() const { return lastMessageBytes_; }
+
     // Convenience for tests and fuzzing: feed bytes in one go.
     void feed(const char* bytes, std::size_t count);
 
 private:
     std::size_t maximumMessageBytes_;
     msgpack::unpacker unpacker_;
+    MsgpackSizeGuard guard_;
+    std::string guardReason_;
+    std::size_t lastMessageBytes_ = 0;
 };
 
 } // namespace mx

@@ -99,6 +99,8 @@ TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
         {"\xc1", "malformed MessagePack"},
         {deep, "nesting deeper than 64"},
         {std::string("\xdb\x00\x20\x00\x00", 5) + std::string((1 << 20) + 4096, 'x'), "message larger than 1 MiB"},
+        // Containers declaring billions of elements, nested: refused at the first header.
+        {std::string("\x94\xdd\xff\xff\xff\xff\xdd\xff\xff\xff\xff", 11), "message larger than 1 MiB"},
         {packed([](auto& p) { p.pack_array(2), p.pack(0), p.pack(1); }), "not a msgpack-rpc request"},
     };
     for (const auto& badInput : cases) {
@@ -112,18 +114,27 @@ TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
     EXPECT_EQ(*bystander->getServiceNameForReporterID(7).value, 7);
 }
 
-TEST_F(DaemonIntegrationTest, AClientThatDoesNotReadHoldsUpNobodyElse)
+TEST_F(DaemonIntegrationTest, AClientThatPipelinesAndNeverReadsIsHeldAtItsBoundAndHoldsUpNobody)
 {
     RawConnection flooder(daemon.socketPath());
     ASSERT_TRUE(flooder.connected());
     fcntl(flooder.fd(), F_SETFL, O_NONBLOCK);
-    std::string request = packed([](auto& p) {
-        p.pack_array(4), p.pack(0), p.pack(1), p.pack(std::string("reporterID:valid:")), p.pack_array(1), p.pack(1);
-    });
+    // Requests that queue on the server, and now and then one whose error reply
+    // echoes a long method name, so that unread replies pile up quickly too.
     std::string burst;
-    for (int i = 0; i < 20000; ++i)
-        burst += request;
-    // Write until the daemon stops reading: its replies to us are not being read.
+    for (int i = 0; i < 1000; ++i) {
+        burst += packed([&](auto& p) {
+            p.pack_array(4), p.pack(0), p.pack(i),
+                p.pack(std::string("sendMessage:withCategory:andType:forReportingIDs:reply:"));
+            p.pack_array(4), p.pack_map(1), p.pack(std::string("level")), p.pack(std::string(200, 'x')), p.pack(3);
+            p.pack(1), p.pack_array(0);
+        });
+        if (i % 20 == 0)
+            burst += packed([](auto& p) {
+                p.pack_array(4), p.pack(0), p.pack(1), p.pack(std::string(1000, 'm')), p.pack_array(0);
+            });
+    }
+    // Write until the daemon stops reading.
     std::size_t written = 0;
     bool blocked = waitUntil([&] {
         std::size_t offset = written % burst.size();
@@ -132,11 +143,15 @@ TEST_F(DaemonIntegrationTest, AClientThatDoesNotReadHoldsUpNobodyElse)
             written += std::size_t(sent);
         return sent < 0 && errno == EAGAIN;
     });
-    EXPECT_TRUE(blocked) << "the daemon kept reading after " << written << " bytes";
+    ASSERT_TRUE(blocked) << "the daemon kept reading after " << written << " bytes";
+    EXPECT_LT(daemon.residentBytes(), std::size_t{64} << 20) << "holding " << written << " bytes of requests";
 
     auto client = connect();
-    EXPECT_TRUE(*client->createReportingSession(9).value);
+    auto began = std::chrono::steady_clock::now();
+    ASSERT_TRUE(*client->createReportingSession(9).value);
     EXPECT_EQ(client->reporterID(9).value, (Dictionary{{"reporterID", 9}, {"serviceType", 65535}}));
+    // Not a speed check: before the bounds, a round trip waited out the whole flood.
+    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(1));
 }
 
 TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)

@@ -112,6 +112,16 @@ std::optional<int> DaemonProcess::waitForExit()
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
+std::size_t DaemonProcess::residentBytes() const
+{
+    std::ifstream status("/proc/" + std::to_string(pid_) + "/status");
+    std::string line;
+    while (std::getline(status, line))
+        if (line.starts_with("VmRSS:"))
+            return std::stoull(line.substr(6)) * 1024;
+    return 0;
+}
+
 std::string DaemonProcess::log() const
 {
     std::ifstream stream(root_ / "daemon.log");

@@ -31,6 +31,9 @@ public:
     // The exit status, or the signal as 128+N; nothing when it did not end in time.
     std::optional<int> waitForExit();
 
+    // The daemon's resident memory, from /proc.
+    std::size_t residentBytes() const;
+
     std::string log() const;
     bool waitForLog(const std::string& text, std::chrono::milliseconds bound = kBound) const;
 

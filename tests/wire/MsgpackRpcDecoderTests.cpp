@@ -79,6 +79,13 @@ TEST(MsgpackRpcDecoderTest, InputBeyondTheLimitsIsRefusedWithItsReason)
         {std::string("\xd4\x05\x00", 3), "extension type 5 is not a date"},
         {std::string("\xc1", 1), "malformed MessagePack"},
         {std::string("\xdb\x00\x20\x00\x00", 5) + std::string((1 << 20) + 1, 'x'), "message larger than 1 MiB"},
+        // Declared sizes are refused at their header, before anything arrives or is
+        // reserved: a 5 MiB string, and arrays claiming billions of elements.
+        {std::string("\xdb\x00\x50\x00\x00", 5), "message larger than 1 MiB (a header declares 5242880 bytes)"},
+        {std::string("\x91\xdd\xff\xff\xff\xff", 6),
+         "message larger than 1 MiB (a header declares 4294967295 elements)"},
+        {std::string("\xdf\x00\x08\x00\x00", 5), "message larger than 1 MiB (a header declares 1048576 elements)"},
+        {std::string("\xc7\xff\x05", 3) + std::string(255, 'x'), "extension type 5 is not a date"},
     };
     for (const auto& input : cases) {
         MsgpackRpcDecoder decoder;

@@ -18,23 +18,36 @@ namespace {
 // allow a second reply (and a reply after the client left).
 class ConnectionReply final : public ServiceReply {
 public:
-    ConnectionReply(std::weak_ptr<MsgpackRpcConnection> connection, std::uint32_t msgid)
-        : connection_(std::move(connection)), msgid_(msgid)
+    ConnectionReply(std::weak_ptr<MsgpackRpcConnection> connection, std::uint32_t msgid, std::size_t bytes)
+        : connection_(std::move(connection)), msgid_(msgid), bytes_(bytes)
     {
+    }
+
+    // A request that is never answered (its client vanished, its reply was dropped)
+    // leaves the connection's bounds here.
+    ~ConnectionReply() override
+    {
+        if (!replied_.load())
+            if (auto connection = connection_.lock())
+                connection->requestEnded(bytes_);
     }
 
     void respond(const Value& result) override
     {
         if (claim())
-            if (auto connection = connection_.lock())
+            if (auto connection = connection_.lock()) {
                 connection->sendResponse(msgid_, Value(), result);
+                connection->requestEnded(bytes_);
+            }
     }
 
     void fail(const ServiceError& error) override
     {
         if (claim())
-            if (auto connection = connection_.lock())
+            if (auto connection = connection_.lock()) {
                 connection->sendError(msgid_, error);
+                connection->requestEnded(bytes_);
+            }
     }
 
 private:
@@ -42,6 +55,7 @@ private:
 
     std::weak_ptr<MsgpackRpcConnection> connection_;
     std::uint32_t msgid_;
+    std::size_t bytes_;
     std::atomic<bool> replied_{false};
 };
 
@@ -88,9 +102,14 @@ void MsgpackRpcConnection::resume()
     readMore();
 }
 
+void MsgpackRpcConnection::stopReading()
+{
+    asio::post(socket_.get_executor(), [self = shared_from_this()] { self->stoppedReading_ = true; });
+}
+
 void MsgpackRpcConnection::readMore()
 {
-    if (reading_ || closed_ || outboxBytes_ > kBackPressureBytes)
+    if (reading_ || closed_)
         return;
     reading_ = true;
     auto space = decoder_.buffer();
@@ -109,9 +128,32 @@ void MsgpackRpcConnection::readMore()
 void MsgpackRpcConnection::handleRead(std::size_t bytes)
 {
     decoder_.consumed(bytes);
+    processBuffered();
+}
+
+bool MsgpackRpcConnection::overBound() const
+{
+    return stoppedReading_ || requestsInFlight_.load() >= kMaximumRequestsInFlight ||
+        bytesInFlight_.load() >= kMaximumBytesInFlight || outboxBytes_ > kBackPressureBytes;
+}
+
+// Decoded input waits in the decoder while a bound holds; the socket behind it fills,
+// and the client's writes block.
+void MsgpackRpcConnection::processBuffered()
+{
     Value message;
     std::string reason;
-    for (;;) {
+    while (!closed_) {
+        if (overBound()) {
+            // No read is outstanding meanwhile, and maybe no write: the connection
+            // holds itself until it reads again or closes.
+            holdWhilePaused_ = shared_from_this();
+            paused_.store(true);
+            if (overBound())
+                return;
+            paused_.store(false);
+            holdWhilePaused_.reset();
+        }
         switch (decoder_.next(message, reason)) {
         case MsgpackRpcDecoder::Status::NeedMore:
             readMore();
@@ -120,16 +162,34 @@ void MsgpackRpcConnection::handleRead(std::size_t bytes)
             close(reason);
             return;
         case MsgpackRpcDecoder::Status::Message:
-            if (!handleMessage(message))
-                return;
-            if (closed_)
+            if (!handleMessage(message, decoder_.lastMessageBytes()))
                 return;
             break;
         }
     }
 }
 
-bool MsgpackRpcConnection::handleMessage(const Value& message)
+void MsgpackRpcConnection::resumeIfPaused()
+{
+    if (!paused_.exchange(false))
+        return;
+    auto self = std::move(holdWhilePaused_);
+    processBuffered();
+}
+
+void MsgpackRpcConnection::requestEnded(std::size_t bytes)
+{
+    requestsInFlight_.fetch_sub(1);
+    bytesInFlight_.fetch_sub(bytes);
+    if (!paused_.load() || resumePosted_.exchange(true))
+        return;
+    asio::post(socket_.get_executor(), [self = shared_from_this()] {
+        self->resumePosted_.store(false);
+        self->resumeIfPaused();
+    });
+}
+
+bool MsgpackRpcConnection::handleMessage(const Value& message, std::size_t bytes)
 {
     std::string reason;
     auto request = parseRpcRequest(message, reason);
@@ -137,7 +197,9 @@ bool MsgpackRpcConnection::handleMessage(const Value& message)
         close(reason);
         return false;
     }
-    auto reply = std::make_shared<ConnectionReply>(weak_from_this(), request->msgid);
+    requestsInFlight_.fetch_add(1);
+    bytesInFlight_.fetch_add(bytes);
+    auto reply = std::make_shared<ConnectionReply>(weak_from_this(), request->msgid, bytes);
     if (!exported_) {
         reply->fail({kServiceErrorUnknownMethod, "nothing is exported on this connection"});
         return true;
@@ -153,7 +215,7 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
     // Encoded on the replying thread, so the I/O thread only writes.
     std::lock_guard lock(repliesMutex_);
     if (!replies_)
-        replies_ = std::make_shared<msgpack::sbuffer>();
+        replies_ = std::make_shared<msgpack::sbuffer>(kReplyBufferBytes);
     encodeRpcResponse(*replies_, msgid, error, result);
     if (flushScheduled_)
         return;
@@ -183,7 +245,12 @@ void MsgpackRpcConnection::enqueue(std::shared_ptr<msgpack::sbuffer> bytes)
     if (closed_)
         return;
     outboxBytes_ += bytes->size();
-    outbox_.push_back(std::move(bytes));
+    // Behind a write in progress, replies gather in one buffer: a client that reads
+    // nothing holds its bound in bytes, not a buffer for every handful of replies.
+    if (outbox_.size() > writingBuffers_ && outbox_.back()->size() < kBackPressureBytes)
+        outbox_.back()->write(bytes->data(), bytes->size());
+    else
+        outbox_.push_back(std::move(bytes));
     writeMore();
 }
 
@@ -197,8 +264,8 @@ void MsgpackRpcConnection::writeMore()
     buffers.reserve(outbox_.size());
     for (const auto& bytes : outbox_)
         buffers.emplace_back(bytes->data(), bytes->size());
-    std::size_t batch = outbox_.size();
-    asio::async_write(socket_, buffers, [self = shared_from_this(), batch](const std::error_code& error, std::size_t) {
+    writingBuffers_ = outbox_.size();
+    asio::async_write(socket_, buffers, [self = shared_from_this()](const std::error_code& error, std::size_t) {
         self->writing_ = false;
         if (self->closed_)
             return;
@@ -206,12 +273,12 @@ void MsgpackRpcConnection::writeMore()
             self->close({});
             return;
         }
-        for (std::size_t i = 0; i < batch; ++i) {
+        for (; self->writingBuffers_ > 0; --self->writingBuffers_) {
             self->outboxBytes_ -= self->outbox_.front()->size();
             self->outbox_.pop_front();
         }
         self->writeMore();
-        self->readMore();
+        self->resumeIfPaused();
     });
 }
 
@@ -230,6 +297,7 @@ void MsgpackRpcConnection::close(const std::string& reason)
     // The exported object goes only after the handler, which may still need it.
     exported_.reset();
     interruptionHandler_ = nullptr;
+    holdWhilePaused_.reset();
 }
 
 } // namespace mx

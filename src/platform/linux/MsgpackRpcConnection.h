@@ -24,7 +24,14 @@ namespace mx {
 class MsgpackRpcConnection final : public ServiceConnection, public std::enable_shared_from_this<MsgpackRpcConnection> {
 public:
     // Unsent reply bytes above which the client's requests are no longer read.
-    static constexpr std::size_t kBackPressureBytes = 4 << 20;
+    static constexpr std::size_t kBackPressureBytes = std::size_t{4} << 20;
+    // Requests handed on and not yet answered, in number and in wire bytes. Every one
+    // waits on the one server queue: 256 keep another client's turn a millisecond or
+    // two away, and leave room for a client's held start replies.
+    static constexpr std::size_t kMaximumRequestsInFlight = 256;
+    static constexpr std::size_t kMaximumBytesInFlight = std::size_t{4} << 20;
+    // A reply batch starts this small: most hold a reply or two.
+    static constexpr std::size_t kReplyBufferBytes = 512;
 
     MsgpackRpcConnection(asio::local::stream_protocol::socket socket, std::uint64_t number);
     ~MsgpackRpcConnection() override;
@@ -36,14 +43,23 @@ public:
     void setInvalidationHandler(std::function<void()> handler) override;
     void resume() override;
 
+    // Reads no further request, for good: the daemon is shutting down. What is in
+    // flight is still answered. Any thread.
+    void stopReading();
+
     // Any thread. Dropped when the connection is gone.
     void sendResponse(std::uint32_t msgid, const Value& error, const Value& result);
     void sendError(std::uint32_t msgid, const ServiceError& error);
+    // Any thread, once per request handed on: it was answered, or never will be.
+    void requestEnded(std::size_t bytes);
 
 private:
     void readMore();
     void handleRead(std::size_t bytes);
-    bool handleMessage(const Value& message);
+    void processBuffered();
+    bool overBound() const;
+    void resumeIfPaused();
+    bool handleMessage(const Value& message, std::size_t bytes);
     void flushReplies();
     void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
     void writeMore();
@@ -61,9 +77,19 @@ private:
     std::function<void()> invalidationHandler_;
     std::deque<std::shared_ptr<msgpack::sbuffer>> outbox_;
     std::size_t outboxBytes_ = 0;
+    std::size_t writingBuffers_ = 0; // the front of the outbox that a write in progress covers
     bool reading_ = false;
     bool writing_ = false;
     bool resumed_ = false;
+    bool stoppedReading_ = false;
+
+    // Set by the I/O thread before it checks the bounds once more, read by replying
+    // threads after they lower them: one of the two always sees the other.
+    std::atomic<bool> paused_{false};
+    std::shared_ptr<MsgpackRpcConnection> holdWhilePaused_; // I/O thread only
+    std::atomic<bool> resumePosted_{false};
+    std::atomic<std::size_t> requestsInFlight_{0};
+    std::atomic<std::size_t> bytesInFlight_{0};
 
     std::atomic<bool> closed_{false};
 
