@@ -8,6 +8,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <fstream>
+#include <thread>
+
 #include <fmt/format.h>
 
 #include <gmock/gmock.h>
@@ -244,6 +247,56 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     auto alone = daemon.query("uplink", "SELECT payload, user_info FROM messages WHERE session IS NULL");
     ASSERT_EQ(alone.size(), 1u);
     EXPECT_EQ(nlohmann::json::parse(alone[0][1])["ServiceName"], "standalone");
+}
+
+TEST_F(DaemonIntegrationTest, SigtermUnderPipelinedLoadLosesNothingAcknowledged)
+{
+    auto client = connect();
+    ASSERT_TRUE(*client->createReportingSession(3).value);
+    ASSERT_TRUE(*client->createReportingSession(4).value);
+    ASSERT_TRUE(*client->setServiceType(10, 4).value); // alarms: sent alone, up to 59 s later
+    client->startReportingSessionForID(3, nullptr);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"alarm", 1}}, 3, 1, std::vector<ReporterID>{4}));
+
+    std::atomic<int> acknowledged{0};
+    std::atomic<bool> sending{true};
+    std::thread load([&] {
+        for (int i = 0; sending; ++i) {
+            client->sendMessage(Dictionary{{"seq", i}}, 3, 1, std::vector<ReporterID>{3},
+                                [&](const MxClientResult<MxSendOutcome>& result) {
+                                    if (result.value)
+                                        ++acknowledged;
+                                });
+            if (i % 64 == 63)
+                client->getAllReporters(); // keep some 64 requests in flight
+        }
+    });
+    EXPECT_TRUE(waitUntil([&] { return acknowledged > 5000; }));
+    daemon.signal(SIGTERM);
+    EXPECT_EQ(daemon.waitForExit(), 0);
+    sending = false;
+    load.join();
+    auto count = [&](const std::string& store, const std::string& where) {
+        return std::stoi(daemon.query(store, "SELECT count(*) FROM " + where)[0][0]);
+    };
+    EXPECT_GE(count("tally", "events WHERE name = 'com.kestrel.harmonia.Playback.Start'"), acknowledged + 1);
+    EXPECT_GE(count("uplink", "messages WHERE session IS NOT NULL"), acknowledged.load());
+    EXPECT_EQ(count("uplink", "messages WHERE session IS NULL AND payload LIKE '%alarm%'"), 1)
+        << "the delayed single message went out at shutdown";
+    EXPECT_TRUE(daemon.waitForLog("everything taken is committed"));
+}
+
+TEST_F(DaemonIntegrationTest, ASecondDaemonOnTheSameRootLeavesTheFirstAlone)
+{
+    pid_t second = daemon.spawn({MXREPORTINGD_PATH});
+    int status = 0;
+    waitpid(second, &status, 0);
+    EXPECT_EQ(WEXITSTATUS(status), 1);
+    std::ifstream log(daemon.path("spawned.log"));
+    std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
+    EXPECT_THAT(
+        text, ::testing::HasSubstr(fmt::format("another mxreportingd (pid {}) is running on this root", daemon.pid())));
+    EXPECT_TRUE(*connect()->createReportingSession(1).value) << "the first one still serves its socket";
 }
 
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)

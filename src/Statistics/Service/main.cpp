@@ -17,6 +17,7 @@
 #include "Statistics/Service/MxReportingServiceDelegate.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/InstanceLock.h"
 #include "platform/linux/JournalLogSink.h"
 #include "platform/linux/JsonDeviceProperties.h"
 #include "platform/linux/JsonPreferences.h"
@@ -44,6 +45,10 @@ The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default
 Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
 SIGHUP re-reads the preferences; SIGTERM commits the stores and exits.
 )";
+
+// How long a shutdown waits for the queues: sessions still waiting on backend
+// discovery take up to 9 s a round, and the unit's stop timeout is 90 s.
+constexpr std::chrono::milliseconds kDrainBound{60'000};
 
 // Every client is a descriptor: take all the system allows, not the shell's default.
 void raiseDescriptorLimit()
@@ -78,6 +83,11 @@ int run(int argc, char** argv)
     JournalLogSink journalSink;
     ProcessWide<MxLogSink>::install(JournalLogSink::runningUnderJournal() ? static_cast<MxLogSink*>(&journalSink)
                                                                           : &stderrSink);
+    std::string error;
+    // Before the socket and the stores: a second daemon must leave the first's alone.
+    auto instanceLock = InstanceLock::acquire(MxReportingPath("run/harmonia/mxreportingd.lock"), error);
+    if (!instanceLock)
+        fail(error);
     UsdtTracePoints tracePoints;
     ProcessWide<TracePoints>::install(&tracePoints);
     AsioDispatch dispatch;
@@ -87,7 +97,6 @@ int run(int argc, char** argv)
     JsonDeviceProperties deviceProperties(MxReportingPath("etc/harmonia/device.json"));
     ProcessWide<DeviceProperties>::install(&deviceProperties);
 
-    std::string error;
     auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"),
                                    MxReportingPath("etc/harmonia/tally.json"), error);
     if (!tally)
@@ -142,12 +151,20 @@ int run(int argc, char** argv)
 
     int signal = terminated.get_future().get();
     sd_notify(0, "STOPPING=1");
-    MXLOG(nullptr, Default, "mxreportingd stopping on signal {}: committing the stores", signal);
+    MXLOG(nullptr, Default, "mxreportingd stopping on signal {}: taking no more requests", signal);
+    auto began = std::chrono::steady_clock::now();
+    // Every request already taken runs to its end, and so does the work it queued
+    // (deliveries, single messages, delayed ones at once), before the stores commit.
+    listener->stopReading();
+    if (!dispatch.drain(kDrainBound))
+        MXLOG(nullptr, Error, "queues still busy after {} s: committing what they handed over",
+              kDrainBound.count() / 1000);
     tally->store().flush();
     joule->store().flush();
     uplink->store().flush();
-    // Queues and connections are not torn down: the process simply ends, as it
-    // would at any other moment.
+    MXLOG(nullptr, Default, "mxreportingd stopped: everything taken is committed ({} ms)",
+          std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - began).count());
+    // Queues and connections are not torn down: the process simply ends.
     std::_Exit(0);
 }
 

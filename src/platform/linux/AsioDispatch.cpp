@@ -20,8 +20,8 @@ AsioDispatch::AsioDispatch(unsigned threadsPerPool)
       utilityPool_("mx-utility",
                    threadsPerPool != 0 ? threadsPerPool : std::max(1u, std::thread::hardware_concurrency() / 2),
                    kUtilityNiceness),
-      interactiveQueue_("com.kestrel.harmonia.global.interactive", interactivePool_),
-      utilityQueue_("com.kestrel.harmonia.global.utility", utilityPool_)
+      interactiveQueue_("com.kestrel.harmonia.global.interactive", interactivePool_, outstanding_),
+      utilityQueue_("com.kestrel.harmonia.global.utility", utilityPool_, outstanding_)
 {
 }
 
@@ -34,7 +34,7 @@ AsioWorkerPool& AsioDispatch::pool(QueuePriority priority)
 
 std::shared_ptr<WorkQueue> AsioDispatch::makeSerialQueue(std::string label, QueuePriority priority)
 {
-    return std::make_shared<AsioSerialQueue>(std::move(label), pool(priority).executor());
+    return std::make_shared<AsioSerialQueue>(std::move(label), pool(priority).executor(), outstanding_);
 }
 
 WorkQueue& AsioDispatch::globalQueue(QueuePriority priority)

@@ -25,9 +25,14 @@ public:
     void beginBlocking() override;
     void endBlocking() override;
 
+    // Runs delayed work at once and waits, at most `bound`, until no queue has work
+    // left; work dispatched meanwhile is waited for too. False when work remains.
+    bool drain(std::chrono::milliseconds bound) { return outstanding_.drain(bound); }
+
 private:
     AsioWorkerPool& pool(QueuePriority priority);
 
+    AsioOutstandingWork outstanding_;
     AsioWorkerPool interactivePool_;
     AsioWorkerPool utilityPool_;
     AsioGlobalQueue interactiveQueue_;

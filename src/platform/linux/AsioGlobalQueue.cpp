@@ -5,14 +5,23 @@
 
 namespace mx {
 
-AsioGlobalQueue::AsioGlobalQueue(std::string label, AsioWorkerPool& pool) : label_(std::move(label)), pool_(pool) {}
+AsioGlobalQueue::AsioGlobalQueue(std::string label, AsioWorkerPool& pool, AsioOutstandingWork& work)
+    : label_(std::move(label)), pool_(pool), work_(work)
+{
+}
 
-void AsioGlobalQueue::dispatch(UniqueFunction<void()> work) { asio::post(pool_.executor(), std::move(work)); }
+void AsioGlobalQueue::dispatch(UniqueFunction<void()> work)
+{
+    work_.begin();
+    asio::post(pool_.executor(), [&outstanding = work_, work = std::move(work)]() mutable {
+        work();
+        outstanding.end();
+    });
+}
 
 void AsioGlobalQueue::dispatchAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> work)
 {
-    auto timer = std::make_shared<asio::steady_timer>(pool_.executor(), delay);
-    timer->async_wait([timer, work = std::move(work)](const std::error_code&) mutable { work(); });
+    work_.runAfter(std::make_shared<asio::steady_timer>(pool_.executor(), delay), std::move(work));
 }
 
 } // namespace mx

@@ -3,13 +3,14 @@
 // free thread, in no particular order.
 
 #include "platform/WorkQueue.h"
+#include "platform/linux/AsioOutstandingWork.h"
 #include "platform/linux/AsioWorkerPool.h"
 
 namespace mx {
 
 class AsioGlobalQueue final : public WorkQueue {
 public:
-    AsioGlobalQueue(std::string label, AsioWorkerPool& pool);
+    AsioGlobalQueue(std::string label, AsioWorkerPool& pool, AsioOutstandingWork& work);
 
     const std::string& label() const override { return label_; }
     void dispatch(UniqueFunction<void()> work) override;
@@ -19,6 +20,7 @@ public:
 private:
     std::string label_;
     AsioWorkerPool& pool_;
+    AsioOutstandingWork& work_;
 };
 
 } // namespace mx

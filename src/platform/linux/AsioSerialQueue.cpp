@@ -5,17 +5,24 @@
 
 namespace mx {
 
-AsioSerialQueue::AsioSerialQueue(std::string label, const asio::io_context::executor_type& executor)
-    : label_(std::move(label)), strand_(asio::make_strand(executor))
+AsioSerialQueue::AsioSerialQueue(std::string label, const asio::io_context::executor_type& executor,
+                                 AsioOutstandingWork& work)
+    : label_(std::move(label)), strand_(asio::make_strand(executor)), work_(work)
 {
 }
 
-void AsioSerialQueue::dispatch(UniqueFunction<void()> work) { asio::post(strand_, std::move(work)); }
+void AsioSerialQueue::dispatch(UniqueFunction<void()> work)
+{
+    work_.begin();
+    asio::post(strand_, [&outstanding = work_, work = std::move(work)]() mutable {
+        work();
+        outstanding.end();
+    });
+}
 
 void AsioSerialQueue::dispatchAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> work)
 {
-    auto timer = std::make_shared<asio::steady_timer>(strand_, delay);
-    timer->async_wait([timer, work = std::move(work)](const std::error_code&) mutable { work(); });
+    work_.runAfter(std::make_shared<asio::steady_timer>(strand_, delay), std::move(work));
 }
 
 } // namespace mx

@@ -6,12 +6,13 @@
 #include <asio/strand.hpp>
 
 #include "platform/WorkQueue.h"
+#include "platform/linux/AsioOutstandingWork.h"
 
 namespace mx {
 
 class AsioSerialQueue final : public WorkQueue {
 public:
-    AsioSerialQueue(std::string label, const asio::io_context::executor_type& executor);
+    AsioSerialQueue(std::string label, const asio::io_context::executor_type& executor, AsioOutstandingWork& work);
 
     const std::string& label() const override { return label_; }
     void dispatch(UniqueFunction<void()> work) override;
@@ -21,6 +22,7 @@ public:
 private:
     std::string label_;
     asio::strand<asio::io_context::executor_type> strand_;
+    AsioOutstandingWork& work_;
 };
 
 } // namespace mx

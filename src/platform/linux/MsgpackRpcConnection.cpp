@@ -102,10 +102,7 @@ void MsgpackRpcConnection::resume()
     readMore();
 }
 
-void MsgpackRpcConnection::stopReading()
-{
-    asio::post(socket_.get_executor(), [self = shared_from_this()] { self->stoppedReading_ = true; });
-}
+void MsgpackRpcConnection::stopReading() { stoppedReading_ = true; }
 
 void MsgpackRpcConnection::readMore()
 {

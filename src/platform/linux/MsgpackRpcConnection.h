@@ -44,7 +44,7 @@ public:
     void resume() override;
 
     // Reads no further request, for good: the daemon is shutting down. What is in
-    // flight is still answered. Any thread.
+    // flight is still answered. I/O thread only.
     void stopReading();
 
     // Any thread. Dropped when the connection is gone.

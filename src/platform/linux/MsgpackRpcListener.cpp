@@ -1,6 +1,9 @@
 #include "platform/linux/MsgpackRpcListener.h"
 
+#include <future>
 #include <pthread.h>
+
+#include <asio/post.hpp>
 #include <sys/stat.h>
 
 #include <systemd/sd-daemon.h>
@@ -69,6 +72,21 @@ void MsgpackRpcListener::resume()
     });
 }
 
+void MsgpackRpcListener::stopReading()
+{
+    std::promise<void> stopped;
+    asio::post(io_, [&] {
+        std::error_code ignored;
+        acceptor_.close(ignored);
+        retry_.cancel();
+        for (const auto& known : connections_)
+            if (auto connection = known.lock())
+                connection->stopReading();
+        stopped.set_value();
+    });
+    stopped.get_future().wait();
+}
+
 void MsgpackRpcListener::acceptNext()
 {
     acceptor_.async_accept([this](const std::error_code& error, asio::local::stream_protocol::socket socket) {
@@ -88,6 +106,9 @@ void MsgpackRpcListener::acceptNext()
             auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), ++accepted_);
             if (!delegate_ || !delegate_->shouldAcceptNewConnection(*this, connection))
                 connection.reset();
+            std::erase_if(connections_, [](const auto& known) { return known.expired(); });
+            if (connection)
+                connections_.push_back(connection);
         }
         acceptNext();
     });

@@ -5,6 +5,7 @@
 // Owned by main; lives as long as the process.
 
 #include <filesystem>
+#include <list>
 #include <memory>
 #include <thread>
 
@@ -17,6 +18,8 @@
 
 namespace mx {
 
+class MsgpackRpcConnection;
+
 class MsgpackRpcListener final : public ServiceListener {
 public:
     // Takes the first socket systemd passed, if any; otherwise binds `path`
@@ -27,6 +30,10 @@ public:
 
     void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override;
     void resume() override;
+
+    // Accepts no more connections and reads no further request on any; what is in
+    // flight is still answered. Returns once that holds. Any thread but the listener's.
+    void stopReading();
 
     // Where clients connect, for the start-up banner.
     std::string endpointDescription() const { return endpoint_; }
@@ -43,6 +50,7 @@ private:
     std::shared_ptr<ServiceListenerDelegate> delegate_;
     std::string endpoint_;
     std::uint64_t accepted_ = 0;
+    std::list<std::weak_ptr<MsgpackRpcConnection>> connections_; // listener thread only
     std::thread thread_;
 };
 
