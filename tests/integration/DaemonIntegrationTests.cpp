@@ -299,6 +299,91 @@ TEST_F(DaemonIntegrationTest, ASecondDaemonOnTheSameRootLeavesTheFirstAlone)
     EXPECT_TRUE(*connect()->createReportingSession(1).value) << "the first one still serves its socket";
 }
 
+TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
+{
+    DaemonProcess daemon;
+    auto stores = daemon.path("var/lib/harmonia");
+    std::filesystem::create_directories(stores);
+    if (::system(fmt::format("mount -t tmpfs -o size=1m tmpfs '{}' 2>/dev/null", stores.string()).c_str()) != 0)
+        GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
+    struct Unmount {
+        std::filesystem::path path;
+        ~Unmount() { (void)::system(fmt::format("umount -l '{}'", path.string()).c_str()); }
+    } unmount{stores};
+    daemon.start();
+    std::string error;
+    auto client = MxReportingClient::connect(daemon.socketPath(), error);
+    ASSERT_TRUE(client) << error;
+    ASSERT_TRUE(*client->createReportingSession(3).value);
+    client->startReportingSessionForID(3, nullptr);
+    constexpr int kReports = 20000;
+    std::atomic<int> acknowledged{0};
+    for (int i = 0; i < kReports; ++i)
+        client->sendMessage(Dictionary{{"seq", i}, {"filler", std::string(100, 'f')}}, 3, 1, std::vector<ReporterID>{3},
+                            [&](const MxClientResult<MxSendOutcome>& result) {
+                                if (result.value)
+                                    ++acknowledged;
+                            });
+    ASSERT_TRUE(daemon.waitForLog("cannot write"));
+    EXPECT_LT(acknowledged, kReports) << "clients wait while the stores cannot write";
+
+    ASSERT_EQ(::system(fmt::format("mount -o remount,size=256m '{}'", stores.string()).c_str()), 0);
+    EXPECT_TRUE(waitUntil([&] { return acknowledged == kReports; }, std::chrono::seconds(60)));
+    EXPECT_TRUE(daemon.waitForLog("writing again after"));
+    daemon.signal(SIGTERM);
+    ASSERT_EQ(daemon.waitForExit(), 0);
+    EXPECT_EQ(daemon.query("tally", "SELECT count(*) FROM events")[0][0], std::to_string(kReports));
+    EXPECT_EQ(daemon.query("uplink", "SELECT count(*) FROM messages")[0][0], std::to_string(kReports));
+    auto log = daemon.log();
+    std::size_t failures = 0;
+    for (auto at = log.find("cannot write"); at != std::string::npos; at = log.find("cannot write", at + 1))
+        ++failures;
+    EXPECT_LE(failures, 3u) << "one line per store when failing starts, not one per row";
+}
+
+TEST(DaemonStoreFailureTest, StoresThatCannotBeWrittenAtStartUpAreAClearError)
+{
+    DaemonProcess daemon;
+    auto stores = daemon.path("var/lib/harmonia");
+    std::filesystem::create_directories(stores);
+    if (::system(fmt::format("mount -t tmpfs -o size=1m,ro tmpfs '{}' 2>/dev/null", stores.string()).c_str()) != 0)
+        GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
+    pid_t started = daemon.spawn({MXREPORTINGD_PATH});
+    int status = 0;
+    waitpid(started, &status, 0);
+    (void)::system(fmt::format("umount -l '{}'", stores.string()).c_str());
+    EXPECT_EQ(WEXITSTATUS(status), 1);
+    std::ifstream log(daemon.path("spawned.log"));
+    std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
+    EXPECT_THAT(text, ::testing::HasSubstr("mxreportingd cannot start: " + (stores / "tally.db").string()));
+}
+
+TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("var/lib/harmonia/joule.db", std::string(8192, 'J'));
+    daemon.start();
+    EXPECT_TRUE(daemon.waitForLog("joule.db is corrupt"));
+    std::string error;
+    auto client = MxReportingClient::connect(daemon.socketPath(), error);
+    ASSERT_TRUE(client) << error;
+    ASSERT_TRUE(*client->createReportingSession(3).value);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"EngineOnTime", 1}}, 3, 1, std::vector<ReporterID>{3}));
+    EXPECT_TRUE(waitUntil([&] { return daemon.query("joule", "SELECT count(*) FROM events")[0][0] == "1"; }));
+    bool setAside = false;
+    for (const auto& entry : std::filesystem::directory_iterator(daemon.path("var/lib/harmonia")))
+        setAside |= entry.path().filename().string().starts_with("joule.db.corrupt-");
+    EXPECT_TRUE(setAside);
+
+    std::filesystem::remove_all(daemon.path("var/lib/harmonia"));
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"after", 1}}, 3, 1, std::vector<ReporterID>{3}));
+    EXPECT_TRUE(daemon.waitForLog("tally.db was removed: making a new one"));
+    EXPECT_TRUE(waitUntil([&] {
+        auto rows = daemon.query("tally", "SELECT count(*) FROM events");
+        return !rows.empty() && rows[0][0] == "1";
+    }));
+}
+
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();

@@ -1,7 +1,11 @@
 #include "platform/linux/SqliteStore.h"
 
 #include <chrono>
+#include <ctime>
 #include <pthread.h>
+#include <sys/stat.h>
+
+#include <fmt/format.h>
 #include <sqlite3.h>
 
 #include "platform/JsonValue.h"
@@ -14,49 +18,111 @@ double secondsSinceEpoch()
     return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
+namespace {
+
+bool isCorruption(int code) { return code == SQLITE_CORRUPT || code == SQLITE_NOTADB; }
+
+// "tally.db" -> "tally.db.corrupt-20261123T041500", with its journal files beside it.
+std::filesystem::path setAside(const std::filesystem::path& path)
+{
+    std::time_t now = std::time(nullptr);
+    std::tm local{};
+    localtime_r(&now, &local);
+    char stamp[32];
+    std::strftime(stamp, sizeof(stamp), "%Y%m%dT%H%M%S", &local);
+    std::filesystem::path aside = path.string() + ".corrupt-" + stamp;
+    std::error_code ignored;
+    for (const char* suffix : {"", "-wal", "-shm"})
+        std::filesystem::rename(path.string() + suffix, aside.string() + suffix, ignored);
+    return aside;
+}
+
+std::string describe(std::chrono::steady_clock::duration duration)
+{
+    return fmt::format("{:.1f} s", std::chrono::duration<double>(duration).count());
+}
+
+} // namespace
+
 std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path,
                                                const std::vector<std::string>& schema,
                                                const std::vector<std::string>& statements, std::string& error)
 {
-    std::error_code ignored;
-    std::filesystem::create_directories(path.parent_path(), ignored);
-    sqlite3* database = nullptr;
-    if (sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX,
-                        nullptr) != SQLITE_OK) {
-        error = "cannot open " + path.string() + ": " + (database ? sqlite3_errmsg(database) : "out of memory");
-        sqlite3_close(database);
-        return nullptr;
-    }
-    sqlite3_busy_timeout(database, 5000);
-    std::vector<std::string> setup = {"PRAGMA journal_mode=WAL", "PRAGMA synchronous=NORMAL"};
-    setup.insert(setup.end(), schema.begin(), schema.end());
-    for (const auto& sql : setup) {
-        char* message = nullptr;
-        if (sqlite3_exec(database, sql.c_str(), nullptr, nullptr, &message) != SQLITE_OK) {
-            error = path.string() + ": " + (message ? message : "error") + " in: " + sql;
-            sqlite3_free(message);
-            sqlite3_close(database);
+    Connection connection;
+    int code = SQLITE_OK;
+    if (!connect(path, schema, statements, connection, error, code)) {
+        if (!isCorruption(code))
             return nullptr;
-        }
-    }
-    std::vector<sqlite3_stmt*> prepared;
-    for (const auto& sql : statements) {
-        sqlite3_stmt* statement = nullptr;
-        if (sqlite3_prepare_v3(database, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &statement, nullptr) !=
-            SQLITE_OK) {
-            error = path.string() + ": " + sqlite3_errmsg(database) + " in: " + sql;
-            for (auto* done : prepared)
-                sqlite3_finalize(done);
-            sqlite3_close(database);
+        auto aside = setAside(path);
+        MXLOG(nullptr, Error, "{} is corrupt ({}): set aside as {}, starting a fresh store", path.string(), error,
+              aside.filename().string());
+        if (!connect(path, schema, statements, connection, error, code))
             return nullptr;
-        }
-        prepared.push_back(statement);
     }
-    return std::unique_ptr<SqliteStore>(new SqliteStore(path, database, std::move(prepared)));
+    return std::unique_ptr<SqliteStore>(new SqliteStore(path, schema, statements, connection));
 }
 
-SqliteStore::SqliteStore(std::filesystem::path path, sqlite3* database, std::vector<sqlite3_stmt*> statements)
-    : path_(std::move(path)), database_(database), statements_(std::move(statements))
+bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<std::string>& schema,
+                          const std::vector<std::string>& statements, Connection& connection, std::string& error,
+                          int& code)
+{
+    std::error_code ignored;
+    std::filesystem::create_directories(path.parent_path(), ignored);
+    auto fail = [&](const std::string& what) {
+        code = connection.database ? sqlite3_extended_errcode(connection.database) & 0xff : SQLITE_CANTOPEN;
+        error = path.string() + ": " + what;
+        disconnect(connection);
+        return false;
+    };
+    if (sqlite3_open_v2(path.c_str(), &connection.database,
+                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK)
+        return fail(std::string("cannot open: ") +
+                    (connection.database ? sqlite3_errmsg(connection.database) : "out of memory"));
+    sqlite3_busy_timeout(connection.database, 5000);
+    // The last step proves that the store can be written, not just read.
+    std::vector<std::string> setup = {"PRAGMA journal_mode=WAL", "PRAGMA synchronous=NORMAL"};
+    setup.insert(setup.end(), schema.begin(), schema.end());
+    setup.insert(setup.end(), {"BEGIN IMMEDIATE", "COMMIT"});
+    for (const auto& sql : setup) {
+        char* message = nullptr;
+        if (sqlite3_exec(connection.database, sql.c_str(), nullptr, nullptr, &message) != SQLITE_OK) {
+            std::string text = message ? message : "error";
+            sqlite3_free(message);
+            return fail(text + " in: " + sql);
+        }
+    }
+    if (sqlite3_db_readonly(connection.database, "main") == 1)
+        return fail("cannot be written");
+    for (const auto& sql : statements) {
+        sqlite3_stmt* statement = nullptr;
+        if (sqlite3_prepare_v3(connection.database, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &statement, nullptr) !=
+            SQLITE_OK)
+            return fail(std::string(sqlite3_errmsg(connection.database)) + " in: " + sql);
+        connection.statements.push_back(statement);
+    }
+    struct stat status {};
+    if (::stat(path.c_str(), &status) != 0)
+        return fail("vanished as it was opened");
+    connection.device = status.st_dev;
+    connection.inode = status.st_ino;
+    return true;
+}
+
+void SqliteStore::disconnect(Connection& connection)
+{
+    for (auto* statement : connection.statements)
+        sqlite3_finalize(statement);
+    connection.statements.clear();
+    sqlite3_close(connection.database);
+    connection.database = nullptr;
+}
+
+SqliteStore::SqliteStore(std::filesystem::path path, std::vector<std::string> schema,
+                         std::vector<std::string> statements, Connection connection)
+    : path_(std::move(path)),
+      schema_(std::move(schema)),
+      statementTexts_(std::move(statements)),
+      connection_(std::move(connection))
 {
     writer_ = std::thread([this] {
         pthread_setname_np(pthread_self(), "mx-store");
@@ -72,9 +138,7 @@ SqliteStore::~SqliteStore()
     }
     changed_.notify_all();
     writer_.join();
-    for (auto* statement : statements_)
-        sqlite3_finalize(statement);
-    sqlite3_close(database_);
+    disconnect(connection_);
 }
 
 void SqliteStore::submit(SqliteWrite write)
@@ -93,6 +157,12 @@ void SqliteStore::flush()
     std::uint64_t target = submitted_;
     changed_.notify_all();
     changed_.wait(lock, [&] { return committed_ >= target; });
+}
+
+std::uint64_t SqliteStore::failures() const
+{
+    std::lock_guard lock(mutex_);
+    return failures_;
 }
 
 void SqliteStore::run()
@@ -116,20 +186,87 @@ void SqliteStore::run()
         }
         changed_.notify_all(); // room in the queue again
         lock.unlock();
-        commit(batch);
+        write(batch);
         lock.lock();
         committed_ += batch.size();
         changed_.notify_all();
     }
 }
 
-void SqliteStore::commit(std::deque<SqliteWrite>& batch)
+// Holds the batch until it commits. Meanwhile nothing more is taken from the queue,
+// which fills, and then callers wait: that is the back-pressure, not a loss.
+void SqliteStore::write(std::deque<SqliteWrite>& batch)
 {
-    // A write that fails (a full disk, a broken file) is logged; the rest of the batch
-    // still commits.
-    sqlite3_exec(database_, "BEGIN", nullptr, nullptr, nullptr);
+    auto retry = kFirstRetry;
+    std::uint64_t attempts = 0;
+    auto began = std::chrono::steady_clock::now();
+    for (;;) {
+        std::string error;
+        if (stillOnDisk(error) && commit(batch, error)) {
+            if (attempts > 0)
+                MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts,
+                      describe(std::chrono::steady_clock::now() - began));
+            return;
+        }
+        std::unique_lock lock(mutex_);
+        ++failures_;
+        if (attempts++ == 0)
+            MXLOG(nullptr, Error,
+                  "{}: cannot write ({}); holding {} rows and retrying, callers wait while {} more queue",
+                  path_.string(), error, batch.size(), kQueueBound);
+        // Only a store being destroyed gives up, and says what it could not keep.
+        if (stopping_ && attempts > 1) {
+            MXLOG(nullptr, Error, "{}: closing with {} rows that could not be written: {}", path_.string(),
+                  batch.size() + queue_.size(), error);
+            return;
+        }
+        changed_.wait_for(lock, retry, [&] { return stopping_; });
+        retry = std::min(retry * 2, kLongestRetry);
+    }
+}
+
+// A file removed under the open connection still takes writes, into nothing: the
+// store makes a new one instead, and a corrupt one is set aside.
+bool SqliteStore::stillOnDisk(std::string& error)
+{
+    struct stat status {};
+    bool present = ::stat(path_.c_str(), &status) == 0 && status.st_dev == connection_.device &&
+        status.st_ino == connection_.inode;
+    if (present && connection_.database)
+        return true;
+    if (connection_.database)
+        MXLOG(nullptr, Error, "{} was removed: making a new one", path_.string());
+    disconnect(connection_);
+    int code = SQLITE_OK;
+    if (connect(path_, schema_, statementTexts_, connection_, error, code))
+        return true;
+    if (isCorruption(code)) {
+        auto aside = setAside(path_);
+        MXLOG(nullptr, Error, "{} is corrupt ({}): set aside as {}", path_.string(), error, aside.filename().string());
+    }
+    return false;
+}
+
+// All or nothing: a batch that fails anywhere is rolled back whole and kept.
+bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
+{
+    sqlite3* database = connection_.database;
+    auto failed = [&](const char* what) {
+        error = std::string(what) + ": " + sqlite3_errmsg(database);
+        int code = sqlite3_extended_errcode(database) & 0xff;
+        sqlite3_exec(database, "ROLLBACK", nullptr, nullptr, nullptr);
+        if (isCorruption(code)) {
+            disconnect(connection_);
+            auto aside = setAside(path_);
+            MXLOG(nullptr, Error, "{} turned corrupt ({}): set aside as {}, making a new one", path_.string(), error,
+                  aside.filename().string());
+        }
+        return false;
+    };
+    if (sqlite3_exec(database, "BEGIN", nullptr, nullptr, nullptr) != SQLITE_OK)
+        return failed("begin");
     for (auto& write : batch) {
-        sqlite3_stmt* statement = statements_[write.statement];
+        sqlite3_stmt* statement = connection_.statements[write.statement];
         for (std::size_t i = 0; i < write.parameters.size(); ++i) {
             int index = static_cast<int>(i) + 1;
             std::visit(
@@ -156,13 +293,15 @@ void SqliteStore::commit(std::deque<SqliteWrite>& batch)
                 },
                 write.parameters[i]);
         }
-        if (sqlite3_step(statement) != SQLITE_DONE)
-            MXLOG(nullptr, Error, "{}: write failed: {}", path_.string(), sqlite3_errmsg(database_));
+        int stepped = sqlite3_step(statement);
         sqlite3_reset(statement);
         sqlite3_clear_bindings(statement);
+        if (stepped != SQLITE_DONE)
+            return failed("insert");
     }
-    if (sqlite3_exec(database_, "COMMIT", nullptr, nullptr, nullptr) != SQLITE_OK)
-        MXLOG(nullptr, Error, "{}: commit failed: {}", path_.string(), sqlite3_errmsg(database_));
+    if (sqlite3_exec(database, "COMMIT", nullptr, nullptr, nullptr) != SQLITE_OK)
+        return failed("commit");
+    return true;
 }
 
 std::int64_t SqliteStore::queryInteger(const std::string& sql)

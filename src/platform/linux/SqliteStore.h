@@ -3,6 +3,11 @@
 // hand over rows and go on; they wait only while the bounded queue in front of the
 // writer is full, so nothing is ever dropped. WAL journaling keeps every committed
 // batch across a crash; destruction commits everything handed over before.
+// Failure policy: a batch that cannot be written (full or read-only disk, the file
+// removed) is held and retried with backoff until it commits, while the queue fills
+// and callers wait; the failure is logged when it starts and when it clears. A file
+// removed while open is noticed and made anew; a corrupt file found at open is set
+// aside and a fresh store made.
 // Thread-safe: any thread may submit.
 
 #include <chrono>
@@ -13,6 +18,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <sys/types.h>
 #include <thread>
 #include <variant>
 #include <vector>
@@ -46,9 +52,12 @@ public:
     // How long the writer lets a batch gather once the first row of it arrived: a
     // thousand rows a millisecond cost one transaction and one wake-up, not a thousand.
     static constexpr std::chrono::milliseconds kBatchWindow{2};
+    // Retries of a failing batch start this soon and slow down to the longest.
+    static constexpr std::chrono::milliseconds kFirstRetry{100};
+    static constexpr std::chrono::milliseconds kLongestRetry{5000};
 
-    // Opens or creates the database, runs `schema`, prepares `statements`. Nothing,
-    // with `error`, when any of that fails.
+    // Opens or creates the database, runs `schema`, prepares `statements`, and makes
+    // sure it can write. Nothing, with `error`, when any of that fails.
     static std::unique_ptr<SqliteStore> open(const std::filesystem::path& path, const std::vector<std::string>& schema,
                                              const std::vector<std::string>& statements, std::string& error);
     ~SqliteStore();
@@ -64,21 +73,41 @@ public:
     std::int64_t queryInteger(const std::string& sql);
 
     const std::filesystem::path& path() const { return path_; }
+    // Failed attempts to write a batch, since the store opened.
+    std::uint64_t failures() const;
 
 private:
-    SqliteStore(std::filesystem::path path, sqlite3* database, std::vector<sqlite3_stmt*> statements);
+    // One open database file with its prepared statements. Writer thread only, once
+    // the store runs.
+    struct Connection {
+        sqlite3* database = nullptr;
+        std::vector<sqlite3_stmt*> statements;
+        dev_t device = 0;
+        ino_t inode = 0;
+    };
+
+    SqliteStore(std::filesystem::path path, std::vector<std::string> schema, std::vector<std::string> statements,
+                Connection connection);
+    static bool connect(const std::filesystem::path& path, const std::vector<std::string>& schema,
+                        const std::vector<std::string>& statements, Connection& connection, std::string& error,
+                        int& code);
+    static void disconnect(Connection& connection);
     void run();
-    void commit(std::deque<SqliteWrite>& batch);
+    void write(std::deque<SqliteWrite>& batch);
+    bool stillOnDisk(std::string& error);
+    bool commit(std::deque<SqliteWrite>& batch, std::string& error);
 
-    std::filesystem::path path_;
-    sqlite3* database_;
-    std::vector<sqlite3_stmt*> statements_;
+    const std::filesystem::path path_;
+    const std::vector<std::string> schema_;
+    const std::vector<std::string> statementTexts_;
+    Connection connection_;
 
-    std::mutex mutex_;
+    mutable std::mutex mutex_;
     std::condition_variable changed_;
     std::deque<SqliteWrite> queue_;
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
+    std::uint64_t failures_ = 0;
     bool stopping_ = false;
     bool writerWaiting_ = false;
     std::thread writer_;
