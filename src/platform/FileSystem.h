@@ -1,6 +1,9 @@
 #pragma once
 // The file system as the daemon writes to it: fixed platform paths placed under this
-// host's root, directories made with exact permissions, files replaced atomically.
+// host's root, directories made with the permissions asked for as the process umask
+// filters them, files replaced atomically. Below the host's root no symbolic link is
+// followed: a link planted in place of a directory makes the write fail instead of
+// sending it elsewhere.
 
 #include <filesystem>
 #include <optional>
@@ -17,8 +20,8 @@ public:
     virtual ~FileSystem() = default;
     // Where the platform path `path` ("/private/var/...") lives on this host.
     virtual std::filesystem::path resolve(const std::string& path) = 0;
-    // Creates `directory` and every missing parent with exactly `mode`; an existing
-    // directory is success. The reason on failure.
+    // Creates `directory` and every missing parent with `mode` (never widened past the
+    // umask); an existing directory is success. The reason on failure.
     virtual std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode) = 0;
     // Replaces `file` with `contents` so that readers see the old file or the new one,
     // never a part. The reason on failure.

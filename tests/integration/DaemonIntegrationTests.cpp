@@ -384,6 +384,22 @@ TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
     }));
 }
 
+TEST_F(DaemonIntegrationTest, ASymlinkPlantedForTheSummaryDirectoryIsNotFollowed)
+{
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    auto elsewhere = daemon.path("elsewhere");
+    std::filesystem::create_directories(elsewhere);
+    std::filesystem::create_directories(daemon.path("var/log/harmonia"));
+    std::filesystem::create_directory_symlink(elsewhere, daemon.path("var/log/harmonia/reporting"));
+    auto client = connect();
+    ASSERT_TRUE(*client->createReportingSession(5).value);
+    client->startReportingSessionForID(5, nullptr);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<ReporterID>{5}));
+    ASSERT_TRUE(*client->stopReportingSessionForID(5).value);
+    EXPECT_TRUE(daemon.waitForLog("var/log/harmonia/reporting is not a directory"));
+    EXPECT_TRUE(std::filesystem::is_empty(elsewhere));
+}
+
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();

@@ -1,6 +1,8 @@
 #include "Statistics/Service/MxReportingSessionSummary.h"
 
+#include <algorithm>
 #include <map>
+#include <string_view>
 #include <vector>
 
 #include <fmt/format.h>
@@ -18,6 +20,35 @@ constexpr const char* kSummaryDirectory = "/var/log/harmonia/reporting";
 constexpr std::size_t kMaximumHostBytes = 128;
 
 const MxLogScope* logScope() { return MxReportingSession::logScope(); }
+
+// "/", control characters and the Unicode direction controls (the marks, embeddings,
+// overrides and isolates) each become "_".
+std::string withoutUnsafeCharacters(const std::string& text)
+{
+    static constexpr std::string_view kDirectionControls[] = {"\u061C", "\u200E", "\u200F", "\u202A",
+                                                              "\u202B", "\u202C", "\u202D", "\u202E",
+                                                              "\u2066", "\u2067", "\u2068", "\u2069"};
+    std::string safe;
+    safe.reserve(text.size());
+    for (std::size_t i = 0; i < text.size();) {
+        auto byte = static_cast<unsigned char>(text[i]);
+        if (byte == '/' || byte < 0x20 || byte == 0x7f) {
+            safe += '_';
+            ++i;
+            continue;
+        }
+        std::string_view rest = std::string_view(text).substr(i);
+        auto control = std::find_if(std::begin(kDirectionControls), std::end(kDirectionControls),
+                                    [&](std::string_view candidate) { return rest.starts_with(candidate); });
+        if (control != std::end(kDirectionControls)) {
+            safe += '_';
+            i += control->size();
+            continue;
+        }
+        safe += text[i++];
+    }
+    return safe;
+}
 
 } // namespace
 
@@ -67,11 +98,10 @@ std::string MxReportingSessionSummary::summaryFileName(std::time_t now, const Di
     std::string host = "unknown";
     if (const Value* stored = userInfo.find("HostApplicationDisplayID"))
         host = stored->description();
-    // The host is the client's text: it must not name another directory, nor make the
-    // name longer than a file name may be.
-    for (char& c : host)
-        if (c == '/' || c == '\0')
-            c = '_';
+    // The host is the client's text: it must not name another directory, break a line
+    // of a listing, turn the rest of a name around, nor make the name longer than a
+    // file name may be.
+    host = withoutUnsafeCharacters(host);
     if (host.size() > kMaximumHostBytes)
         host.resize(kMaximumHostBytes);
     return fmt::format("{}-{}-{}-{}.json", date, "harmonia", host, MxReportingServiceTypeName(serviceType));

@@ -6,6 +6,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <fmt/format.h>
+
 #include "wire/RootPath.h"
 
 namespace mx {
@@ -23,55 +25,102 @@ std::string errnoText(int error)
 
 std::filesystem::path PosixFileSystem::resolve(const std::string& path) { return MxReportingPath(path); }
 
+namespace {
+
+// Closes a descriptor when it goes out of scope.
+class Descriptor {
+public:
+    explicit Descriptor(int fd = -1) : fd_(fd) {}
+    ~Descriptor()
+    {
+        if (fd_ >= 0)
+            ::close(fd_);
+    }
+    Descriptor(const Descriptor&) = delete;
+    Descriptor& operator=(const Descriptor&) = delete;
+    Descriptor& operator=(Descriptor&& other) noexcept
+    {
+        std::swap(fd_, other.fd_);
+        return *this;
+    }
+    int get() const { return fd_; }
+
+private:
+    int fd_;
+};
+
+// The directory `directory`: the host's root opened as it is, every component below
+// it without following a symbolic link, and made with `mode` where missing when
+// `create` says so.
+std::optional<std::string> openDirectory(const std::filesystem::path& directory, bool create, mode_t mode,
+                                         Descriptor& opened)
+{
+    std::filesystem::path root = MxReportingRoot();
+    std::filesystem::path below = directory.lexically_relative(root);
+    if (below.empty() || *below.begin() == "..") {
+        root = "/";
+        below = directory.relative_path();
+    }
+    Descriptor current(::open(root.c_str(), O_DIRECTORY | O_RDONLY | O_CLOEXEC));
+    if (current.get() < 0)
+        return root.string() + ": " + errnoText(errno);
+    std::filesystem::path walked = root;
+    for (const auto& component : below) {
+        if (component == "." || component.empty())
+            continue;
+        walked /= component;
+        if (create && mkdirat(current.get(), component.c_str(), mode) != 0 && errno != EEXIST)
+            return walked.string() + ": " + errnoText(errno);
+        Descriptor next(openat(current.get(), component.c_str(), O_DIRECTORY | O_NOFOLLOW | O_RDONLY | O_CLOEXEC));
+        if (next.get() < 0)
+            return walked.string() +
+                (errno == ELOOP || errno == ENOTDIR ? " is not a directory" : ": " + errnoText(errno));
+        current = std::move(next);
+    }
+    opened = std::move(current);
+    return std::nullopt;
+}
+
+} // namespace
+
 std::optional<std::string> PosixFileSystem::createDirectories(const std::filesystem::path& directory, mode_t mode)
 {
-    std::filesystem::path partial;
-    for (const auto& component : directory) {
-        partial /= component;
-        if (mkdir(partial.c_str(), mode) == 0) {
-            // The process umask would otherwise narrow the mode asked for.
-            chmod(partial.c_str(), mode);
-            continue;
-        }
-        if (errno != EEXIST)
-            return errnoText(errno);
-        struct stat status {};
-        if (stat(partial.c_str(), &status) != 0 || !S_ISDIR(status.st_mode))
-            return partial.string() + " exists and is not a directory";
-    }
-    return std::nullopt;
+    Descriptor opened;
+    return openDirectory(directory, true, mode, opened);
 }
 
 std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesystem::path& file,
                                                             std::string_view contents)
 {
-    std::string temporary = (file.parent_path() / ("." + file.filename().string() + ".XXXXXX")).string();
-    int fd = mkstemp(temporary.data());
-    if (fd < 0)
+    Descriptor directory;
+    if (auto failure = openDirectory(file.parent_path(), false, 0, directory))
+        return failure;
+    std::string name = file.filename().string();
+    std::string temporary = fmt::format(".{}.{}.{}", name, getpid(), ++temporaries_);
+    Descriptor out(
+        openat(directory.get(), temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0666));
+    if (out.get() < 0)
         return errnoText(errno);
     const char* data = contents.data();
     std::size_t left = contents.size();
     while (left > 0) {
-        ssize_t written = ::write(fd, data, left);
+        ssize_t written = ::write(out.get(), data, left);
         if (written < 0 && errno == EINTR)
             continue;
         if (written < 0) {
             std::string reason = errnoText(errno);
-            ::close(fd);
-            unlink(temporary.c_str());
+            unlinkat(directory.get(), temporary.c_str(), 0);
             return reason;
         }
         data += written;
         left -= std::size_t(written);
     }
-    fchmod(fd, 0644);
-    bool synced = fsync(fd) == 0;
-    ::close(fd);
-    if (!synced || rename(temporary.c_str(), file.c_str()) != 0) {
+    if (fsync(out.get()) != 0 || renameat(directory.get(), temporary.c_str(), directory.get(), name.c_str()) != 0) {
         std::string reason = errnoText(errno);
-        unlink(temporary.c_str());
+        unlinkat(directory.get(), temporary.c_str(), 0);
         return reason;
     }
+    fsync(directory.get());
     return std::nullopt;
 }
 

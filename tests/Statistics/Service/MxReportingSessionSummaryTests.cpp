@@ -82,6 +82,8 @@ TEST_F(MxReportingSessionSummaryTest, HostNamesNeverLeaveTheDirectoryAndUnnamedH
     auto name = session->summaryFileName(0);
     EXPECT_EQ(name.find('/'), std::string::npos);
     EXPECT_THAT(name, ::testing::EndsWith("-harmonia-.._.._etc_passwd-telephony.json"));
+    session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "a\nb\x7f\u202Egpj.exe\u2066c"}});
+    EXPECT_THAT(session->summaryFileName(0), ::testing::EndsWith("-harmonia-a_b__gpj.exe_c-telephony.json"));
 }
 
 TEST_F(MxReportingSessionSummaryTest, NothingIsWrittenWithoutMessagesOrOnCustomerBuilds)
