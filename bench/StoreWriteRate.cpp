@@ -14,6 +14,7 @@
 #include "platform/JsonValue.h"
 #include "platform/MxLog.h"
 #include "platform/linux/SqliteTally.h"
+#include "platform/linux/StoreLimits.h"
 
 using namespace mx;
 using Clock = std::chrono::steady_clock;
@@ -65,7 +66,7 @@ double bareInsert(const std::filesystem::path& file, int events)
 double storeInsert(const std::filesystem::path& directory, int events)
 {
     std::string error;
-    auto tally = SqliteTally::open(directory / "tally.db", directory / "absent.json", error);
+    auto tally = SqliteTally::open(directory / "tally.db", directory / "absent.json", StoreLimit{}, error);
     auto began = Clock::now();
     for (int i = 0; i < events; ++i)
         tally->sendEventLazy("com.kestrel.harmonia.Session_Playback.Start", [i] { return payload(i); });

@@ -5,6 +5,7 @@
 // followed: a link planted in place of a directory makes the write fail instead of
 // sending it elsewhere.
 
+#include <cstdint>
 #include <filesystem>
 #include <optional>
 #include <string>
@@ -27,6 +28,10 @@ public:
     // never a part. The reason on failure.
     virtual std::optional<std::string> writeAtomically(const std::filesystem::path& file,
                                                        std::string_view contents) = 0;
+    // Removes the oldest files of `directory` (by modification time) until at most
+    // `maxFiles` remain, holding at most `maxBytes` together. How many went.
+    virtual std::size_t trimDirectory(const std::filesystem::path& directory, std::size_t maxFiles,
+                                      std::uint64_t maxBytes) = 0;
 };
 
 } // namespace mx

@@ -162,6 +162,8 @@ public:
         return std::nullopt;
     }
 
+    std::size_t trimDirectory(const std::filesystem::path&, std::size_t, std::uint64_t) override { return 0; }
+
     std::map<std::filesystem::path, mode_t> directories;
     std::map<std::filesystem::path, std::string> files;
     std::optional<std::string> directoryFailure;

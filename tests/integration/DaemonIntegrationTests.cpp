@@ -400,6 +400,52 @@ TEST_F(DaemonIntegrationTest, ASymlinkPlantedForTheSummaryDirectoryIsNotFollowed
     EXPECT_TRUE(std::filesystem::is_empty(elsewhere));
 }
 
+TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRowsCounted)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    daemon.writeFile(
+        "etc/harmonia/stores.json",
+        R"({"tally": {"max_bytes": 200000}, "uplink": {"max_bytes": 200000}, "summaries": {"max_files": 2}})");
+    // A collector that never answers: nothing in the spool is ever acknowledged.
+    daemon.writeFile(
+        "etc/harmonia/uplink.json",
+        R"({"backends": [{"type": "spool"}, {"type": "otlp-http", "url": "http://127.0.0.1:9/v1/logs"}]})");
+    daemon.start();
+    std::string error;
+    auto client = MxReportingClient::connect(daemon.socketPath(), error);
+    ASSERT_TRUE(client) << error;
+    for (ReporterID id = 1; id <= 4; ++id) {
+        ASSERT_TRUE(*client->createReportingSession(id).value);
+        ASSERT_TRUE(*client->setServiceType(11, id).value); // test sessions: no backend waits
+        ASSERT_TRUE(
+            *client->setConfiguration(Dictionary{{"HostApplicationDisplayID", fmt::format("h{}", id)}}, id).value);
+        client->startReportingSessionForID(id, nullptr);
+        ASSERT_TRUE(client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<ReporterID>{id}));
+        ASSERT_TRUE(*client->stopReportingSessionForID(id).value);
+    }
+    Dictionary report{{"filler", std::string(200, 'f')}};
+    for (int i = 0; i < 3000; ++i)
+        client->sendMessage(report, 1, 0, std::vector<ReporterID>{4}, nullptr); // to analytics
+    for (int i = 0; i < 3000; ++i)
+        client->sendMessage(report, 1, 0, std::nullopt, nullptr); // alone, to the spool
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"last", 1}}, 1, 0, std::nullopt));
+    EXPECT_TRUE(daemon.waitForLog("tally.db: pruned"));
+    EXPECT_TRUE(daemon.waitForLog("had not been exported to every collector"));
+    daemon.signal(SIGTERM);
+    ASSERT_EQ(daemon.waitForExit(), 0);
+    auto rows = std::stoi(daemon.query("tally", "SELECT count(*) FROM events")[0][0]);
+    EXPECT_GT(rows, 0);
+    EXPECT_LT(rows, 2000) << "200 kB hold far fewer than 3000 reports";
+    EXPECT_EQ(daemon.query("tally", "SELECT min(id) > 1 AND max(id) >= 3004 FROM events")[0][0], "1")
+        << "the oldest went, the newest stayed";
+    std::size_t summaries = 0;
+    for ([[maybe_unused]] const auto& entry :
+         std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting")))
+        ++summaries;
+    EXPECT_EQ(summaries, 2u);
+}
+
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();

@@ -1,6 +1,8 @@
 #include "Statistics/Service/MxReportingSessionSummary.h"
 
 #include <algorithm>
+#include <atomic>
+#include <limits>
 #include <map>
 #include <string_view>
 #include <vector>
@@ -18,6 +20,9 @@ namespace {
 
 constexpr const char* kSummaryDirectory = "/var/log/harmonia/reporting";
 constexpr std::size_t kMaximumHostBytes = 128;
+
+std::atomic<std::size_t> gMaximumFiles{std::numeric_limits<std::size_t>::max()};
+std::atomic<std::uint64_t> gMaximumBytes{std::numeric_limits<std::uint64_t>::max()};
 
 const MxLogScope* logScope() { return MxReportingSession::logScope(); }
 
@@ -86,6 +91,12 @@ std::optional<Dictionary> MxReportingSessionSummary::createSummaryEvent(const Mx
     return summary;
 }
 
+void MxReportingSessionSummary::setRetention(std::size_t maxFiles, std::uint64_t maxBytes)
+{
+    gMaximumFiles.store(maxFiles);
+    gMaximumBytes.store(maxBytes);
+}
+
 std::string MxReportingSessionSummary::summaryFileName(std::time_t now, const Dictionary& userInfo,
                                                        ServiceType serviceType)
 {
@@ -135,8 +146,12 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
     if (text.empty())
         return;
     if (auto failure =
-            fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text))
+            fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text)) {
         MXLOG(logScope(), Error, "jsonOutput writeToURL: {}", *failure);
+        return;
+    }
+    if (std::size_t removed = fileSystem.trimDirectory(directory, gMaximumFiles.load(), gMaximumBytes.load()))
+        MXLOG(logScope(), Info, "removed the {} oldest summary files beyond the limits", removed);
 }
 
 } // namespace mx

@@ -28,6 +28,10 @@ public:
     static void writeSummaryJson(MxReportingAggregationArray* nested, const Dictionary& userInfo,
                                  ServiceType serviceType);
 
+    // The most summary files kept, and the most bytes they take together; the oldest
+    // go first. Set once at start-up; both unbounded until then.
+    static void setRetention(std::size_t maxFiles, std::uint64_t maxBytes);
+
     // "<local time>-harmonia-<host>-<service type name>.json", the host made safe to
     // stand in one file name.
     static std::string summaryFileName(std::time_t now, const Dictionary& userInfo, ServiceType serviceType);

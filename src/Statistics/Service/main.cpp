@@ -15,6 +15,7 @@
 #include <systemd/sd-daemon.h>
 
 #include "Statistics/Service/MxReportingServiceDelegate.h"
+#include "Statistics/Service/MxReportingSessionSummary.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/InstanceLock.h"
@@ -28,6 +29,7 @@
 #include "platform/linux/SqliteJoule.h"
 #include "platform/linux/SqliteTally.h"
 #include "platform/linux/StderrLogSink.h"
+#include "platform/linux/StoreLimits.h"
 #include "platform/linux/UsdtTracePoints.h"
 #include "wire/RootPath.h"
 
@@ -97,18 +99,22 @@ int run(int argc, char** argv)
     JsonDeviceProperties deviceProperties(MxReportingPath("etc/harmonia/device.json"));
     ProcessWide<DeviceProperties>::install(&deviceProperties);
 
+    auto limits = StoreLimits::read(MxReportingPath("etc/harmonia/stores.json"), error);
+    if (!limits)
+        fail(error);
+    MxReportingSessionSummary::setRetention(limits->summaries.maxFiles, limits->summaries.maxBytes);
     auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"),
-                                   MxReportingPath("etc/harmonia/tally.json"), error);
+                                   MxReportingPath("etc/harmonia/tally.json"), limits->tally, error);
     if (!tally)
         fail(error);
     ProcessWide<Tally>::install(tally.get());
-    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), error);
+    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), limits->joule, error);
     if (!joule)
         fail(error);
     ProcessWide<Joule>::install(joule.get());
     curl_global_init(CURL_GLOBAL_DEFAULT);
     auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"),
-                                    MxReportingPath("etc/harmonia/uplink.json"), error);
+                                    MxReportingPath("etc/harmonia/uplink.json"), limits->uplink, error);
     if (!uplink)
         fail(error);
     ProcessWide<Uplink>::install(uplink.get());

@@ -1,10 +1,12 @@
 #include "platform/linux/PosixFileSystem.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <vector>
 
 #include <fmt/format.h>
 
@@ -122,6 +124,38 @@ std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesyste
     }
     fsync(directory.get());
     return std::nullopt;
+}
+
+std::size_t PosixFileSystem::trimDirectory(const std::filesystem::path& directory, std::size_t maxFiles,
+                                           std::uint64_t maxBytes)
+{
+    Descriptor opened;
+    if (openDirectory(directory, false, 0, opened))
+        return 0;
+    struct File {
+        std::string name;
+        std::int64_t modified;
+        std::uint64_t bytes;
+    };
+    std::vector<File> files;
+    std::error_code failure;
+    for (const auto& entry : std::filesystem::directory_iterator(directory, failure)) {
+        struct stat status {};
+        std::string name = entry.path().filename().string();
+        if (fstatat(opened.get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode))
+            files.push_back({name, status.st_mtim.tv_sec * 1'000'000'000 + status.st_mtim.tv_nsec,
+                             static_cast<std::uint64_t>(status.st_size)});
+    }
+    std::sort(files.begin(), files.end(), [](const File& a, const File& b) { return a.modified > b.modified; });
+    std::uint64_t kept = 0;
+    std::size_t removed = 0;
+    for (std::size_t i = 0; i < files.size(); ++i) {
+        kept += files[i].bytes;
+        if ((i < maxFiles && kept <= maxBytes) || unlinkat(opened.get(), files[i].name.c_str(), 0) != 0)
+            continue;
+        ++removed;
+    }
+    return removed;
 }
 
 } // namespace mx

@@ -15,6 +15,8 @@ public:
     std::filesystem::path resolve(const std::string& path) override;
     std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode) override;
     std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents) override;
+    std::size_t trimDirectory(const std::filesystem::path& directory, std::size_t maxFiles,
+                              std::uint64_t maxBytes) override;
 
 private:
     std::atomic<std::uint64_t> temporaries_{0};

@@ -3,10 +3,12 @@
 #include <fstream>
 #include <random>
 
+#include <fmt/format.h>
 #include <nlohmann/json.hpp>
 
 #include "platform/JsonValue.h"
 #include "platform/linux/SpoolUplinkSession.h"
+#include "platform/linux/StoreLimits.h"
 
 namespace mx {
 
@@ -43,10 +45,48 @@ bool readBackends(const std::filesystem::path& configuration, bool& spoolListed,
 
 constexpr auto kSettleTimeout = std::chrono::seconds(10);
 
+// Spool rows go oldest first, those every collector acknowledged before any other. A
+// one-shot or realtime message is acknowledged by a collector whose stream cursor
+// passed it, a batch session's message by one that exported its session.
+SqliteRetention spoolRetention(const StoreLimit& limit, const std::vector<std::string>& collectors)
+{
+    std::string acknowledged = "1";
+    if (!collectors.empty()) {
+        std::string listed;
+        for (const auto& url : collectors) {
+            std::string quoted = url;
+            for (std::size_t at = quoted.find('\''); at != std::string::npos; at = quoted.find('\'', at + 2))
+                quoted.insert(at, 1, '\'');
+            listed += (listed.empty() ? "'" : ", '") + quoted + "'";
+        }
+        acknowledged = fmt::format(
+            "(CASE WHEN m.session IS NULL OR json_extract(s.session_info, '$.ContainsRealtimeEvents') = 1 "
+            "THEN (SELECT count(*) FROM exports e WHERE e.backend IN ({0}) AND e.stream_cursor >= m.id) "
+            "ELSE (SELECT count(*) FROM exported_sessions e WHERE e.backend IN ({0}) AND e.session = m.session) "
+            "END) = {1}",
+            listed, collectors.size());
+    }
+    auto select = [&](const std::string& condition, const std::string& count) {
+        return fmt::format("DELETE FROM messages WHERE id IN (SELECT m.id FROM messages m LEFT JOIN sessions s "
+                           "ON s.id = m.session WHERE {} ORDER BY m.id LIMIT {})",
+                           condition, count);
+    };
+    bool collecting = !collectors.empty();
+    SqliteRetention retention{limit.maxBytes, limit.maxAge, {}, {}, {}};
+    retention.olderThan = {{select("m.time < ?1 AND " + acknowledged, "?2")},
+                           {select("m.time < ?1", "?2"), collecting}};
+    retention.oldest = {{select(acknowledged, "?1")}, {select("1", "?1"), collecting}};
+    retention.tidy = {"DELETE FROM sessions WHERE flushed IS NOT NULL AND id < (SELECT max(id) FROM sessions) "
+                      "AND NOT EXISTS (SELECT 1 FROM messages WHERE session = sessions.id)",
+                      "DELETE FROM exported_sessions WHERE session NOT IN (SELECT id FROM sessions)"};
+    return retention;
+}
+
 } // namespace
 
 std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& database,
-                                               const std::filesystem::path& configuration, std::string& error)
+                                               const std::filesystem::path& configuration, const StoreLimit& limit,
+                                               std::string& error)
 {
     bool spoolListed = false;
     std::vector<std::string> collectors;
@@ -64,7 +104,7 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
          "UPDATE sessions SET flushed = ? WHERE id = ?",
          "INSERT INTO messages(session, time, category, type, payload, session_info, user_info) "
          "VALUES(?, ?, ?, ?, ?, ?, ?)"},
-        error);
+        spoolRetention(limit, collectors), error);
     if (!store)
         return nullptr;
     return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store), spoolListed, collectors));

@@ -19,12 +19,15 @@
 
 namespace mx {
 
+struct StoreLimit;
+
 class SpoolUplink final : public Uplink, public std::enable_shared_from_this<SpoolUplink> {
 public:
     // The spool at `database`, exporting to the backends that `configuration`
     // (uplink.json) lists; without that file, the spool alone.
     static std::shared_ptr<SpoolUplink> open(const std::filesystem::path& database,
-                                             const std::filesystem::path& configuration, std::string& error);
+                                             const std::filesystem::path& configuration, const StoreLimit& limit,
+                                             std::string& error);
     ~SpoolUplink() override;
 
     UplinkSecureHierarchyToken newSecureHierarchyToken(const UplinkSecureHierarchyToken* parent) override;

@@ -1,15 +1,18 @@
 #include "platform/linux/SqliteJoule.h"
 
 #include "platform/JsonValue.h"
+#include "platform/linux/StoreLimits.h"
 
 namespace mx {
 
-std::unique_ptr<SqliteJoule> SqliteJoule::open(const std::filesystem::path& database, std::string& error)
+std::unique_ptr<SqliteJoule> SqliteJoule::open(const std::filesystem::path& database, const StoreLimit& limit,
+                                               std::string& error)
 {
     auto store = SqliteStore::open(database,
                                    {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, "
                                     "agent INTEGER, name TEXT, payload TEXT)"},
-                                   {"INSERT INTO events(time, agent, name, payload) VALUES(?, ?, ?, ?)"}, error);
+                                   {"INSERT INTO events(time, agent, name, payload) VALUES(?, ?, ?, ?)"},
+                                   eventsRetention(limit), error);
     if (!store)
         return nullptr;
     return std::unique_ptr<SqliteJoule>(new SqliteJoule(std::move(store)));

@@ -9,9 +9,12 @@
 
 namespace mx {
 
+struct StoreLimit;
+
 class SqliteJoule final : public Joule {
 public:
-    static std::unique_ptr<SqliteJoule> open(const std::filesystem::path& database, std::string& error);
+    static std::unique_ptr<SqliteJoule> open(const std::filesystem::path& database, const StoreLimit& limit,
+                                             std::string& error);
 
     void logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event,
                             const Dictionary* options) override;

@@ -46,7 +46,8 @@ std::string describe(std::chrono::steady_clock::duration duration)
 
 std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path,
                                                const std::vector<std::string>& schema,
-                                               const std::vector<std::string>& statements, std::string& error)
+                                               const std::vector<std::string>& statements, SqliteRetention retention,
+                                               std::string& error)
 {
     Connection connection;
     int code = SQLITE_OK;
@@ -59,7 +60,7 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
         if (!connect(path, schema, statements, connection, error, code))
             return nullptr;
     }
-    return std::unique_ptr<SqliteStore>(new SqliteStore(path, schema, statements, connection));
+    return std::unique_ptr<SqliteStore>(new SqliteStore(path, schema, statements, std::move(retention), connection));
 }
 
 bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<std::string>& schema,
@@ -80,7 +81,9 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
                     (connection.database ? sqlite3_errmsg(connection.database) : "out of memory"));
     sqlite3_busy_timeout(connection.database, 5000);
     // The last step proves that the store can be written, not just read.
-    std::vector<std::string> setup = {"PRAGMA journal_mode=WAL", "PRAGMA synchronous=NORMAL"};
+    // A new store gives pruned pages back to the file system; an older one reuses them.
+    std::vector<std::string> setup = {"PRAGMA auto_vacuum=INCREMENTAL", "PRAGMA journal_mode=WAL",
+                                      "PRAGMA synchronous=NORMAL"};
     setup.insert(setup.end(), schema.begin(), schema.end());
     setup.insert(setup.end(), {"BEGIN IMMEDIATE", "COMMIT"});
     for (const auto& sql : setup) {
@@ -118,10 +121,11 @@ void SqliteStore::disconnect(Connection& connection)
 }
 
 SqliteStore::SqliteStore(std::filesystem::path path, std::vector<std::string> schema,
-                         std::vector<std::string> statements, Connection connection)
+                         std::vector<std::string> statements, SqliteRetention retention, Connection connection)
     : path_(std::move(path)),
       schema_(std::move(schema)),
       statementTexts_(std::move(statements)),
+      retention_(std::move(retention)),
       connection_(std::move(connection))
 {
     writer_ = std::thread([this] {
@@ -187,9 +191,101 @@ void SqliteStore::run()
         changed_.notify_all(); // room in the queue again
         lock.unlock();
         write(batch);
+        // Age is looked at now and then; size after every batch, which costs three
+        // page counts, so that a burst never takes the store far past its bound.
+        if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval ||
+            (retention_.maxBytes > 0 && connection_.database && dataBytes() > retention_.maxBytes))
+            prune();
         lock.lock();
         committed_ += batch.size();
         changed_.notify_all();
+    }
+}
+
+std::uint64_t SqliteStore::prunedUnexported() const
+{
+    std::lock_guard lock(mutex_);
+    return prunedUnexported_;
+}
+
+std::uint64_t SqliteStore::dataBytes()
+{
+    auto pragma = [&](const char* sql) {
+        sqlite3_stmt* statement = nullptr;
+        std::int64_t value = 0;
+        if (sqlite3_prepare_v2(connection_.database, sql, -1, &statement, nullptr) == SQLITE_OK &&
+            sqlite3_step(statement) == SQLITE_ROW)
+            value = sqlite3_column_int64(statement, 0);
+        sqlite3_finalize(statement);
+        return value;
+    };
+    std::int64_t used = pragma("PRAGMA page_count") - pragma("PRAGMA freelist_count");
+    return static_cast<std::uint64_t>(std::max<std::int64_t>(0, used) * pragma("PRAGMA page_size"));
+}
+
+// Rows removed by one step in one transaction, or -1 when it failed.
+std::int64_t SqliteStore::pruneStep(const SqliteRetention::Step& step, std::int64_t cutoff)
+{
+    sqlite3_stmt* statement = nullptr;
+    if (sqlite3_prepare_v2(connection_.database, step.sql.c_str(), -1, &statement, nullptr) != SQLITE_OK) {
+        MXLOG(nullptr, Error, "{}: cannot prune: {}", path_.string(), sqlite3_errmsg(connection_.database));
+        return -1;
+    }
+    if (cutoff != 0) {
+        sqlite3_bind_int64(statement, 1, cutoff);
+        sqlite3_bind_int64(statement, 2, kAgeChunk);
+    } else {
+        sqlite3_bind_int64(statement, 1, kSizeChunk);
+    }
+    int stepped = sqlite3_step(statement);
+    sqlite3_finalize(statement);
+    if (stepped != SQLITE_DONE)
+        return -1;
+    return sqlite3_changes(connection_.database);
+}
+
+void SqliteStore::prune()
+{
+    lastPrune_ = std::chrono::steady_clock::now();
+    if (!connection_.database)
+        return;
+    std::int64_t pruned = 0;
+    std::int64_t unexported = 0;
+    auto run = [&](const SqliteRetention::Step& step, std::int64_t cutoff) {
+        std::int64_t removed = pruneStep(step, cutoff);
+        if (removed > 0) {
+            pruned += removed;
+            if (step.unexported)
+                unexported += removed;
+        }
+        return removed;
+    };
+    if (retention_.maxAge.count() > 0) {
+        auto cutoff = static_cast<std::int64_t>(secondsSinceEpoch()) - retention_.maxAge.count();
+        for (const auto& step : retention_.olderThan)
+            while (run(step, cutoff) == kAgeChunk) {}
+    }
+    if (retention_.maxBytes > 0)
+        while (static_cast<double>(dataBytes()) > kSizeLowWater * static_cast<double>(retention_.maxBytes)) {
+            bool removedAny = false;
+            for (const auto& step : retention_.oldest)
+                if (run(step, 0) > 0) {
+                    removedAny = true;
+                    break;
+                }
+            if (!removedAny)
+                break;
+        }
+    if (pruned == 0)
+        return;
+    for (const auto& sql : retention_.tidy)
+        sqlite3_exec(connection_.database, sql.c_str(), nullptr, nullptr, nullptr);
+    sqlite3_exec(connection_.database, "PRAGMA incremental_vacuum", nullptr, nullptr, nullptr);
+    MXLOG(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(), pruned);
+    if (unexported > 0) {
+        MXLOG(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(), unexported);
+        std::lock_guard lock(mutex_);
+        prunedUnexported_ += static_cast<std::uint64_t>(unexported);
     }
 }
 

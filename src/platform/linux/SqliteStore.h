@@ -40,6 +40,24 @@ using SqliteDeferredDictionary = std::shared_ptr<UniqueFunction<Dictionary()>>;
 using SqliteValue =
     std::variant<std::nullptr_t, std::int64_t, double, std::string, Dictionary, SqliteDeferredDictionary>;
 
+// How much a store keeps. Rows older than `maxAge` go, and while the rows take more
+// than `maxBytes`, the oldest go; pruning runs on the writer thread between batches.
+// Each step is a DELETE of up to a number of the oldest rows: for age, ?1 is the
+// cutoff (seconds since the epoch) and ?2 the number; for size, ?1 the number. Steps
+// run in order, so rows already exported go before those that are not; the rows of a
+// step marked `unexported` are counted and logged as lost to export.
+struct SqliteRetention {
+    struct Step {
+        std::string sql;
+        bool unexported = false;
+    };
+    std::uint64_t maxBytes = 0;    // 0: no bound
+    std::chrono::seconds maxAge{}; // 0: no bound
+    std::vector<Step> olderThan;
+    std::vector<Step> oldest;
+    std::vector<std::string> tidy; // run after rows went, e.g. for rows that refer to them
+};
+
 struct SqliteWrite {
     std::size_t statement; // index into the statements given at open
     std::vector<SqliteValue> parameters;
@@ -55,11 +73,19 @@ public:
     // Retries of a failing batch start this soon and slow down to the longest.
     static constexpr std::chrono::milliseconds kFirstRetry{100};
     static constexpr std::chrono::milliseconds kLongestRetry{5000};
+    // How often the writer prunes by age, and how many rows one pruning transaction
+    // removes: by age, many at a time; by size, few, so as not to overshoot a small
+    // bound. A store past its size is pruned to 90% of it, not again at every batch.
+    static constexpr std::chrono::seconds kPruneInterval{10};
+    static constexpr std::int64_t kAgeChunk = 2000;
+    static constexpr std::int64_t kSizeChunk = 100;
+    static constexpr double kSizeLowWater = 0.9;
 
     // Opens or creates the database, runs `schema`, prepares `statements`, and makes
     // sure it can write. Nothing, with `error`, when any of that fails.
     static std::unique_ptr<SqliteStore> open(const std::filesystem::path& path, const std::vector<std::string>& schema,
-                                             const std::vector<std::string>& statements, std::string& error);
+                                             const std::vector<std::string>& statements, SqliteRetention retention,
+                                             std::string& error);
     ~SqliteStore();
     SqliteStore(const SqliteStore&) = delete;
     SqliteStore& operator=(const SqliteStore&) = delete;
@@ -75,6 +101,8 @@ public:
     const std::filesystem::path& path() const { return path_; }
     // Failed attempts to write a batch, since the store opened.
     std::uint64_t failures() const;
+    // Rows pruned before they were exported, since the store opened.
+    std::uint64_t prunedUnexported() const;
 
 private:
     // One open database file with its prepared statements. Writer thread only, once
@@ -87,7 +115,7 @@ private:
     };
 
     SqliteStore(std::filesystem::path path, std::vector<std::string> schema, std::vector<std::string> statements,
-                Connection connection);
+                SqliteRetention retention, Connection connection);
     static bool connect(const std::filesystem::path& path, const std::vector<std::string>& schema,
                         const std::vector<std::string>& statements, Connection& connection, std::string& error,
                         int& code);
@@ -96,11 +124,16 @@ private:
     void write(std::deque<SqliteWrite>& batch);
     bool stillOnDisk(std::string& error);
     bool commit(std::deque<SqliteWrite>& batch, std::string& error);
+    void prune();
+    std::int64_t pruneStep(const SqliteRetention::Step& step, std::int64_t cutoff);
+    std::uint64_t dataBytes();
 
     const std::filesystem::path path_;
     const std::vector<std::string> schema_;
     const std::vector<std::string> statementTexts_;
+    const SqliteRetention retention_;
     Connection connection_;
+    std::chrono::steady_clock::time_point lastPrune_{};
 
     mutable std::mutex mutex_;
     std::condition_variable changed_;
@@ -108,6 +141,7 @@ private:
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
     std::uint64_t failures_ = 0;
+    std::uint64_t prunedUnexported_ = 0;
     bool stopping_ = false;
     bool writerWaiting_ = false;
     std::thread writer_;

@@ -5,6 +5,7 @@
 
 #include "platform/JsonValue.h"
 #include "platform/MxLog.h"
+#include "platform/linux/StoreLimits.h"
 
 namespace mx {
 
@@ -30,11 +31,12 @@ std::vector<std::string> readDisabled(const std::filesystem::path& configuration
 } // namespace
 
 std::unique_ptr<SqliteTally> SqliteTally::open(const std::filesystem::path& database,
-                                               const std::filesystem::path& configuration, std::string& error)
+                                               const std::filesystem::path& configuration, const StoreLimit& limit,
+                                               std::string& error)
 {
     auto store = SqliteStore::open(
         database, {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, name TEXT, payload TEXT)"},
-        {"INSERT INTO events(time, name, payload) VALUES(?, ?, ?)"}, error);
+        {"INSERT INTO events(time, name, payload) VALUES(?, ?, ?)"}, eventsRetention(limit), error);
     if (!store)
         return nullptr;
     return std::unique_ptr<SqliteTally>(new SqliteTally(std::move(store), readDisabled(configuration)));

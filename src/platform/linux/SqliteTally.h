@@ -14,10 +14,13 @@
 
 namespace mx {
 
+struct StoreLimit;
+
 class SqliteTally final : public Tally {
 public:
     static std::unique_ptr<SqliteTally> open(const std::filesystem::path& database,
-                                             const std::filesystem::path& configuration, std::string& error);
+                                             const std::filesystem::path& configuration, const StoreLimit& limit,
+                                             std::string& error);
 
     void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override;
     bool wanted(std::string_view name) const;

@@ -1,4 +1,5 @@
 #include "platform/linux/SqliteTally.h"
+#include "platform/linux/StoreLimits.h"
 
 #include <fstream>
 
@@ -40,7 +41,7 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
 {
     std::ofstream(directory / "tally.json") << R"({"disabled": ["com.kestrel.harmonia.DriverStats", "exact.name"]})";
     std::string error;
-    auto tally = SqliteTally::open(directory / "tally.db", directory / "tally.json", error);
+    auto tally = SqliteTally::open(directory / "tally.db", directory / "tally.json", StoreLimit{}, error);
     ASSERT_TRUE(tally) << error;
     int built = 0;
     auto build = [&] {
@@ -64,13 +65,13 @@ TEST_F(SqliteStoreTest, WhatWasHandedOverIsCommittedWhenTheStoreCloses)
 {
     std::string error;
     {
-        auto tally = SqliteTally::open(directory / "tally.db", directory / "absent.json", error);
+        auto tally = SqliteTally::open(directory / "tally.db", directory / "absent.json", StoreLimit{}, error);
         ASSERT_TRUE(tally) << error;
         for (int i = 0; i < 100; ++i)
             tally->sendEventLazy("e", [] { return Dictionary{}; });
     }
     EXPECT_EQ(count("SELECT count(*) FROM events"), 100);
-    auto reopened = SqliteTally::open(directory / "tally.db", directory / "absent.json", error);
+    auto reopened = SqliteTally::open(directory / "tally.db", directory / "absent.json", StoreLimit{}, error);
     ASSERT_TRUE(reopened) << error;
     reopened->sendEventLazy("e", [] { return Dictionary{}; });
     reopened->store().flush();
