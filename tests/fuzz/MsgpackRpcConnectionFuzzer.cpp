@@ -1,0 +1,106 @@
+// libFuzzer target: arbitrary bytes from a client through a real connection over a
+// socket pair: the decoder and its size guard, the request dispatch, the replies and
+// their back-pressure (the client reads its replies only when the input says so).
+// Nothing may crash, hang or leak, and a connection that the client leaves must close.
+
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <asio/io_context.hpp>
+
+#include "Statistics/Service/MxReportingRequestDispatch.h"
+#include "Statistics/Service/MxReportingServiceProtocol.h"
+#include "platform/MxLog.h"
+#include "platform/linux/MsgpackRpcConnection.h"
+
+namespace {
+
+using namespace mx;
+
+class AnsweringService final : public MxReportingServiceProtocol {
+public:
+    void createReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
+    void setServiceType(ServiceType, ReporterID, MxBoolReply reply) override { reply(true); }
+    void getServiceNameForReporterID(ReporterID, MxServiceTypeReply reply) override
+    {
+        reply(65535);
+        reply(65535); // a second reply, which the connection drops
+    }
+    void setConfiguration(std::optional<Dictionary>, ReporterID, MxBoolReply reply) override { reply(true); }
+    void startReportingSessionForID(ReporterID, MxBoolReply) override {} // held, never answered
+    void sendMessage(Dictionary payload, MessageCategory, MessageType, std::optional<Array>,
+                     MxErrorReply reply) override
+    {
+        (void)Value(payload).description();
+        reply(std::nullopt);
+    }
+    void stopReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
+    void destroyReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
+    void reporterID(ReporterID, MxDictionaryReply valid) override { valid(Dictionary{{"reporterID", 0}}); }
+    void getAllReporters(MxReportersReply reply) override { reply({}); }
+    void killService(MxBoolReply reply) override { reply(false); } // the real one exits
+};
+
+class SilentLog final : public MxLogSink {
+public:
+    void write(const MxLogRecord&) override {}
+};
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size)
+{
+    static SilentLog log;
+    static ScopedInstall<MxLogSink> installLog(log);
+    if (size < 2)
+        return 0;
+    // The first byte picks the write size, the second whether the client reads replies.
+    std::size_t chunk = 1 + data[0] * 16u;
+    bool reads = (data[1] & 1) != 0;
+    data += 2;
+    size -= 2;
+
+    int ends[2];
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0, ends) != 0)
+        return 0;
+    asio::io_context io;
+    asio::local::stream_protocol::socket socket(io);
+    socket.assign(asio::local::stream_protocol(), ends[0]);
+    bool invalidated = false;
+    {
+        auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), 1);
+        connection->setExportedObject(
+            std::make_shared<MxReportingRequestDispatch>(std::make_shared<AnsweringService>()));
+        connection->setInvalidationHandler([&] { invalidated = true; });
+        connection->resume();
+    }
+    char replies[65536];
+    std::size_t offset = 0;
+    for (int idle = 0; idle < 4;) {
+        bool progress = io.poll() > 0;
+        if (offset < size) {
+            ssize_t sent = ::send(ends[1], data + offset, std::min(chunk, size - offset), MSG_NOSIGNAL);
+            if (sent > 0) {
+                offset += std::size_t(sent);
+                progress = true;
+            }
+        }
+        if (reads && ::recv(ends[1], replies, sizeof(replies), 0) > 0)
+            progress = true;
+        idle = progress ? 0 : idle + 1;
+        if (invalidated)
+            break;
+    }
+    // The client leaves, reading what is left: the connection must notice and close.
+    ::shutdown(ends[1], SHUT_WR);
+    for (int idle = 0; idle < 64 && !invalidated;) {
+        bool progress = io.poll() > 0;
+        while (::recv(ends[1], replies, sizeof(replies), 0) > 0)
+            progress = true;
+        idle = progress ? 0 : idle + 1;
+    }
+    ::close(ends[1]);
+    io.run_for(std::chrono::milliseconds(10));
+    return 0;
+}
