@@ -10,7 +10,7 @@ FakeUplinkSession::FakeUplinkSession(FakeUplink& uplink, int number, Dictionary 
 
 void FakeUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
 {
-    switch (uplink_.discoveryFor(sessionInfo)) {
+    switch (uplink_.discovery()) {
     case FakeUplink::Discovery::Backends:
         completion(std::vector<std::string>{"spool"});
         break;
@@ -93,21 +93,6 @@ bool FakeUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std
     changed_.notify_all();
     error = oneShotError_;
     return oneShotAccepted_;
-}
-
-void FakeUplink::setDiscovery(std::int64_t sessionID, Discovery discovery)
-{
-    std::lock_guard lock(mutex_);
-    discoveryBySession_[sessionID] = discovery;
-}
-
-FakeUplink::Discovery FakeUplink::discoveryFor(const Dictionary& sessionInfo) const
-{
-    std::lock_guard lock(mutex_);
-    if (const Value* id = sessionInfo.find(kUplinkSessionInfoSessionID))
-        if (auto found = discoveryBySession_.find(id->int64Value()); found != discoveryBySession_.end())
-            return found->second;
-    return discovery_;
 }
 
 void FakeUplink::setOneShotResult(bool accepted, std::optional<UplinkError> error)

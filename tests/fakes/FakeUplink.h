@@ -69,9 +69,7 @@ public:
                         Dictionary payload, std::optional<UplinkError>& error) override;
 
     void setDiscovery(Discovery discovery) { discovery_ = discovery; }
-    // How a session of that reporter ID is answered; others follow setDiscovery.
-    void setDiscovery(std::int64_t sessionID, Discovery discovery);
-    Discovery discoveryFor(const Dictionary& sessionInfo) const;
+    Discovery discovery() const { return discovery_; }
     void setOneShotResult(bool accepted, std::optional<UplinkError> error);
     void setFlushError(std::optional<UplinkError> error);
     std::optional<UplinkError> flushError() const;
@@ -84,7 +82,6 @@ public:
 
 private:
     std::atomic<Discovery> discovery_{Discovery::Backends};
-    std::map<std::int64_t, Discovery> discoveryBySession_;
     mutable std::mutex mutex_;
     mutable std::condition_variable changed_;
     std::vector<std::shared_ptr<FakeUplinkSession>> sessions_;

@@ -8,7 +8,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <fstream>
 #include <thread>
 
 #include <fmt/format.h>
@@ -68,17 +67,45 @@ std::string packed(const std::function<void(msgpack::packer<msgpack::sbuffer>&)>
     return std::string(buffer.data(), buffer.size());
 }
 
+std::unique_ptr<MxReportingClient> connectTo(const DaemonProcess& daemon)
+{
+    std::string error;
+    auto client = MxReportingClient::connect(daemon.socketPath(), error);
+    EXPECT_TRUE(client) << error;
+    return client;
+}
+
+// A small tmpfs over `path` for as long as it lives, where this machine lets a test
+// mount one (as root).
+class Tmpfs {
+public:
+    Tmpfs(std::filesystem::path path, const std::string& options) : path_(std::move(path))
+    {
+        std::filesystem::create_directories(path_);
+        mounted_ =
+            ::system(fmt::format("mount -t tmpfs -o {} tmpfs '{}' 2>/dev/null", options, path_.string()).c_str()) == 0;
+    }
+    ~Tmpfs() { unmount(); }
+    bool mounted() const { return mounted_; }
+    bool remount(const std::string& options)
+    {
+        return ::system(fmt::format("mount -o remount,{} '{}'", options, path_.string()).c_str()) == 0;
+    }
+    void unmount()
+    {
+        if (std::exchange(mounted_, false))
+            (void)::system(fmt::format("umount -l '{}'", path_.string()).c_str());
+    }
+
+private:
+    std::filesystem::path path_;
+    bool mounted_ = false;
+};
+
 class DaemonIntegrationTest : public ::testing::Test {
 protected:
     void SetUp() override { daemon.start(); }
-
-    std::unique_ptr<MxReportingClient> connect()
-    {
-        std::string error;
-        auto client = MxReportingClient::connect(daemon.socketPath(), error);
-        EXPECT_TRUE(client) << error;
-        return client;
-    }
+    std::unique_ptr<MxReportingClient> connect() { return connectTo(daemon); }
 
     DaemonProcess daemon;
 };
@@ -205,7 +232,7 @@ TEST_F(DaemonIntegrationTest, ReportingSwitchFollowsThePreferencesWhenTheNotific
     EXPECT_TRUE(daemon.waitForLog("defaults {\"device_name\":\"den\",\"disable_reporting\":1}"));
 }
 
-TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
+TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSigtermUnderLoadLosesNothingAcknowledged)
 {
     daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
     auto client = connect();
@@ -219,17 +246,42 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
                                 0x08000003, 1, std::vector<ReporterID>{21}));
     ASSERT_TRUE(*client->stopReportingSessionForID(21).value);
     ASSERT_TRUE(client->sendMessage(Dictionary{{"alone", true}}, 1, 0, std::nullopt));
+    ASSERT_TRUE(*client->createReportingSession(4).value);
+    ASSERT_TRUE(*client->setServiceType(10, 4).value); // alarms: sent alone, up to 59 s later
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"alarm", 1}}, 3, 1, std::vector<ReporterID>{4}));
 
+    // Then pipelined load on a started session, and SIGTERM in the middle of it.
+    ASSERT_TRUE(*client->createReportingSession(3).value);
+    client->startReportingSessionForID(3, nullptr);
+    std::atomic<int> acknowledged{0};
+    std::atomic<bool> sending{true};
+    std::thread load([&] {
+        for (int i = 0; sending; ++i) {
+            client->sendMessage(
+                Dictionary{{"seq", i}}, 3, 2, std::vector<ReporterID>{3},
+                [&](const MxClientResult<MxSendOutcome>& result) { acknowledged += result.value ? 1 : 0; });
+            if (i % 64 == 63)
+                client->getAllReporters(); // some 64 requests in flight
+        }
+    });
+    EXPECT_TRUE(waitUntil([&] { return acknowledged > 5000; }));
     daemon.signal(SIGTERM);
     EXPECT_EQ(daemon.waitForExit(), 0);
-    EXPECT_EQ(daemon.query("tally",
-                           "SELECT count(*) FROM events WHERE name = "
-                           "'com.kestrel.harmonia.Session_Playback.Start'")[0][0],
-              "50");
-    EXPECT_EQ(daemon.query("joule", "SELECT count(*) FROM events WHERE name = 'Tessera_Haptics' AND agent = 28")[0][0],
-              "50");
-    auto sessions = daemon.query("uplink", "SELECT id, session_info, user_info FROM sessions");
-    ASSERT_EQ(sessions.size(), 1u);
+    sending = false;
+    load.join();
+    EXPECT_TRUE(daemon.waitForLog("everything taken is committed"));
+
+    auto count = [&](const std::string& store, const std::string& where) {
+        return std::stoi(daemon.query(store, "SELECT count(*) FROM " + where)[0][0]);
+    };
+    EXPECT_EQ(count("tally", "events WHERE name = 'com.kestrel.harmonia.Session_Playback.Start'"), 50);
+    EXPECT_EQ(count("joule", "events WHERE name = 'Tessera_Haptics' AND agent = 28"), 50);
+    EXPECT_GE(count("tally", "events WHERE name = 'com.kestrel.harmonia.Playback.Stop'"), acknowledged.load());
+    EXPECT_GE(count("uplink", "messages WHERE type = 2"), acknowledged.load());
+    EXPECT_EQ(count("uplink", "messages WHERE session IS NULL AND payload LIKE '%alarm%'"), 1)
+        << "the delayed single message went out at shutdown";
+    auto sessions = daemon.query("uplink", "SELECT id, session_info, user_info FROM sessions ORDER BY id");
+    ASSERT_GE(sessions.size(), 1u);
     auto sessionInfo = nlohmann::json::parse(sessions[0][1]);
     EXPECT_EQ(sessionInfo.size(), 6u);
     EXPECT_EQ(sessionInfo["SessionID"], 21);
@@ -240,60 +292,18 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSurviveSigterm)
     for (int i = 0; i < 50; ++i)
         EXPECT_EQ(nlohmann::json::parse(messages[i][2])["seq"], i);
     EXPECT_EQ(messages[50][1], "65535") << "the summary event comes last";
-    auto summaries = daemon.path("var/log/harmonia/reporting");
-    ASSERT_TRUE(std::filesystem::is_directory(summaries));
-    auto summary = std::filesystem::directory_iterator(summaries)->path().filename().string();
-    EXPECT_THAT(summary, ::testing::EndsWith("-harmonia-ExampleHost-longformaudio.json"));
-    auto alone = daemon.query("uplink", "SELECT payload, user_info FROM messages WHERE session IS NULL");
+    auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
+    EXPECT_THAT(summary.filename().string(), ::testing::EndsWith("-harmonia-ExampleHost-longformaudio.json"));
+    auto alone =
+        daemon.query("uplink", "SELECT user_info FROM messages WHERE session IS NULL AND payload LIKE '%alone%'");
     ASSERT_EQ(alone.size(), 1u);
-    EXPECT_EQ(nlohmann::json::parse(alone[0][1])["ServiceName"], "standalone");
-}
-
-TEST_F(DaemonIntegrationTest, SigtermUnderPipelinedLoadLosesNothingAcknowledged)
-{
-    auto client = connect();
-    ASSERT_TRUE(*client->createReportingSession(3).value);
-    ASSERT_TRUE(*client->createReportingSession(4).value);
-    ASSERT_TRUE(*client->setServiceType(10, 4).value); // alarms: sent alone, up to 59 s later
-    client->startReportingSessionForID(3, nullptr);
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"alarm", 1}}, 3, 1, std::vector<ReporterID>{4}));
-
-    std::atomic<int> acknowledged{0};
-    std::atomic<bool> sending{true};
-    std::thread load([&] {
-        for (int i = 0; sending; ++i) {
-            client->sendMessage(Dictionary{{"seq", i}}, 3, 1, std::vector<ReporterID>{3},
-                                [&](const MxClientResult<MxSendOutcome>& result) {
-                                    if (result.value)
-                                        ++acknowledged;
-                                });
-            if (i % 64 == 63)
-                client->getAllReporters(); // keep some 64 requests in flight
-        }
-    });
-    EXPECT_TRUE(waitUntil([&] { return acknowledged > 5000; }));
-    daemon.signal(SIGTERM);
-    EXPECT_EQ(daemon.waitForExit(), 0);
-    sending = false;
-    load.join();
-    auto count = [&](const std::string& store, const std::string& where) {
-        return std::stoi(daemon.query(store, "SELECT count(*) FROM " + where)[0][0]);
-    };
-    EXPECT_GE(count("tally", "events WHERE name = 'com.kestrel.harmonia.Playback.Start'"), acknowledged + 1);
-    EXPECT_GE(count("uplink", "messages WHERE session IS NOT NULL"), acknowledged.load());
-    EXPECT_EQ(count("uplink", "messages WHERE session IS NULL AND payload LIKE '%alarm%'"), 1)
-        << "the delayed single message went out at shutdown";
-    EXPECT_TRUE(daemon.waitForLog("everything taken is committed"));
+    EXPECT_EQ(nlohmann::json::parse(alone[0][0])["ServiceName"], "standalone");
 }
 
 TEST_F(DaemonIntegrationTest, ASecondDaemonOnTheSameRootLeavesTheFirstAlone)
 {
-    pid_t second = daemon.spawn({MXREPORTINGD_PATH});
-    int status = 0;
-    waitpid(second, &status, 0);
-    EXPECT_EQ(WEXITSTATUS(status), 1);
-    std::ifstream log(daemon.path("spawned.log"));
-    std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
+    std::string text;
+    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH}, text), 1);
     EXPECT_THAT(
         text, ::testing::HasSubstr(fmt::format("another mxreportingd (pid {}) is running on this root", daemon.pid())));
     EXPECT_TRUE(*connect()->createReportingSession(1).value) << "the first one still serves its socket";
@@ -302,18 +312,12 @@ TEST_F(DaemonIntegrationTest, ASecondDaemonOnTheSameRootLeavesTheFirstAlone)
 TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
 {
     DaemonProcess daemon;
-    auto stores = daemon.path("var/lib/harmonia");
-    std::filesystem::create_directories(stores);
-    if (::system(fmt::format("mount -t tmpfs -o size=1m tmpfs '{}' 2>/dev/null", stores.string()).c_str()) != 0)
+    Tmpfs stores(daemon.path("var/lib/harmonia"), "size=1m");
+    if (!stores.mounted())
         GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
-    struct Unmount {
-        std::filesystem::path path;
-        ~Unmount() { (void)::system(fmt::format("umount -l '{}'", path.string()).c_str()); }
-    } unmount{stores};
     daemon.start();
-    std::string error;
-    auto client = MxReportingClient::connect(daemon.socketPath(), error);
-    ASSERT_TRUE(client) << error;
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(client);
     ASSERT_TRUE(*client->createReportingSession(3).value);
     client->startReportingSessionForID(3, nullptr);
     constexpr int kReports = 20000;
@@ -327,7 +331,7 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
     ASSERT_TRUE(daemon.waitForLog("cannot write"));
     EXPECT_LT(acknowledged, kReports) << "clients wait while the stores cannot write";
 
-    ASSERT_EQ(::system(fmt::format("mount -o remount,size=256m '{}'", stores.string()).c_str()), 0);
+    ASSERT_TRUE(stores.remount("size=256m"));
     EXPECT_TRUE(waitUntil([&] { return acknowledged == kReports; }, std::chrono::seconds(60)));
     EXPECT_TRUE(daemon.waitForLog("writing again after"));
     daemon.signal(SIGTERM);
@@ -344,18 +348,13 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
 TEST(DaemonStoreFailureTest, StoresThatCannotBeWrittenAtStartUpAreAClearError)
 {
     DaemonProcess daemon;
-    auto stores = daemon.path("var/lib/harmonia");
-    std::filesystem::create_directories(stores);
-    if (::system(fmt::format("mount -t tmpfs -o size=1m,ro tmpfs '{}' 2>/dev/null", stores.string()).c_str()) != 0)
+    Tmpfs stores(daemon.path("var/lib/harmonia"), "size=1m,ro");
+    if (!stores.mounted())
         GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
-    pid_t started = daemon.spawn({MXREPORTINGD_PATH});
-    int status = 0;
-    waitpid(started, &status, 0);
-    (void)::system(fmt::format("umount -l '{}'", stores.string()).c_str());
-    EXPECT_EQ(WEXITSTATUS(status), 1);
-    std::ifstream log(daemon.path("spawned.log"));
-    std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
-    EXPECT_THAT(text, ::testing::HasSubstr("mxreportingd cannot start: " + (stores / "tally.db").string()));
+    std::string text;
+    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH}, text), 1);
+    EXPECT_THAT(
+        text, ::testing::HasSubstr("mxreportingd cannot start: " + daemon.path("var/lib/harmonia/tally.db").string()));
 }
 
 TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
@@ -364,9 +363,8 @@ TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
     daemon.writeFile("var/lib/harmonia/joule.db", std::string(8192, 'J'));
     daemon.start();
     EXPECT_TRUE(daemon.waitForLog("joule.db is corrupt"));
-    std::string error;
-    auto client = MxReportingClient::connect(daemon.socketPath(), error);
-    ASSERT_TRUE(client) << error;
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(client);
     ASSERT_TRUE(*client->createReportingSession(3).value);
     ASSERT_TRUE(client->sendMessage(Dictionary{{"EngineOnTime", 1}}, 3, 1, std::vector<ReporterID>{3}));
     EXPECT_TRUE(waitUntil([&] { return daemon.query("joule", "SELECT count(*) FROM events")[0][0] == "1"; }));
@@ -412,9 +410,8 @@ TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRows
         "etc/harmonia/uplink.json",
         R"({"backends": [{"type": "spool"}, {"type": "otlp-http", "url": "http://127.0.0.1:9/v1/logs"}]})");
     daemon.start();
-    std::string error;
-    auto client = MxReportingClient::connect(daemon.socketPath(), error);
-    ASSERT_TRUE(client) << error;
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(client);
     for (ReporterID id = 1; id <= 4; ++id) {
         ASSERT_TRUE(*client->createReportingSession(id).value);
         ASSERT_TRUE(*client->setServiceType(11, id).value); // test sessions: no backend waits

@@ -91,6 +91,15 @@ pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments) const
     return forkExec(root_, arguments, (root_ / "spawned.log").string(), O_APPEND);
 }
 
+int DaemonProcess::runToEnd(const std::vector<std::string>& arguments, std::string& output) const
+{
+    int status = 0;
+    waitpid(spawn(arguments), &status, 0);
+    std::ifstream log(root_ / "spawned.log");
+    output.assign(std::istreambuf_iterator<char>(log), std::istreambuf_iterator<char>());
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
 void DaemonProcess::start()
 {
     std::string log = (root_ / "daemon.log").string();
