@@ -114,21 +114,16 @@ public:
         ++queries_;
         return bools_.count(std::string(key)) ? bools_[std::string(key)] : false;
     }
-    std::int64_t integerProperty(std::string_view key) override
+    std::int64_t integerProperty(std::string_view) override
     {
         std::lock_guard lock(mutex_);
         ++queries_;
-        return integers_.count(std::string(key)) ? integers_[std::string(key)] : 0;
+        return 0;
     }
     void setBool(const std::string& key, bool value)
     {
         std::lock_guard lock(mutex_);
         bools_[key] = value;
-    }
-    void setInteger(const std::string& key, std::int64_t value)
-    {
-        std::lock_guard lock(mutex_);
-        integers_[key] = value;
     }
     int queries() const
     {
@@ -139,7 +134,6 @@ public:
 private:
     mutable std::mutex mutex_;
     std::map<std::string, bool> bools_;
-    std::map<std::string, std::int64_t> integers_;
     int queries_ = 0;
 };
 

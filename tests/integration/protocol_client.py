@@ -49,6 +49,14 @@ def main():
         check("wrong argument count", error["code"], 2)
         error, _ = a.reply(a.send("frobnicate:"))
         check("unknown method", error["code"], 1)
+        bad_arguments = [("createReportingSession:reply:", ["5"]), ("createReportingSession:reply:", [2**64 - 1]),
+                         ("setServiceType:reportingSession:reply:", [65536, 1]),
+                         ("setConfiguration:forReporterID:reply:", [[], 1]),
+                         ("sendMessage:withCategory:andType:forReportingIDs:reply:", [{}, -1, 0, None]),
+                         ("sendMessage:withCategory:andType:forReportingIDs:reply:", [{}, 1, 0, 5])]
+        for method, params in bad_arguments:
+            error, result = a.reply(a.send(method, *params))
+            check(f"refused arguments {params!r}", (error or {}).get("code"), 2)
 
         daemon.write("var/lib/harmonia/preferences/com.kestrel.harmonia.json", '{"disable_reporting": true}')
         daemon.process.send_signal(1)  # SIGHUP posts the preferences notification

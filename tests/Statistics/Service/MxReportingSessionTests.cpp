@@ -43,31 +43,30 @@ protected:
     FakePlatform platform;
 };
 
-TEST_F(MxReportingSessionTest, RepeatedStartKeepsTheStoreAndOpensNoSecondBackendSession)
-{
-    auto session = makeSession();
-    session->start();
-    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
-    session->start();
-    run();
-    EXPECT_TRUE(platform.log.contains("5 is already started"));
-    EXPECT_EQ(session->aggregatedPayloadData()->snapshot().size(), 1u);
-    EXPECT_EQ(platform.uplink.sessions().size(), 1u);
-    EXPECT_EQ(platform.uplink.tokensIssued(), 1);
-}
-
-TEST_F(MxReportingSessionTest, StopOfANeverStartedSessionLeavesNoTrace)
+TEST_F(MxReportingSessionTest, OnlyAFirstStartAndAStartedStopDoAnythingAndTheLastReferenceStopsNothing)
 {
     auto session = makeSession();
     session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
     run();
     platform.trace.clear();
     session->stop();
+    EXPECT_THAT(platform.trace.codes(), IsEmpty()) << "a stop that stops nothing leaves no trace";
+    EXPECT_NE(session->aggregatedPayloadData(), nullptr) << "and keeps the store";
+
+    session->start();
+    session->sendMessage(Dictionary{{"a", 1}}, 3, 1, nullptr);
+    session->start();
     run();
-    EXPECT_THAT(platform.trace.codes(), IsEmpty());
+    EXPECT_TRUE(platform.log.contains("5 is already started"));
+    EXPECT_EQ(session->aggregatedPayloadData()->snapshot().size(), 1u);
+    EXPECT_EQ(platform.uplink.tokensIssued(), 1) << "no second backend session";
+
+    platform.trace.clear();
+    session.reset();
+    EXPECT_THAT(platform.trace.codes(), ElementsAre(0x21042834));
+    EXPECT_TRUE(platform.log.contains("deallocing this session 5"));
+    EXPECT_EQ(onlyBackendSession()->flushes(), 0);
     EXPECT_FALSE(platform.log.contains("sending summary event for reporter 5"));
-    EXPECT_NE(session->aggregatedPayloadData(), nullptr) << "a stop that stops nothing keeps the store";
-    EXPECT_TRUE(platform.uplink.sessions().empty());
 }
 
 TEST_F(MxReportingSessionTest, IdentifiersCountOnAcrossRestartsWhileStoresStartAfresh)
@@ -251,18 +250,6 @@ TEST_F(MxReportingSessionTest, DiscoveryAnsweredDuringTheWaitContinuesWithTheBac
     EXPECT_EQ(onlyBackendSession()->messages().size(), 1u);
     EXPECT_NE(session->uplinkSession(), nullptr);
     EXPECT_FALSE(session->uplinkSessionStarted()) << "nothing ever sets the seed";
-}
-
-TEST_F(MxReportingSessionTest, LastReferenceToAStartedSessionGoesWithoutStopping)
-{
-    auto session = makeSession();
-    session->start();
-    run();
-    platform.trace.clear();
-    session.reset();
-    EXPECT_THAT(platform.trace.codes(), ElementsAre(0x21042834));
-    EXPECT_TRUE(platform.log.contains("deallocing this session 5"));
-    EXPECT_EQ(onlyBackendSession()->flushes(), 0);
 }
 
 } // namespace

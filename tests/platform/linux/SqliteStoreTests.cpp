@@ -61,22 +61,5 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
               events);
 }
 
-TEST_F(SqliteStoreTest, WhatWasHandedOverIsCommittedWhenTheStoreCloses)
-{
-    std::string error;
-    {
-        auto tally = SqliteTally::open(directory / "tally.db", directory / "absent.json", StoreLimit{}, error);
-        ASSERT_TRUE(tally) << error;
-        for (int i = 0; i < 100; ++i)
-            tally->sendEventLazy("e", [] { return Dictionary{}; });
-    }
-    EXPECT_EQ(count("SELECT count(*) FROM events"), 100);
-    auto reopened = SqliteTally::open(directory / "tally.db", directory / "absent.json", StoreLimit{}, error);
-    ASSERT_TRUE(reopened) << error;
-    reopened->sendEventLazy("e", [] { return Dictionary{}; });
-    reopened->store().flush();
-    EXPECT_EQ(count("SELECT max(id) FROM events"), 101);
-}
-
 } // namespace
 } // namespace mx::testing
