@@ -1,9 +1,8 @@
 #pragma once
 // Chanstat: the driver channel statistics library. Drivers publish integer counters
 // ("channels") in groups and subgroups; a subscription to a set of channels can be
-// sampled, and two samples give a delta (the growth between them).
-// Not built yet: no Linux implementation and no sampler use it, so the service root
-// takes empty driver snapshots and reports no driver statistics until they exist.
+// sampled, and two samples give a delta (the growth between them). Channels are
+// read, never written, by the daemon.
 
 #include <cstdint>
 #include <optional>
@@ -22,6 +21,7 @@ struct ChanstatChannel {
     std::optional<std::string> name;
     std::string path; // where the channel lives; the identity used by samples and deltas
     std::int64_t value = 0;
+    friend bool operator==(const ChanstatChannel&, const ChanstatChannel&) = default;
 };
 
 // A channel set: the result of a group query, a subscription's channels, a sample or

@@ -8,6 +8,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <fstream>
 #include <thread>
 
 #include <fmt/format.h>
@@ -441,6 +442,56 @@ TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRows
          std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting")))
         ++summaries;
     EXPECT_EQ(summaries, 2u);
+}
+
+TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    auto channel = [&](const std::string& relative, std::int64_t value) {
+        daemon.writeFile("run/harmonia/chanstat/" + relative, std::to_string(value) + "\n");
+    };
+    channel("KestrelAE2MCA/overloads", 1);
+    channel("Speaker/Amp/underruns", 10);
+    channel("Speaker/Amp/level", 50);
+    channel("Front/MCA/late", 0);
+    channel("Haptics/Stats/pulses", 100);
+    daemon.start();
+    channel("Late/MCA/added", 0); // a subscription is fixed when made
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(client);
+    ASSERT_TRUE(*client->createReportingSession(6).value);
+    ASSERT_TRUE(*client->setServiceType(7, 6).value);
+    client->startReportingSessionForID(6, nullptr);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{6}));
+    channel("Speaker/Amp/underruns", 13);
+    channel("Speaker/Amp/level", 20); // down: not reported
+    channel("Front/MCA/late", 4);
+    channel("Late/MCA/added", 9);
+    channel("Haptics/Stats/pulses", 105);
+    std::filesystem::remove(daemon.path("run/harmonia/chanstat/KestrelAE2MCA/overloads"));
+    ASSERT_TRUE(*client->stopReportingSessionForID(6).value);
+    EXPECT_TRUE(daemon.waitForLog("ChanstatCreateSamples error 2"));
+
+    daemon.signal(SIGTERM);
+    ASSERT_EQ(daemon.waitForExit(), 0);
+    Dictionary expected{{"Speaker_underruns", 3}, {"MCA_late", 4}, {"Haptics_Stats_pulses", 5}};
+    auto event =
+        daemon.query("tally", "SELECT payload FROM events WHERE name = 'com.kestrel.harmonia.DriverStats.Generic'");
+    ASSERT_EQ(event.size(), 1u);
+    auto payload = nlohmann::json::parse(event[0][0]);
+    EXPECT_EQ(payload.size(), 4u) << payload.dump() << ": the statistics and the host";
+    for (const auto& [key, value] : expected)
+        EXPECT_EQ(payload[key], value.int64Value()) << key;
+    auto messages =
+        daemon.query("uplink", "SELECT category, type, payload FROM messages WHERE session IS NOT NULL ORDER BY id");
+    ASSERT_EQ(messages.size(), 3u);
+    EXPECT_EQ(messages[1][0], "9") << "the statistics come before the summary";
+    EXPECT_EQ(messages[2][1], "65535");
+    EXPECT_EQ(nlohmann::json::parse(messages[2][2])["Speaker_underruns"], "3");
+    auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
+    std::ifstream file(summary);
+    EXPECT_EQ(nlohmann::json::parse(file)[2]["DriverStats_Generic_1"]["Haptics_Stats_pulses"], 5);
 }
 
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)

@@ -17,11 +17,13 @@ Date now() { return std::chrono::system_clock::now(); }
 
 std::shared_ptr<MxReportingServiceDelegate> MxReportingServiceDelegate::make(Preferences& preferences,
                                                                              Notifications& notifications,
-                                                                             ProcessTable& processTable)
+                                                                             ProcessTable& processTable,
+                                                                             Chanstat& chanstat)
 {
     std::shared_ptr<MxReportingServiceDelegate> root(
         new MxReportingServiceDelegate(preferences, notifications, processTable));
     root->listenForDefaultsNotification();
+    root->driverUtility_ = std::make_unique<MxReportingDriverUtility>(chanstat);
     return root;
 }
 
@@ -141,17 +143,15 @@ std::shared_ptr<MxReportingSession> MxReportingServiceDelegate::findReportingSes
     return nullptr;
 }
 
-// Until the driver statistics sampler exists: an empty snapshot, and no statistics,
-// so every stop logs "nothing interesting to fetch from the drivers".
 std::shared_ptr<MxReportingDriverSnapShot> MxReportingServiceDelegate::getSnapShot()
 {
-    return std::make_shared<MxReportingDriverSnapShot>();
+    return std::make_shared<MxReportingDriverSnapShot>(driverUtility_->getSnapShot());
 }
 
 std::optional<Dictionary> MxReportingServiceDelegate::getDriverStatisticsRelativeToSnapShot(
-    const std::shared_ptr<MxReportingDriverSnapShot>&)
+    const std::shared_ptr<MxReportingDriverSnapShot>& snapShot)
 {
-    return std::nullopt;
+    return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot.get());
 }
 
 void MxReportingServiceDelegate::removeClient(const MxReportingServerInstance& client)

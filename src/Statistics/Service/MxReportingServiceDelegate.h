@@ -1,8 +1,8 @@
 #pragma once
 // The service root: accepts client connections and makes one endpoint per client,
 // keeps the list of connected clients, answers the endpoints' cross-client
-// questions, holds the reporting defaults and switch, and reports each client's
-// connection time when it leaves. Created once by main and never destroyed.
+// questions, holds the reporting defaults and switch and the driver statistics
+// sampler, and reports each client's connection time when it leaves. Created once by main and never destroyed.
 // The client list, the defaults and the switch change only on the serial server
 // queue; acceptance and the cross-client lookup also take the root's own lock.
 
@@ -30,9 +30,10 @@ class MxReportingServiceDelegate final : public MxReportingServiceDelegateProtoc
                                          public std::enable_shared_from_this<MxReportingServiceDelegate> {
 public:
     // init: the scope, the server queue, an empty client list, reporting on, the
-    // registration for the defaults notification. Defaults are not read yet.
+    // registration for the defaults notification, the driver statistics sampler
+    // (which subscribes at once). Defaults are not read yet.
     static std::shared_ptr<MxReportingServiceDelegate> make(Preferences& preferences, Notifications& notifications,
-                                                            ProcessTable& processTable);
+                                                            ProcessTable& processTable, Chanstat& chanstat);
 
     const std::shared_ptr<WorkQueue>& serverQueue() const { return serverQueue_; }
 
@@ -64,6 +65,8 @@ private:
     Notifications& notifications_;
     ProcessTable& processTable_;
     std::shared_ptr<WorkQueue> serverQueue_;
+    // Made last at start-up, after the notification registration; read-only after.
+    std::unique_ptr<MxReportingDriverUtility> driverUtility_;
     std::recursive_mutex lock_;
 
     std::atomic<bool> reportingEnabled_{true};

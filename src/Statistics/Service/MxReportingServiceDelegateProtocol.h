@@ -9,17 +9,14 @@
 #include <string>
 #include <vector>
 
+#include "Statistics/MxReportingDriverUtility.h"
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Chanstat.h"
 #include "platform/Value.h"
 
 namespace mx {
 
 class MxReportingServerInstance;
 class MxReportingSession;
-
-// Driver description ("Haptics-Stats") -> that driver's samples at the snapshot.
-using MxReportingDriverSnapShot = std::map<std::string, ChanstatChannels>;
 
 class MxReportingServiceDelegateProtocol {
 public:

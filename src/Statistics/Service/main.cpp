@@ -18,6 +18,7 @@
 #include "Statistics/Service/MxReportingSessionSummary.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/FileChanstat.h"
 #include "platform/linux/InstanceLock.h"
 #include "platform/linux/JournalLogSink.h"
 #include "platform/linux/JsonDeviceProperties.h"
@@ -123,7 +124,8 @@ int run(int argc, char** argv)
     JsonPreferences preferences(MxReportingPath("var/lib/harmonia/preferences"));
     DatagramNotifications notifications(MxReportingPath("run/harmonia/notify.sock"));
 
-    auto root = MxReportingServiceDelegate::make(preferences, notifications, processTable);
+    FileChanstat chanstat(MxReportingPath("run/harmonia/chanstat"));
+    auto root = MxReportingServiceDelegate::make(preferences, notifications, processTable, chanstat);
     auto listener = MsgpackRpcListener::make(MxReportingPath("run/harmonia/reporting.sock"), error);
     if (!listener)
         fail(error);

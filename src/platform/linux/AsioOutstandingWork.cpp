@@ -10,7 +10,7 @@ void AsioOutstandingWork::end()
     }
 }
 
-void AsioOutstandingWork::runAfter(std::shared_ptr<asio::steady_timer> timer, UniqueFunction<void()> work)
+void AsioOutstandingWork::runAfter(const std::shared_ptr<asio::steady_timer>& timer, UniqueFunction<void()> work)
 {
     std::lock_guard lock(mutex_);
     std::erase_if(timers_, [](const auto& armed) { return armed.expired(); });

@@ -25,7 +25,7 @@ public:
 
     // Runs `work` on `timer`'s executor once the timer expires, or at once when
     // shutdown begins first.
-    void runAfter(std::shared_ptr<asio::steady_timer> timer, UniqueFunction<void()> work);
+    void runAfter(const std::shared_ptr<asio::steady_timer>& timer, UniqueFunction<void()> work);
 
     // Expedites delayed work and waits until no work is left, at most `bound`.
     // False when work remains at the bound.

@@ -91,7 +91,9 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
         if (sqlite3_exec(connection.database, sql.c_str(), nullptr, nullptr, &message) != SQLITE_OK) {
             std::string text = message ? message : "error";
             sqlite3_free(message);
-            return fail(text + " in: " + sql);
+            text += " in: ";
+            text += sql;
+            return fail(text);
         }
     }
     if (sqlite3_db_readonly(connection.database, "main") == 1)

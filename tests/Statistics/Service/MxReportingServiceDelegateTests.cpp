@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "fakes/FakeChanstat.h"
 #include "fakes/FakePlatform.h"
 #include "fakes/FakeServiceHost.h"
 
@@ -52,9 +53,10 @@ protected:
     FakePreferences preferences;
     FakeNotifications notifications;
     FakeProcessTable processes;
+    FakeChanstat chanstat;
     NoListener listener;
     std::shared_ptr<MxReportingServiceDelegate> root =
-        MxReportingServiceDelegate::make(preferences, notifications, processes);
+        MxReportingServiceDelegate::make(preferences, notifications, processes, chanstat);
 };
 
 TEST_F(MxReportingServiceDelegateTest, AcceptedClientsAreRegisteredInOrderWithNameAndStartDate)

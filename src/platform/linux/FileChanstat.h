@@ -1,0 +1,36 @@
+#pragma once
+// Driver channels as files: each channel is a regular file chanstat/GROUP/SUBGROUP/NAME
+// (or chanstat/GROUP/NAME for a group without subgroups) holding one signed decimal
+// 64-bit integer, kept current by whoever drives the hardware. A query walks the
+// directories once; a subscription is the files found then, and sampling reads just
+// those files. Thread-safe: it holds no state but its directory.
+
+#include <atomic>
+#include <filesystem>
+
+#include "platform/Chanstat.h"
+
+namespace mx {
+
+class FileChanstat final : public Chanstat {
+public:
+    explicit FileChanstat(std::filesystem::path directory) : directory_(std::move(directory)) {}
+
+    std::optional<ChanstatChannels> copyChannelsInGroup(const std::optional<std::string>& group,
+                                                        const std::optional<std::string>& subgroup,
+                                                        std::optional<ChanstatError>& error) override;
+    std::int32_t getChannelCount(const ChanstatChannels& channels) override;
+    ChanstatSubscription createSubscription(const ChanstatChannels& channels,
+                                            ChanstatChannels& subscribedChannels) override;
+    std::optional<ChanstatChannels> createSamples(ChanstatSubscription subscription,
+                                                  const ChanstatChannels& subscribedChannels,
+                                                  std::optional<ChanstatError>& error) override;
+    std::optional<ChanstatChannels> createSamplesDelta(const ChanstatChannels* earlier, const ChanstatChannels& later,
+                                                       std::optional<ChanstatError>& error) override;
+
+private:
+    const std::filesystem::path directory_;
+    std::atomic<ChanstatSubscription> subscriptions_{0};
+};
+
+} // namespace mx
