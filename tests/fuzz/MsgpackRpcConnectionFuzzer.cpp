@@ -9,38 +9,14 @@
 
 #include <asio/io_context.hpp>
 
+#include "AnsweringService.h"
 #include "Statistics/Service/MxReportingRequestDispatch.h"
-#include "Statistics/Service/MxReportingServiceProtocol.h"
 #include "platform/MxLog.h"
 #include "platform/linux/MsgpackRpcConnection.h"
 
 namespace {
 
 using namespace mx;
-
-class AnsweringService final : public MxReportingServiceProtocol {
-public:
-    void createReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
-    void setServiceType(ServiceType, ReporterID, MxBoolReply reply) override { reply(true); }
-    void getServiceNameForReporterID(ReporterID, MxServiceTypeReply reply) override
-    {
-        reply(65535);
-        reply(65535); // a second reply, which the connection drops
-    }
-    void setConfiguration(std::optional<Dictionary>, ReporterID, MxBoolReply reply) override { reply(true); }
-    void startReportingSessionForID(ReporterID, MxBoolReply) override {} // held, never answered
-    void sendMessage(Dictionary payload, MessageCategory, MessageType, std::optional<Array>,
-                     MxErrorReply reply) override
-    {
-        (void)Value(payload).description();
-        reply(std::nullopt);
-    }
-    void stopReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
-    void destroyReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
-    void reporterID(ReporterID, MxDictionaryReply valid) override { valid(Dictionary{{"reporterID", 0}}); }
-    void getAllReporters(MxReportersReply reply) override { reply({}); }
-    void killService(MxBoolReply reply) override { reply(false); } // the real one exits
-};
 
 class SilentLog final : public MxLogSink {
 public:
@@ -71,7 +47,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     {
         auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), 1);
         connection->setExportedObject(
-            std::make_shared<MxReportingRequestDispatch>(std::make_shared<AnsweringService>()));
+            std::make_shared<MxReportingRequestDispatch>(std::make_shared<AnsweringService>(true)));
         connection->setInvalidationHandler([&] { invalidated = true; });
         connection->resume();
     }

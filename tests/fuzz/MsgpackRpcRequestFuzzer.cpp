@@ -6,34 +6,14 @@
 #include <cstdint>
 #include <cstring>
 
+#include "AnsweringService.h"
 #include "Statistics/Service/MxReportingRequestDispatch.h"
-#include "Statistics/Service/MxReportingServiceProtocol.h"
 #include "wire/MsgpackRpcDecoder.h"
 #include "wire/MsgpackRpcMessage.h"
 
 namespace {
 
 using namespace mx;
-
-class AnsweringService final : public MxReportingServiceProtocol {
-public:
-    void createReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
-    void setServiceType(ServiceType, ReporterID, MxBoolReply reply) override { reply(true); }
-    void getServiceNameForReporterID(ReporterID, MxServiceTypeReply reply) override { reply(65535); }
-    void setConfiguration(std::optional<Dictionary>, ReporterID, MxBoolReply reply) override { reply(true); }
-    void startReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
-    void sendMessage(Dictionary payload, MessageCategory, MessageType, std::optional<Array>,
-                     MxErrorReply reply) override
-    {
-        (void)Value(payload).description();
-        reply(std::nullopt);
-    }
-    void stopReportingSessionForID(ReporterID, MxBoolReply reply) override { reply(true); }
-    void destroyReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
-    void reporterID(ReporterID, MxDictionaryReply valid) override { valid(Dictionary{{"reporterID", 0}}); }
-    void getAllReporters(MxReportersReply reply) override { reply({}); }
-    void killService(MxBoolReply reply) override { reply(false); } // the real one exits
-};
 
 class CountingReply final : public ServiceReply {
 public:
@@ -53,7 +33,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     ++data;
     --size;
     MsgpackRpcDecoder decoder(1 << 16);
-    MxReportingRequestDispatch dispatch(std::make_shared<AnsweringService>());
+    MxReportingRequestDispatch dispatch(std::make_shared<AnsweringService>(false));
     for (std::size_t offset = 0; offset < size; offset += chunk) {
         std::size_t count = std::min(chunk, size - offset);
         decoder.feed(reinterpret_cast<const char*>(data + offset), count);

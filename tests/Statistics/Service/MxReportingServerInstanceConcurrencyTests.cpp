@@ -10,7 +10,7 @@
 
 #include "Statistics/Service/MxReportingServerInstance.h"
 #include "fakes/FakePlatform.h"
-#include "fakes/FakeServiceDelegate.h"
+#include "fakes/ServiceHostHarness.h"
 #include "platform/linux/AsioDispatch.h"
 
 namespace mx::testing {
@@ -43,11 +43,9 @@ class MxReportingServerInstanceConcurrencyTest : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        for (int pid = 1; pid <= kClients; ++pid) {
-            auto client = std::make_shared<MxReportingServerInstance>(pid, root, serverQueue);
-            root->clients.push_back(client);
-            clients.push_back(client);
-        }
+        host.start();
+        for (int pid = 1; pid <= kClients; ++pid)
+            clients.push_back(host.connect(pid));
         Countdown ready(kClients * 2 * 2);
         for (int c = 0; c < kClients; ++c)
             for (ReporterID id : ownIDs(c)) {
@@ -66,7 +64,7 @@ protected:
     {
         std::vector<std::shared_ptr<MxReportingSession>> sessions;
         std::promise<void> listed;
-        serverQueue->dispatch([&] {
+        host.root->serverQueue()->dispatch([&] {
             for (const auto& client : clients)
                 for (const auto& [id, session] : client->clientReportingSessionMap())
                     sessions.push_back(session);
@@ -85,9 +83,11 @@ protected:
     FakePlatform platform;
     AsioDispatch dispatch{2};
     ScopedInstall<Dispatch> installDispatch{dispatch};
-    std::shared_ptr<FakeServiceDelegate> root = std::make_shared<FakeServiceDelegate>();
-    std::shared_ptr<WorkQueue> serverQueue =
-        dispatch.makeSerialQueue("com.kestrel.harmonia.reporting.server", QueuePriority::UserInteractive);
+    ServiceHostHarness host{[this] {
+        std::promise<void> reached;
+        host.root->serverQueue()->dispatch([&] { reached.set_value(); });
+        reached.get_future().wait();
+    }};
     std::vector<std::shared_ptr<MxReportingServerInstance>> clients;
 };
 

@@ -4,7 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "fakes/FakePlatform.h"
-#include "fakes/FakeServiceDelegate.h"
+#include "fakes/ServiceHostHarness.h"
 
 namespace mx::testing {
 namespace {
@@ -25,12 +25,13 @@ struct Replies {
 
 class MxReportingServerInstanceTest : public ::testing::Test {
 protected:
-    std::shared_ptr<MxReportingServerInstance> connect(std::int32_t pid)
+    MxReportingServerInstanceTest()
     {
-        auto client = std::make_shared<MxReportingServerInstance>(pid, root, serverQueue);
-        root->clients.push_back(client);
-        return client;
+        host.chanstat.groups[{"Speaker", std::nullopt}] = {ChanstatChannel{"underruns", "Speaker/underruns", 0}};
+        host.start();
     }
+
+    std::shared_ptr<MxReportingServerInstance> connect(std::int32_t pid) { return host.connect(pid); }
 
     void run() { platform.dispatch.runUntilIdle(); }
 
@@ -75,9 +76,9 @@ protected:
     }
 
     FakePlatform platform;
-    std::shared_ptr<FakeServiceDelegate> root = std::make_shared<FakeServiceDelegate>();
-    std::shared_ptr<WorkQueue> serverQueue =
-        platform.dispatch.makeSerialQueue("com.kestrel.harmonia.reporting.server", QueuePriority::UserInteractive);
+    ServiceHostHarness host{[this] {
+        run();
+    }};
 };
 
 TEST_F(MxReportingServerInstanceTest, SessionLifeAsAClientDrivesIt)
@@ -98,9 +99,9 @@ TEST_F(MxReportingServerInstanceTest, SessionLifeAsAClientDrivesIt)
     auto reporting = session(*client, 5);
     EXPECT_TRUE(reporting->started());
     EXPECT_EQ(reporting->serviceName(), "longformaudio");
-    EXPECT_EQ(root->snapShotsTaken, 1);
     auto snapShot = reporting->driverSnapShot();
     ASSERT_NE(snapShot, nullptr);
+    EXPECT_EQ(snapShot->count("Speaker-(null)"), 1u) << "the drivers are sampled at the start";
 
     EXPECT_EQ(send(*client, Dictionary{{"rate", 48000}, {"EngineOnTime", 2.5}}, Array{5}), std::nullopt);
     ASSERT_EQ(platform.tally.events().size(), 1u);
@@ -108,7 +109,7 @@ TEST_F(MxReportingServerInstanceTest, SessionLifeAsAClientDrivesIt)
     EXPECT_EQ(*platform.tally.events()[0].payload.find("HostApplicationDisplayID"), Value("ExampleHost"));
     EXPECT_EQ(platform.joule.events().size(), 1u);
 
-    root->driverStatistics = Dictionary{{"Speaker_underruns", 3}};
+    host.chanstat.values["Speaker/underruns"] = 3;
     Replies<bool> order;
     client->stopReportingSessionForID(5, [&](bool value) {
         EXPECT_THAT(started.values, ElementsAre(true)) << "the held start reply comes before the stop reply";
@@ -119,7 +120,6 @@ TEST_F(MxReportingServerInstanceTest, SessionLifeAsAClientDrivesIt)
     EXPECT_THAT(started.values, ElementsAre(true));
     EXPECT_FALSE(reporting->started());
     EXPECT_EQ(reporting->driverSnapShot(), nullptr);
-    EXPECT_THAT(root->statisticsAskedAgainst, ElementsAre(snapShot));
     EXPECT_THAT(tallyNames(),
                 ElementsAre("com.kestrel.harmonia.Session_Playback.Start", "com.kestrel.harmonia.DriverStats.Generic"));
     EXPECT_EQ(platform.joule.events().size(), 1u) << "driver statistics never reach the power log";
@@ -250,6 +250,8 @@ TEST_F(MxReportingServerInstanceTest, QueriesFindSessionsOfAnyClientInConnection
     run();
 
     EXPECT_THAT(serviceTypes.values, ElementsAre(12, 4, 65535)) << "own sessions come before other clients'";
+    EXPECT_TRUE(platform.log.contains("found reporting session 5 for client 2"));
+    EXPECT_TRUE(platform.log.contains("failed to find reporting session 77"));
     EXPECT_TRUE(platform.log.contains("returnning service type 12 for reporter  5"));
     EXPECT_THAT(validity.values,
                 ElementsAre(Dictionary{{"reporterID", 5}, {"serviceType", 12}},
@@ -311,7 +313,6 @@ TEST_F(MxReportingServerInstanceTest, MessageWithoutIdListAndNoStartedSessionGoe
 {
     auto client = connect(1);
     create(*client, 5);
-    root->defaults = Dictionary{{"disable_reporting", 0}, {"device_name", "den"}};
     EXPECT_EQ(send(*client, Dictionary{{"peak level", 3}}, std::nullopt, 0x20000001, 4), std::nullopt);
 
     EXPECT_TRUE(platform.log.contains("no active reporting sessions found, sending as standalone"));
@@ -331,7 +332,7 @@ TEST_F(MxReportingServerInstanceTest, ReportingSwitchedOffRefusesMessagesAndHide
     auto owner = connect(1);
     auto other = connect(2);
     create(*owner, 5);
-    root->reportingEnabled = false;
+    host.setPreferences(Dictionary{{"disable_reporting", true}});
 
     auto error = send(*owner, Dictionary{{"a", 1}}, Array{5});
     ASSERT_TRUE(error);
@@ -369,8 +370,7 @@ TEST_F(MxReportingServerInstanceTest, DisconnectionStopsSessionsOnceAndNeverAnsw
     client->handleConnectionError();
     run();
 
-    EXPECT_EQ(root->removals, 1);
-    EXPECT_TRUE(root->clients.empty());
+    EXPECT_TRUE(host.clients().empty());
     EXPECT_EQ(platform.log.count("removing 42 from the server client list"), 1u);
     EXPECT_THAT(platform.trace.codes(), ElementsAre(0x21042830)) << "one started session stopped, once";
     EXPECT_THAT(started.values, IsEmpty());
@@ -380,7 +380,8 @@ TEST_F(MxReportingServerInstanceTest, DisconnectionStopsSessionsOnceAndNeverAnsw
 
 TEST_F(MxReportingServerInstanceTest, EntryOnlyLogsAndQueuesAndAVanishedEndpointsRequestsAreDropped)
 {
-    auto client = connect(1);
+    // An endpoint the root does not hold: it goes when the test lets go of it.
+    auto client = std::make_shared<MxReportingServerInstance>(1, host.root, host.root->serverQueue());
     Replies<bool> replies;
     client->createReportingSession(5, replies.callback());
     EXPECT_THAT(replies.values, IsEmpty()) << "nothing but logging happens on the caller's thread";
@@ -390,7 +391,6 @@ TEST_F(MxReportingServerInstanceTest, EntryOnlyLogsAndQueuesAndAVanishedEndpoint
     EXPECT_THAT(replies.values, ElementsAre(true));
 
     client->createReportingSession(6, replies.callback());
-    root->clients.clear();
     client.reset();
     run();
     EXPECT_THAT(replies.values, ElementsAre(true)) << "no reply for a vanished endpoint";

@@ -3,9 +3,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "fakes/FakeChanstat.h"
 #include "fakes/FakePlatform.h"
-#include "fakes/FakeServiceHost.h"
+#include "fakes/ServiceHostHarness.h"
 
 namespace mx::testing {
 namespace {
@@ -13,21 +12,13 @@ namespace {
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
-class NoListener final : public ServiceListener {
-public:
-    void setDelegate(std::shared_ptr<ServiceListenerDelegate>) override {}
-    void resume() override {}
-};
-
 class MxReportingServiceDelegateTest : public ::testing::Test {
 protected:
-    std::shared_ptr<FakeServiceConnection> accept(pid_t pid)
-    {
-        auto connection = std::make_shared<FakeServiceConnection>(pid);
-        EXPECT_TRUE(root->shouldAcceptNewConnection(listener, connection));
-        EXPECT_TRUE(connection->resumed);
-        return connection;
-    }
+    MxReportingServiceDelegateTest() { host.start(); }
+
+    std::shared_ptr<FakeServiceConnection> accept(pid_t pid) { return host.accept(pid); }
+    std::vector<std::shared_ptr<MxReportingServerInstance>> clients() { return host.clients(); }
+    void run() { platform.dispatch.runUntilIdle(); }
 
     // The endpoint the root made for that connection, once registered.
     MxReportingServerInstance& instance(const FakeServiceConnection& connection)
@@ -38,25 +29,14 @@ protected:
         throw std::logic_error("no endpoint for " + connection.description());
     }
 
-    void run() { platform.dispatch.runUntilIdle(); }
-
-    // The client list belongs to the server queue.
-    std::vector<std::shared_ptr<MxReportingServerInstance>> clients()
-    {
-        std::vector<std::shared_ptr<MxReportingServerInstance>> clients;
-        root->serverQueue()->dispatch([&] { clients = root->getAllClients(); });
-        run();
-        return clients;
-    }
-
     FakePlatform platform;
-    FakePreferences preferences;
-    FakeNotifications notifications;
-    FakeProcessTable processes;
-    FakeChanstat chanstat;
-    NoListener listener;
-    std::shared_ptr<MxReportingServiceDelegate> root =
-        MxReportingServiceDelegate::make(preferences, notifications, processes, chanstat);
+    ServiceHostHarness host{[this] {
+        run();
+    }};
+    std::shared_ptr<MxReportingServiceDelegate>& root = host.root;
+    FakePreferences& preferences = host.preferences;
+    FakeNotifications& notifications = host.notifications;
+    FakeProcessTable& processes = host.processes;
 };
 
 TEST_F(MxReportingServiceDelegateTest, AcceptedClientsAreRegisteredInOrderWithNameAndStartDate)
@@ -76,27 +56,6 @@ TEST_F(MxReportingServiceDelegateTest, AcceptedClientsAreRegisteredInOrderWithNa
     EXPECT_EQ(clients[1]->clientProcessName(), "mxreportingd");
     EXPECT_EQ(clients[2]->clientProcessName(), std::nullopt);
     EXPECT_TRUE(platform.log.contains("notify setup result 0"));
-}
-
-TEST_F(MxReportingServiceDelegateTest, LookupAcrossClientsFollowsConnectionOrderAndTheSwitch)
-{
-    auto first = accept(1);
-    auto second = accept(2);
-    run();
-    instance(*second).createReportingSession(5, [](bool) {});
-    instance(*first).createReportingSession(0, [](bool) {});
-    run();
-    platform.log.clear();
-    std::shared_ptr<MxReportingSession> found, zero, missing;
-    found = root->findReportingSessionForID(5);
-    zero = root->findReportingSessionForID(0);
-    missing = root->findReportingSessionForID(9);
-    ASSERT_TRUE(found);
-    EXPECT_EQ(found->reporterID(), 5);
-    EXPECT_FALSE(zero);
-    EXPECT_FALSE(missing);
-    EXPECT_THAT(platform.log.texts(),
-                ElementsAre("found reporting session 5 for client 2", "failed to find reporting session 9"));
 }
 
 TEST_F(MxReportingServiceDelegateTest, NotificationReReadsDefaultsPushesThemAndSetsTheSwitch)
