@@ -20,10 +20,12 @@
 
 #include <fmt/format.h>
 
+#include "Statistics/MxReportingDriverUtility.h"
 #include "Statistics/MxReportingVocabulary.h"
 #include "client/MxReportingClient.h"
 #include "platform/JsonValue.h"
 #include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/FileChanstat.h"
 #include "platform/linux/JsonPreferences.h"
 #include "wire/RootPath.h"
 
@@ -68,6 +70,10 @@ What the stores hold (newest last; --json for one JSON object a line):
   power [--limit N] [--json]        power log events (joule.db)
   sessions [--limit N] [--json]     backend sessions (uplink.db)
   messages [--limit N] [--json]     backend messages (uplink.db)
+
+Driver channels (run/harmonia/chanstat/GROUP[/SUBGROUP]/NAME, one integer a file):
+  channels [--json]                 the channels of the daemon's four drivers and their
+                                    values now, with the key their growth is reported as
 
   demo                              play a realistic session and show what happens
   help                              this text
@@ -354,6 +360,40 @@ int demo(MxReportingClient& client)
     return 0;
 }
 
+// The daemon subscribes to the files present when it starts; a channel added since is
+// listed here but sampled only after a restart.
+int channels(const std::vector<std::string>& words)
+{
+    bool json = words.size() == 2 && words[1] == "--json";
+    if (words.size() > 1 && !json)
+        throw UsageError{"channels takes --json"};
+    FileChanstat files(MxReportingPath("run/harmonia/chanstat"));
+    if (!json)
+        std::printf("%-22s %-28s %-20s %s\n", "DRIVER", "KEY", "VALUE", "FILE");
+    for (const auto& driver : MxReportingDriverUtility::drivers()) {
+        std::optional<ChanstatError> error;
+        auto found = files.copyChannelsInGroup(driver.groupName(), driver.subGroupName(), error);
+        std::optional<ChanstatChannels> samples;
+        if (found)
+            samples = files.createSamples(0, *found, error);
+        if (error)
+            std::fprintf(stderr, "mxreport: %s: %s\n", driver.description().c_str(),
+                         std::generic_category().message(error->code).c_str());
+        for (const auto& channel : samples.value_or(ChanstatChannels{})) {
+            std::string key = driver.keyPrefix() + channel.name.value_or("");
+            if (json)
+                std::puts(nlohmann::json{
+                    {"driver", driver.description()}, {"key", key}, {"value", channel.value}, {"file", channel.path}}
+                              .dump()
+                              .c_str());
+            else
+                std::printf("%-22s %-28s %-20lld %s\n", driver.description().c_str(), key.c_str(),
+                            static_cast<long long>(channel.value), channel.path.c_str());
+        }
+    }
+    return 0;
+}
+
 // The store views live in a helper of their own, so that this tool does not link
 // SQLite: it is replaced by mxreport-stores from the same directory.
 std::optional<int> viewStore(const std::vector<std::string>& words)
@@ -416,6 +456,8 @@ int run(int argc, char** argv)
         }
         if (commands[0][0] == "defaults")
             return defaults(commands[0]);
+        if (commands[0][0] == "channels")
+            return channels(commands[0]);
         if (commands[0][0] == "notify")
             return notify(commands[0]);
         if (auto status = viewStore(commands[0]))

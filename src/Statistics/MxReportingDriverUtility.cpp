@@ -17,7 +17,7 @@ const MxLogScope* MxReportingDriverUtility::logScope()
     return scope;
 }
 
-MxReportingDriverUtility::MxReportingDriverUtility(Chanstat& chanstat) : chanstat_(chanstat)
+const std::array<MxReportingDriver, 4>& MxReportingDriverUtility::drivers()
 {
     static const std::array<MxReportingDriver, 4> kDrivers = {
         MxReportingDriver{"KestrelAE2MCA", std::nullopt},
@@ -25,8 +25,13 @@ MxReportingDriverUtility::MxReportingDriverUtility(Chanstat& chanstat) : chansta
         MxReportingDriver{std::nullopt, "MCA"},
         MxReportingDriver{"Haptics", "Stats"},
     };
+    return kDrivers;
+}
+
+MxReportingDriverUtility::MxReportingDriverUtility(Chanstat& chanstat) : chanstat_(chanstat)
+{
     MXLOG(logScope(), Info, "creating driverstats driver utility");
-    for (const auto& driver : kDrivers) {
+    for (const auto& driver : drivers()) {
         std::optional<ChanstatError> error;
         auto channels = chanstat_.copyChannelsInGroup(driver.groupName(), driver.subGroupName(), error);
         if (error)

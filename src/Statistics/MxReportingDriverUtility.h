@@ -6,6 +6,7 @@
 // root; its calls are synchronous and keep no state but the subscriptions, made once
 // and only read afterwards, so any queue may call them.
 
+#include <array>
 #include <map>
 #include <memory>
 #include <optional>
@@ -36,6 +37,8 @@ public:
 
     // The "mxrd" scope of every line of the sampler.
     static const MxLogScope* logScope();
+    // The drivers it subscribes to, in order.
+    static const std::array<MxReportingDriver, 4>& drivers();
 
     const std::vector<MxReportingIOChannelSubscription>& ioChannelSubscriptions() const
     {
