@@ -322,6 +322,11 @@ int notify(const std::vector<std::string>& words)
     return 0;
 }
 
+class QuietLog final : public MxLogSink {
+public:
+    void write(const MxLogRecord&) override {}
+};
+
 int demo(MxReportingClient& client)
 {
     std::mt19937_64 random{std::random_device{}()};
@@ -344,6 +349,12 @@ int demo(MxReportingClient& client)
         {"destroy", reporter},
     };
     std::printf("demo: one long-form audio session, reporter %s\n", reporter.c_str());
+    // The same sampling as the daemon's, to show the driver growth its stop reports.
+    QuietLog quiet;
+    ScopedInstall<MxLogSink> silence(quiet);
+    FileChanstat files(MxReportingPath("run/harmonia/chanstat"));
+    MxReportingDriverUtility drivers(files);
+    auto snapShot = drivers.getSnapShot();
     Session session(client);
     for (const auto& words : script) {
         std::string line;
@@ -351,6 +362,11 @@ int demo(MxReportingClient& client)
             line += (line.empty() ? "" : " ") + word;
         std::printf("\n$ mxreport %s\n", line.c_str());
         std::fflush(stdout);
+        if (words[0] == "stop" && !drivers.ioChannelSubscriptions().empty()) {
+            auto growth = drivers.getDriverStatisticsRelativeToSnapShot(&snapShot);
+            std::printf("(driver growth since the start, sent as a DriverStats message: %s)\n",
+                        growth ? Value(*growth).description().c_str() : "none grew");
+        }
         if (!session.run(words))
             return kExitRefused;
         std::fflush(stdout);
