@@ -364,11 +364,18 @@ TEST_F(MxReportingServerInstanceTest, DisconnectionStopsSessionsOnceAndNeverAnsw
     Replies<bool> started;
     client->startReportingSessionForID(5, started.callback());
     run();
+    create(*client, 7);
+    client->startReportingSessionForID(7, [](bool) {});
+    run();
+    host.chanstat.values["Speaker/underruns"] = 7; // grown since both starts
+    client->destroyReportingSession(7, [](bool) {});
+    run();
     platform.trace.clear();
 
     client->handleConnectionError();
     client->handleConnectionError();
     run();
+    EXPECT_THAT(tallyNames(), IsEmpty()) << "neither a destroy nor a disconnection sends driver statistics";
 
     EXPECT_TRUE(host.clients().empty());
     EXPECT_EQ(platform.log.count("removing 42 from the server client list"), 1u);
