@@ -459,47 +459,56 @@ TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)
     auto channel = [&](const std::string& relative, std::int64_t value) {
         daemon.writeFile("run/harmonia/chanstat/" + relative, std::to_string(value) + "\n");
     };
-    channel("KestrelAE2MCA/overloads", 1);
     channel("Speaker/Amp/underruns", 10);
     channel("Speaker/Amp/level", 50);
     channel("Front/MCA/late", 0);
     channel("Haptics/Stats/pulses", 100);
     daemon.start();
-    channel("Late/MCA/added", 0); // a subscription is fixed when made
+    channel("Late/MCA/added", 0);          // a subscription is fixed when made,
+    channel("KestrelAE2MCA/overloads", 1); // and a driver missing then is never sampled
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
     ASSERT_TRUE(*client->createReportingSession(6).value);
     ASSERT_TRUE(*client->setServiceType(7, 6).value);
     client->startReportingSessionForID(6, nullptr);
     ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{6}));
+    channel("KestrelAE2MCA/overloads", 8);
     channel("Speaker/Amp/underruns", 13);
     channel("Speaker/Amp/level", 20); // down: not reported
     channel("Front/MCA/late", 4);
     channel("Late/MCA/added", 9);
     channel("Haptics/Stats/pulses", 105);
-    std::filesystem::remove(daemon.path("run/harmonia/chanstat/KestrelAE2MCA/overloads"));
+    ASSERT_TRUE(*client->stopReportingSessionForID(6).value);
+    auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
+    EXPECT_EQ(nlohmann::json::parse(std::ifstream(summary))[2]["DriverStats_Generic_1"]["Haptics_Stats_pulses"], 5);
+
+    // A second period, whose stop finds a channel gone: only that driver is lost.
+    client->startReportingSessionForID(6, nullptr);
+    ASSERT_TRUE(client->reporterID(6).value) << "the start (and its snapshot) came first";
+    channel("Haptics/Stats/pulses", 107);
+    std::filesystem::remove(daemon.path("run/harmonia/chanstat/Speaker/Amp/level"));
+    channel("Speaker/Amp/underruns", 20);
     ASSERT_TRUE(*client->stopReportingSessionForID(6).value);
     EXPECT_TRUE(daemon.waitForLog("ChanstatCreateSamples error 2"));
 
     daemon.signal(SIGTERM);
     ASSERT_EQ(daemon.waitForExit(), 0);
     Dictionary expected{{"Speaker_underruns", 3}, {"MCA_late", 4}, {"Haptics_Stats_pulses", 5}};
-    auto event =
-        daemon.query("tally", "SELECT payload FROM events WHERE name = 'com.kestrel.harmonia.DriverStats.Generic'");
-    ASSERT_EQ(event.size(), 1u);
+    auto event = daemon.query(
+        "tally", "SELECT payload FROM events WHERE name = 'com.kestrel.harmonia.DriverStats.Generic' ORDER BY id");
+    ASSERT_EQ(event.size(), 2u);
+    EXPECT_EQ(nlohmann::json::parse(event[1][0]).dump(),
+              R"({"Haptics_Stats_pulses":2,"HostApplicationDisplayID":"Unknown"})");
     auto payload = nlohmann::json::parse(event[0][0]);
     EXPECT_EQ(payload.size(), 4u) << payload.dump() << ": the statistics and the host";
     for (const auto& [key, value] : expected)
         EXPECT_EQ(payload[key], value.int64Value()) << key;
     auto messages =
-        daemon.query("uplink", "SELECT category, type, payload FROM messages WHERE session IS NOT NULL ORDER BY id");
+        daemon.query("uplink", "SELECT category, type, payload FROM messages WHERE session = 1 ORDER BY id");
     ASSERT_EQ(messages.size(), 3u);
     EXPECT_EQ(messages[1][0], "9") << "the statistics come before the summary";
     EXPECT_EQ(messages[2][1], "65535");
     EXPECT_EQ(nlohmann::json::parse(messages[2][2])["Speaker_underruns"], "3");
-    auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
-    std::ifstream file(summary);
-    EXPECT_EQ(nlohmann::json::parse(file)[2]["DriverStats_Generic_1"]["Haptics_Stats_pulses"], 5);
 }
 
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
