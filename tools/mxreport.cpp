@@ -15,6 +15,7 @@
 #include <random>
 #include <sstream>
 #include <string>
+#include <thread>
 #include <unistd.h>
 #include <vector>
 
@@ -22,6 +23,7 @@
 
 #include "Statistics/MxReportingDriverUtility.h"
 #include "Statistics/MxReportingVocabulary.h"
+#include "Statistics/Service/MxReportingBlockThrottle.h"
 #include "client/MxReportingClient.h"
 #include "platform/JsonValue.h"
 #include "platform/linux/DatagramNotifications.h"
@@ -70,6 +72,14 @@ What the stores hold (newest last; --json for one JSON object a line):
   power [--limit N] [--json]        power log events (joule.db)
   sessions [--limit N] [--json]     backend sessions (uplink.db)
   messages [--limit N] [--json]     backend messages (uplink.db)
+
+The block throttle (a burst of one message key delivers only its last message):
+  throttle-key JSON_OBJECT [--reporter ID] [--category C] [--type T]
+                                    print the message key, then the throttle time
+  stream [--throttle] [-v] [ID...]  send one JSON object a line from stdin,
+                                    {"payload": {...}, "category": C, "type": T}, to the IDs
+                                    (none: to every started session); --throttle holds each
+                                    in one throttle and waits for the last at end of input
 
 Driver channels (run/harmonia/chanstat/GROUP[/SUBGROUP]/NAME, one integer a file):
   channels [--json]                 the channels of the daemon's four drivers and their
@@ -376,6 +386,119 @@ int demo(MxReportingClient& client)
     return 0;
 }
 
+// The throttle's lines on stderr, its debug lines only when asked for.
+class StderrLog final : public MxLogSink {
+public:
+    explicit StderrLog(bool verbose) : verbose_(verbose) {}
+    void write(const MxLogRecord& record) override
+    {
+        if (record.level != MxLogLevel::Debug || verbose_)
+            std::fprintf(stderr, "%s\n", record.message.c_str());
+    }
+
+private:
+    bool verbose_;
+};
+
+int throttleKey(const std::vector<std::string>& words)
+{
+    if (words.size() < 2 || words.size() % 2 != 0)
+        throw UsageError{"throttle-key JSON_OBJECT [--reporter ID] [--category C] [--type T]"};
+    Dictionary payload = parseObject(words[1]);
+    ReporterID reporter = 0;
+    MessageCategory category = 0;
+    MessageType type = 0;
+    for (std::size_t i = 2; i < words.size(); i += 2) {
+        if (words[i] == "--reporter")
+            reporter = parseInteger(words[i + 1], "reporter ID");
+        else if (words[i] == "--category")
+            category = parseCategory(words[i + 1]);
+        else if (words[i] == "--type")
+            type = parseMessageType(words[i + 1]);
+        else
+            throw UsageError{"unknown option " + words[i]};
+    }
+    std::printf("%s\n", MxReportingBlockThrottle::buildMessageKey(payload, reporter, category, type).c_str());
+    std::printf("%s\n", fmt::format("{}", MxReportingBlockThrottle::determineSleepTime(payload)).c_str());
+    return 0;
+}
+
+// One line of a stream: the message and where it goes.
+struct StreamedMessage {
+    Dictionary payload;
+    MessageCategory category = 0;
+    MessageType type = 0;
+};
+
+StreamedMessage parseStreamLine(const std::string& line)
+{
+    auto json = nlohmann::ordered_json::parse(line, nullptr, /*allow_exceptions=*/false);
+    if (!json.is_object() || !json.contains("payload") || !json["payload"].is_object())
+        throw UsageError{"expected {\"payload\": {...}, \"category\": C, \"type\": T}"};
+    auto code = [&](const char* key) {
+        const auto& value = json.contains(key) ? json[key] : nlohmann::ordered_json(0);
+        return value.is_string() ? value.get<std::string>() : value.dump();
+    };
+    return {*fromJson(json["payload"]).asDictionary(), parseCategory(code("category")), parseMessageType(code("type"))};
+}
+
+int stream(MxReportingClient& client, const std::vector<std::string>& words)
+{
+    bool throttled = false;
+    bool verbose = false;
+    std::optional<std::vector<ReporterID>> ids;
+    for (std::size_t i = 1; i < words.size(); ++i) {
+        if (words[i] == "--throttle")
+            throttled = true;
+        else if (words[i] == "-v")
+            verbose = true;
+        else
+            (ids ? *ids : ids.emplace()).push_back(parseInteger(words[i], "reporter ID"));
+    }
+    StderrLog log(verbose);
+    ScopedInstall<MxLogSink> installLog(log);
+    std::atomic<int> failures{0};
+    // Each delivery waits for the daemon's reply: a daemon that does not answer keeps
+    // the throttle busy rather than piling requests up.
+    auto send = [&client, ids, &failures](const StreamedMessage& message) {
+        auto outcome = client.sendMessage(message.payload, message.category, message.type, ids);
+        if (!outcome || outcome.value->has_value()) {
+            std::fprintf(stderr, "mxreport: send: %s\n",
+                         outcome ? "refused: reporting is off" : outcome.error->message.c_str());
+            ++failures;
+        }
+    };
+    auto throttle = throttled ? MxReportingBlockThrottle::make() : nullptr;
+    std::string line;
+    for (int number = 1; std::getline(std::cin, line); ++number) {
+        if (line.empty())
+            continue;
+        try {
+            auto message = parseStreamLine(line);
+            if (!throttle) {
+                send(message);
+                continue;
+            }
+            ReporterID reporter = ids && !ids->empty() ? ids->front() : 0;
+            throttle->addMessageBlock([send, message] { send(message); }, reporter, message.payload, message.category,
+                                      message.type);
+        } catch (const UsageError& usage) {
+            std::fprintf(stderr, "mxreport: line %d: %s\n", number, usage.message.c_str());
+            ++failures;
+        }
+    }
+    if (throttle) {
+        throttle->waitForCompletion();
+        // The worker lets go of the throttle after its next pass.
+        throttle->setShouldKeepRunning(false);
+        std::weak_ptr<MxReportingBlockThrottle> ending = throttle;
+        throttle.reset();
+        for (int i = 0; i < 100 && !ending.expired(); ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return failures > 0 ? kExitRefused : 0;
+}
+
 // The daemon subscribes to the files present when it starts; a channel added since is
 // listed here but sampled only after a restart.
 int channels(const std::vector<std::string>& words)
@@ -474,6 +597,8 @@ int run(int argc, char** argv)
             return defaults(commands[0]);
         if (commands[0][0] == "channels")
             return channels(commands[0]);
+        if (commands[0][0] == "throttle-key")
+            return throttleKey(commands[0]);
         if (commands[0][0] == "notify")
             return notify(commands[0]);
         if (auto status = viewStore(commands[0]))
@@ -488,6 +613,8 @@ int run(int argc, char** argv)
         client->setTimeout(timeout);
         if (commands[0][0] == "demo")
             return demo(*client);
+        if (commands[0][0] == "stream")
+            return stream(*client, commands[0]);
         Session session(*client);
         for (const auto& command : commands)
             if (!session.run(command))

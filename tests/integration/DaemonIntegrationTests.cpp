@@ -511,6 +511,35 @@ TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)
     EXPECT_EQ(nlohmann::json::parse(messages[2][2])["Speaker_underruns"], "3");
 }
 
+TEST_F(DaemonIntegrationTest, AStreamThroughTheThrottleDeliversTheLastOfEachBurstOnce)
+{
+    std::string input;
+    for (int i = 0; i < 5; ++i)
+        input += fmt::format(
+            R"({{"payload": {{"level": 3, "mxreporting_timestamp": {}}}, "category": 1, "type": "Generic"}})"
+            "\n",
+            i);
+    input += R"({"payload": {"level": 4, "_throttle_seconds": 0}, "category": "Generic", "type": 0})"
+             "\n";
+    std::string output;
+    auto began = std::chrono::steady_clock::now();
+    EXPECT_EQ(daemon.runToEnd({MXREPORT_PATH, "stream", "--throttle", "-v"}, output, input), 0) << output;
+    EXPECT_GE(std::chrono::steady_clock::now() - began, std::chrono::milliseconds(450)) << "held for its throttle time";
+    EXPECT_THAT(output, ::testing::HasSubstr("Dropping duplicate message for level|3|mxreporting_timestamp|^|"));
+    EXPECT_THAT(output, ::testing::HasSubstr("waitForCompletion. timersInFlight="));
+    auto sent = daemon.query("uplink", "SELECT payload FROM messages WHERE session IS NULL ORDER BY id");
+    ASSERT_EQ(sent.size(), 2u) << "one delivery a key";
+    std::vector<std::string> payloads{sent[0][0], sent[1][0]};
+    EXPECT_THAT(payloads,
+                ::testing::UnorderedElementsAre(R"({"level":3,"mxreporting_timestamp":4})",
+                                                R"({"level":4,"_throttle_seconds":0})"));
+    EXPECT_EQ(daemon.runToEnd(
+                  {MXREPORT_PATH, "throttle-key", R"({"b": 2, "a": "x", "systemuptime_sec": 12})", "--reporter", "42"},
+                  output),
+              0);
+    EXPECT_EQ(output, "a|x|b|2|systemuptime_sec|^|reporterID|42|Undefined|Generic\n0.5\n");
+}
+
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();

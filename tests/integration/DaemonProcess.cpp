@@ -20,7 +20,7 @@ namespace {
 // Everything the child needs is made before fork: the test's other threads may hold
 // the allocator's locks, so the child calls nothing but what is async-signal-safe.
 pid_t forkExec(const std::filesystem::path& root, const std::vector<std::string>& arguments, const std::string& log,
-               int logFlags)
+               int logFlags, const std::string& input = "/dev/null")
 {
     std::vector<std::string> environment;
     for (char** entry = environ; *entry != nullptr; ++entry) {
@@ -45,6 +45,7 @@ pid_t forkExec(const std::filesystem::path& root, const std::vector<std::string>
         int fd = ::open(log.c_str(), O_WRONLY | O_CREAT | logFlags, 0644);
         dup2(fd, STDOUT_FILENO);
         dup2(fd, STDERR_FILENO);
+        dup2(::open(input.c_str(), O_RDONLY), STDIN_FILENO);
         execve(argv[0], argv.data(), envp.data());
         _exit(127);
     }
@@ -91,10 +92,13 @@ pid_t DaemonProcess::spawn(const std::vector<std::string>& arguments) const
     return forkExec(root_, arguments, (root_ / "spawned.log").string(), O_APPEND);
 }
 
-int DaemonProcess::runToEnd(const std::vector<std::string>& arguments, std::string& output) const
+int DaemonProcess::runToEnd(const std::vector<std::string>& arguments, std::string& output,
+                            const std::string& input) const
 {
+    std::string inputPath = (root_ / "input.txt").string();
+    std::ofstream(inputPath) << input;
     int status = 0;
-    waitpid(spawn(arguments), &status, 0);
+    waitpid(forkExec(root_, arguments, (root_ / "spawned.log").string(), O_TRUNC, inputPath), &status, 0);
     std::ifstream log(root_ / "spawned.log");
     output.assign(std::istreambuf_iterator<char>(log), std::istreambuf_iterator<char>());
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);

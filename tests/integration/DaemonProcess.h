@@ -43,8 +43,9 @@ public:
 
     // Runs another program with this root in its environment; returns its pid.
     pid_t spawn(const std::vector<std::string>& arguments) const;
-    // Runs it to its end: its exit status, and what it printed in `output`.
-    int runToEnd(const std::vector<std::string>& arguments, std::string& output) const;
+    // Runs it to its end with `input` on its stdin: its exit status, and what it
+    // printed in `output`.
+    int runToEnd(const std::vector<std::string>& arguments, std::string& output, const std::string& input = "") const;
 
 private:
     std::filesystem::path root_;

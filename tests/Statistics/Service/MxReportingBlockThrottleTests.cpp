@@ -1,0 +1,124 @@
+#include "Statistics/Service/MxReportingBlockThrottle.h"
+
+#include <future>
+#include <thread>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "fakes/FakePlatform.h"
+
+namespace mx::testing {
+namespace {
+
+using ::testing::ElementsAre;
+using Throttle = MxReportingBlockThrottle;
+
+TEST(MxReportingBlockThrottleKeyTest, KeysSortNamesAndLeaveExemptValuesOut)
+{
+    EXPECT_EQ(Throttle::buildMessageKey(Dictionary{{"b", 2}, {"a", "x"}, {"systemuptime_sec", 12}}, 42, 0, 0),
+              "a|x|b|2|systemuptime_sec|^|reporterID|42|Undefined|Generic");
+    EXPECT_EQ(Throttle::buildMessageKey(Dictionary{}, -7, 0x08000003, 1), "reporterID|-7|Session_Playback|Start");
+    EXPECT_EQ(Throttle::buildMessageKey(Dictionary{{"a", 1}, {"B", 2}, {"10", 3}, {"9", 4}}, 0, 0, 0),
+              "10|3|9|4|B|2|a|1|reporterID|0|Undefined|Generic");
+    auto key = [](Dictionary message) {
+        return Throttle::buildMessageKey(message, 1, 3, 1);
+    };
+    EXPECT_EQ(key({{"v", 1}, {"mxreporting_timestamp", 5}}), key({{"v", 1}, {"mxreporting_timestamp", 6}}));
+    EXPECT_NE(key({{"v", 1}, {"mxreporting_timestamp", 5}}), key({{"v", 1}})) << "the name still counts";
+    EXPECT_EQ(key({{"count", 1}, {"_comparison_field_blacklist", Array{"count"}}}),
+              key({{"count", 2}, {"_comparison_field_blacklist", Array{"count"}}}));
+    EXPECT_EQ(key({{"Volume", 0.5}, {"VolumeOperationTime", 1}}), key({{"Volume", 0.7}, {"VolumeOperationTime", 2}}));
+    EXPECT_NE(key({{"Volume", 0.5}}), key({{"Volume", 0.7}})) << "the volume alone is compared";
+}
+
+TEST(MxReportingBlockThrottleKeyTest, ThrottleTimesAreTheMessagesOwnWithinTheirLimit)
+{
+    FakePlatform platform;
+    auto time = [](Value seconds) {
+        return Throttle::determineSleepTime(Dictionary{{"_throttle_seconds", seconds}});
+    };
+    EXPECT_EQ(Throttle::determineSleepTime(Dictionary{}), 0.5);
+    EXPECT_EQ(time(4.99), double(4.99f)) << "single precision, widened";
+    EXPECT_EQ(time(4.9), double(4.9f)) << "the limit is on the whole part";
+    EXPECT_EQ(time(-1), -1.0);
+    EXPECT_EQ(time(0), 0.0);
+    EXPECT_TRUE(platform.log.texts().empty());
+    EXPECT_EQ(time(5), 0.5);
+    EXPECT_EQ(time(18446744073709551615ull), 0.5);
+    EXPECT_EQ(time("3"), 0.5);
+    EXPECT_THAT(platform.log.texts(MxLogLevel::Info),
+                ElementsAre("Rejecting large throttle time. {time=5, max=5.000000}",
+                            "Rejecting large throttle time. {time=18446744073709551615, max=5.000000}",
+                            "Rejecting non KvNumber value of throttle time. {time=3}"));
+}
+
+class MxReportingBlockThrottleTest : public ::testing::Test {
+protected:
+    // The worker lets go of the throttle after its next pass; it must be gone before
+    // the log it writes to.
+    void TearDown() override
+    {
+        throttle->setShouldKeepRunning(false);
+        std::weak_ptr<Throttle> ending = throttle;
+        throttle.reset();
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+        while (!ending.expired() && std::chrono::steady_clock::now() < deadline)
+            std::this_thread::yield();
+        ASSERT_TRUE(ending.expired());
+    }
+
+    void add(Dictionary message, std::function<void()> block) { throttle->addMessageBlock(block, 7, message, 3, 1); }
+
+    FakePlatform platform;
+    std::shared_ptr<Throttle> throttle = Throttle::make();
+    std::mutex mutex;
+    std::vector<std::string> delivered;
+    std::function<void()> deliver(std::string name)
+    {
+        return [this, name] {
+            std::lock_guard lock(mutex);
+            delivered.push_back(name);
+        };
+    }
+};
+
+TEST_F(MxReportingBlockThrottleTest, ABurstDeliversItsLastMessageOnceAndKeysInFireDateOrder)
+{
+    auto began = std::chrono::steady_clock::now();
+    add({{"level", 1}, {"_throttle_seconds", 0.3}}, deliver("first of burst"));
+    add({{"other", 1}, {"_throttle_seconds", 0.1}}, deliver("other"));
+    add({{"level", 1}, {"_throttle_seconds", 0.3}}, deliver("last of burst"));
+    throttle->waitForCompletion();
+    EXPECT_GE(std::chrono::steady_clock::now() - began, std::chrono::milliseconds(250));
+    std::lock_guard lock(mutex);
+    EXPECT_THAT(delivered, ElementsAre("other", "last of burst"));
+    EXPECT_TRUE(platform.log.contains("waitForCompletion. timersInFlight=2 unscheduledTimerKeys=2") ||
+                platform.log.contains("waitForCompletion. timersInFlight=2 unscheduledTimerKeys=0"));
+}
+
+TEST_F(MxReportingBlockThrottleTest, ADeliveryThatThrowsStillLeavesAndLaterOnesRun)
+{
+    add({{"a", 1}, {"_throttle_seconds", 0}}, [] { throw std::runtime_error("delivery broke"); });
+    throttle->waitForCompletion();
+    EXPECT_TRUE(platform.log.contains("a held delivery failed: delivery broke"));
+    add({{"a", 1}, {"_throttle_seconds", -1}}, deliver("again"));
+    throttle->waitForCompletion();
+    std::lock_guard lock(mutex);
+    EXPECT_THAT(delivered, ElementsAre("again"));
+}
+
+TEST_F(MxReportingBlockThrottleTest, WaitingGivesUpAfterFiveSecondsAndTheDeliveryStillRuns)
+{
+    std::promise<void> released;
+    add({{"slow", 1}, {"_throttle_seconds", 0}}, [future = released.get_future().share()] { future.wait(); });
+    throttle->waitForCompletion();
+    EXPECT_TRUE(platform.log.contains("Giving up on waiting for completion after 5 seconds. timersInFlight=1"));
+    released.set_value();
+    throttle->waitForCompletion();
+    EXPECT_EQ(platform.log.count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"), 1u)
+        << "the second wait saw it run";
+}
+
+} // namespace
+} // namespace mx::testing
