@@ -21,7 +21,7 @@ TEST(MxReportingBlockThrottleKeyTest, KeysSortNamesAndLeaveExemptValuesOut)
     EXPECT_EQ(Throttle::buildMessageKey(Dictionary{}, -7, 0x08000003, 1), "reporterID|-7|Session_Playback|Start");
     EXPECT_EQ(Throttle::buildMessageKey(Dictionary{{"a", 1}, {"B", 2}, {"10", 3}, {"9", 4}}, 0, 0, 0),
               "10|3|9|4|B|2|a|1|reporterID|0|Undefined|Generic");
-    auto key = [](Dictionary message) {
+    auto key = [](const Dictionary& message) {
         return Throttle::buildMessageKey(message, 1, 3, 1);
     };
     EXPECT_EQ(key({{"v", 1}, {"mxreporting_timestamp", 5}}), key({{"v", 1}, {"mxreporting_timestamp", 6}}));
@@ -68,13 +68,16 @@ protected:
         ASSERT_TRUE(ending.expired());
     }
 
-    void add(Dictionary message, std::function<void()> block) { throttle->addMessageBlock(block, 7, message, 3, 1); }
+    void add(const Dictionary& message, std::function<void()> block)
+    {
+        throttle->addMessageBlock(std::move(block), 7, message, 3, 1);
+    }
 
     FakePlatform platform;
     std::shared_ptr<Throttle> throttle = Throttle::make();
     std::mutex mutex;
     std::vector<std::string> delivered;
-    std::function<void()> deliver(std::string name)
+    std::function<void()> deliver(const std::string& name)
     {
         return [this, name] {
             std::lock_guard lock(mutex);
