@@ -7,6 +7,7 @@
 // cannot be reached; 64 bad usage.
 
 #include <algorithm>
+#include <charconv>
 #include <cstdio>
 #include <cstring>
 #include <fstream>
@@ -103,6 +104,16 @@ std::int64_t parseInteger(const std::string& text, const char* what)
     } catch (const std::exception&) {
     }
     throw UsageError{fmt::format("{} must be a number, not \"{}\"", what, text)};
+}
+
+// Decimal only, where a leading zero must not make a number octal.
+std::int64_t parseDecimal(const std::string& text, const char* what)
+{
+    std::int64_t value = 0;
+    auto [end, failure] = std::from_chars(text.data(), text.data() + text.size(), value, 10);
+    if (text.empty() || failure != std::errc() || end != text.data() + text.size())
+        throw UsageError{fmt::format("{} must be a decimal number, not \"{}\"", what, text)};
+    return value;
 }
 
 template <class Name>
@@ -410,7 +421,7 @@ int throttleKey(const std::vector<std::string>& words)
     MessageType type = 0;
     for (std::size_t i = 2; i < words.size(); i += 2) {
         if (words[i] == "--reporter")
-            reporter = parseInteger(words[i + 1], "reporter ID");
+            reporter = parseDecimal(words[i + 1], "reporter ID");
         else if (words[i] == "--category")
             category = parseCategory(words[i + 1]);
         else if (words[i] == "--type")
