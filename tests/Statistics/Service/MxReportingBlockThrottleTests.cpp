@@ -66,6 +66,8 @@ protected:
         while (!ending.expired() && std::chrono::steady_clock::now() < deadline)
             std::this_thread::yield();
         ASSERT_TRUE(ending.expired());
+        // Through the log's lock: its last line is then seen before the log goes.
+        platform.log.clear();
     }
 
     void add(const Dictionary& message, std::function<void()> block)
