@@ -193,6 +193,19 @@ TEST_F(DaemonIntegrationTest, AClientThatPipelinesAndNeverReadsIsHeldAtItsBoundA
     EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(1));
 }
 
+TEST_F(DaemonIntegrationTest, AClientThatLeavesWhileHeldAtItsBoundIsNoticed)
+{
+    auto client = connect();
+    // Held start replies keep requests in flight: 300 of them pass the bound.
+    for (ReporterID id = 1; id <= 300; ++id)
+        client->createReportingSession(id, nullptr);
+    for (ReporterID id = 1; id <= 300; ++id)
+        client->startReportingSessionForID(id, nullptr);
+    ASSERT_TRUE(daemon.waitForLog("session created for reporter 300"));
+    client.reset();
+    EXPECT_TRUE(daemon.waitForLog(fmt::format("removing {} from the server client list", getpid())));
+}
+
 TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)
 {
     auto bystander = connect();

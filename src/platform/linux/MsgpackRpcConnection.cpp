@@ -1,5 +1,6 @@
 #include "platform/linux/MsgpackRpcConnection.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 
 #include <asio/buffer.hpp>
@@ -146,8 +147,10 @@ void MsgpackRpcConnection::processBuffered()
             // holds itself until it reads again or closes.
             holdWhilePaused_ = shared_from_this();
             paused_.store(true);
-            if (overBound())
+            if (overBound()) {
+                watchForHangUp();
                 return;
+            }
             paused_.store(false);
             holdWhilePaused_.reset();
         }
@@ -164,6 +167,27 @@ void MsgpackRpcConnection::processBuffered()
             break;
         }
     }
+}
+
+// While paused no read is outstanding, so a client that leaves would go unnoticed
+// until what it waits on completes, which may be never (held start replies): the
+// socket is looked at now and then instead.
+void MsgpackRpcConnection::watchForHangUp()
+{
+    if (hangUpWatch_.has_value() || closed_)
+        return;
+    hangUpWatch_.emplace(socket_.get_executor(), kHangUpWatchInterval);
+    hangUpWatch_->async_wait([self = shared_from_this()](const std::error_code&) {
+        self->hangUpWatch_.reset();
+        if (self->closed_ || !self->paused_.load())
+            return;
+        pollfd descriptor{self->socket_.native_handle(), POLLRDHUP, 0};
+        if (::poll(&descriptor, 1, 0) == 1 && (descriptor.revents & (POLLHUP | POLLRDHUP | POLLERR)) != 0) {
+            self->close({});
+            return;
+        }
+        self->watchForHangUp();
+    });
 }
 
 void MsgpackRpcConnection::resumeIfPaused()

@@ -6,14 +6,17 @@
 // replies exceed a bound. Lives on the connection layer's I/O thread; replies may be sent from any thread.
 
 #include <atomic>
+#include <chrono>
 #include <deque>
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 
 #include <asio/io_context.hpp>
 #include <asio/local/stream_protocol.hpp>
+#include <asio/steady_timer.hpp>
 #include <msgpack.hpp>
 
 #include "platform/ServiceConnection.h"
@@ -30,6 +33,8 @@ public:
     // two away, and leave room for a client's held start replies.
     static constexpr std::size_t kMaximumRequestsInFlight = 256;
     static constexpr std::size_t kMaximumBytesInFlight = std::size_t{4} << 20;
+    // How often a paused connection looks whether its client is still there.
+    static constexpr std::chrono::milliseconds kHangUpWatchInterval{500};
     // A reply batch starts this small: most hold a reply or two.
     static constexpr std::size_t kReplyBufferBytes = 512;
 
@@ -59,6 +64,7 @@ private:
     void processBuffered();
     bool overBound() const;
     void resumeIfPaused();
+    void watchForHangUp();
     bool handleMessage(const Value& message, std::size_t bytes);
     void flushReplies();
     void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
@@ -87,6 +93,7 @@ private:
     // threads after they lower them: one of the two always sees the other.
     std::atomic<bool> paused_{false};
     std::shared_ptr<MsgpackRpcConnection> holdWhilePaused_; // I/O thread only
+    std::optional<asio::steady_timer> hangUpWatch_;         // I/O thread only
     std::atomic<bool> resumePosted_{false};
     std::atomic<std::size_t> requestsInFlight_{0};
     std::atomic<std::size_t> bytesInFlight_{0};
