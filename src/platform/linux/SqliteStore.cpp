@@ -165,12 +165,6 @@ void SqliteStore::flush()
     changed_.wait(lock, [&] { return committed_ >= target; });
 }
 
-std::uint64_t SqliteStore::failures() const
-{
-    std::lock_guard lock(mutex_);
-    return failures_;
-}
-
 void SqliteStore::run()
 {
     std::unique_lock lock(mutex_);
@@ -202,12 +196,6 @@ void SqliteStore::run()
         committed_ += batch.size();
         changed_.notify_all();
     }
-}
-
-std::uint64_t SqliteStore::prunedUnexported() const
-{
-    std::lock_guard lock(mutex_);
-    return prunedUnexported_;
 }
 
 std::uint64_t SqliteStore::dataBytes()
@@ -284,11 +272,8 @@ void SqliteStore::prune()
         sqlite3_exec(connection_.database, sql.c_str(), nullptr, nullptr, nullptr);
     sqlite3_exec(connection_.database, "PRAGMA incremental_vacuum", nullptr, nullptr, nullptr);
     MXLOG(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(), pruned);
-    if (unexported > 0) {
+    if (unexported > 0)
         MXLOG(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(), unexported);
-        std::lock_guard lock(mutex_);
-        prunedUnexported_ += static_cast<std::uint64_t>(unexported);
-    }
 }
 
 // Holds the batch until it commits. Meanwhile nothing more is taken from the queue,
@@ -307,7 +292,6 @@ void SqliteStore::write(std::deque<SqliteWrite>& batch)
             return;
         }
         std::unique_lock lock(mutex_);
-        ++failures_;
         if (attempts++ == 0)
             MXLOG(nullptr, Error,
                   "{}: cannot write ({}); holding {} rows and retrying, callers wait while {} more queue",

@@ -99,10 +99,6 @@ public:
     std::int64_t queryInteger(const std::string& sql);
 
     const std::filesystem::path& path() const { return path_; }
-    // Failed attempts to write a batch, since the store opened.
-    std::uint64_t failures() const;
-    // Rows pruned before they were exported, since the store opened.
-    std::uint64_t prunedUnexported() const;
 
 private:
     // One open database file with its prepared statements. Writer thread only, once
@@ -135,13 +131,11 @@ private:
     Connection connection_;
     std::chrono::steady_clock::time_point lastPrune_{};
 
-    mutable std::mutex mutex_;
+    std::mutex mutex_;
     std::condition_variable changed_;
     std::deque<SqliteWrite> queue_;
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
-    std::uint64_t failures_ = 0;
-    std::uint64_t prunedUnexported_ = 0;
     bool stopping_ = false;
     bool writerWaiting_ = false;
     std::thread writer_;
