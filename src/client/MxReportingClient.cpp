@@ -19,7 +19,9 @@
 namespace mx {
 
 // The socket and everything in flight on it, owned by the client's I/O thread.
-class MxReportingClient::Connection : public std::enable_shared_from_this<Connection> {
+// Handlers capture the connection bare: the destructor joins the thread, so none
+// outlives it, and none may own it (the last owner would then join its own thread).
+class MxReportingClient::Connection {
 public:
     Connection() : keepRunning_(io_.get_executor()), socket_(io_) {}
 
@@ -52,7 +54,7 @@ public:
         auto bytes = std::make_shared<msgpack::sbuffer>();
         std::uint32_t msgid = nextMsgid_.fetch_add(1);
         encodeRpcRequest(*bytes, msgid, method, params);
-        asio::post(io_, [self = shared_from_this(), msgid, bytes = std::move(bytes), done = std::move(done)]() mutable {
+        asio::post(io_, [self = this, msgid, bytes = std::move(bytes), done = std::move(done)]() mutable {
             if (self->closed_) {
                 if (done)
                     done({std::nullopt, MxClientError{MxClientError::Kind::Disconnected, 0, "connection closed"}});
@@ -245,13 +247,13 @@ std::filesystem::path MxReportingClient::defaultSocketPath() { return MxReportin
 
 std::unique_ptr<MxReportingClient> MxReportingClient::connect(const std::filesystem::path& socket, std::string& error)
 {
-    auto connection = std::make_shared<Connection>();
+    auto connection = std::make_unique<Connection>();
     if (!connection->open(socket, error))
         return nullptr;
     return std::unique_ptr<MxReportingClient>(new MxReportingClient(std::move(connection)));
 }
 
-MxReportingClient::MxReportingClient(std::shared_ptr<Connection> connection) : connection_(std::move(connection)) {}
+MxReportingClient::MxReportingClient(std::unique_ptr<Connection> connection) : connection_(std::move(connection)) {}
 
 MxReportingClient::~MxReportingClient() = default;
 

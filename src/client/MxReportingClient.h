@@ -3,7 +3,8 @@
 // socket, with one call per protocol operation in two forms. The asynchronous form
 // takes a callback, run once on the client's I/O thread with the reply or an error;
 // any number of requests may be in flight. The synchronous form waits for the reply
-// (never call it from inside a callback). Thread-safe.
+// (never call it from inside a callback), and the client is never destroyed from
+// inside one. Thread-safe.
 
 #include <chrono>
 #include <cstdint>
@@ -97,12 +98,12 @@ public:
 
 private:
     class Connection;
-    explicit MxReportingClient(std::shared_ptr<Connection> connection);
+    explicit MxReportingClient(std::unique_ptr<Connection> connection);
 
     template <class T>
     MxClientResult<T> wait(const std::function<void(Callback<T>)>& start);
 
-    std::shared_ptr<Connection> connection_;
+    std::unique_ptr<Connection> connection_;
     std::chrono::milliseconds timeout_ = kDefaultTimeout;
 };
 
