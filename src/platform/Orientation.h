@@ -1,8 +1,7 @@
 #pragma once
 // Orientation notifications of the audio toolbox: the device's physical orientation
 // and the user interface's, delivered to callbacks registered under an identifier.
-// Not built yet: no Linux implementation, and sessions do not track orientation
-// until there is one.
+// Registering does not report the current orientation: only changes after it.
 
 #include <cstdint>
 #include <functional>
@@ -17,9 +16,11 @@ public:
     virtual ~Orientation() = default;
     // From now on `callback` runs, on a thread of the orientation service, on every
     // change. Registering again under the same identifier replaces the callback.
+    // Callable from any thread.
     virtual void registerDeviceOrientation(const std::string& identifier, std::function<void(int)> callback) = 0;
     virtual void registerUIOrientation(const std::string& identifier, std::function<void(int)> callback) = 0;
-    // Ends the registration; no callback of it starts after this returns.
+    // Ends the registration; no callback of it starts after this returns, and one
+    // running on another thread has returned. Callable from a callback too.
     virtual void unregisterDeviceOrientation(const std::string& identifier) = 0;
     virtual void unregisterUIOrientation(const std::string& identifier) = 0;
     virtual std::string orientationName(int orientation) = 0;

@@ -18,6 +18,7 @@
 #include "Statistics/Service/MxReportingSessionSummary.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/DatagramOrientation.h"
 #include "platform/linux/FileChanstat.h"
 #include "platform/linux/InstanceLock.h"
 #include "platform/linux/JournalLogSink.h"
@@ -43,6 +44,7 @@ constexpr const char* kUsage = R"(usage: mxreportingd [--help]
 The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default /):
   run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
   run/harmonia/notify.sock          the notification endpoint
+  run/harmonia/orientation.sock     the orientation feed ("device N", "ui N")
   var/lib/harmonia/                 tally.db, joule.db, uplink.db, preferences/
   etc/harmonia/                     device.json, tally.json
 Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
@@ -99,6 +101,10 @@ int run(int argc, char** argv)
     ProcessWide<FileSystem>::install(&fileSystem);
     JsonDeviceProperties deviceProperties(MxReportingPath("etc/harmonia/device.json"));
     ProcessWide<DeviceProperties>::install(&deviceProperties);
+    DatagramOrientation orientation(MxReportingPath("run/harmonia/orientation.sock"));
+    if (!orientation.listen(error))
+        fail(error);
+    ProcessWide<Orientation>::install(&orientation);
 
     auto limits = StoreLimits::read(MxReportingPath("etc/harmonia/stores.json"), error);
     if (!limits)
