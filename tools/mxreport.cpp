@@ -28,7 +28,9 @@
 #include "client/MxReportingClient.h"
 #include "platform/JsonValue.h"
 #include "platform/linux/DatagramNotifications.h"
+#include "platform/linux/DatagramOrientation.h"
 #include "platform/linux/FileChanstat.h"
+#include "platform/linux/JsonDeviceProperties.h"
 #include "platform/linux/JsonPreferences.h"
 #include "wire/RootPath.h"
 
@@ -67,6 +69,10 @@ Preferences (domain com.kestrel.harmonia) and notifications:
   defaults write KEY VALUE          VALUE as JSON (true, 3, "name"), else as a string
   defaults delete KEY
   notify [NAME]                     post NAME (default com.kestrel.harmonia.reporting)
+
+Orientation (recorded by long-form audio and telephony sessions on internal builds):
+  orientation device|ui VALUE       post one change to the orientation feed; VALUE by
+                                    number or name (portrait, landscape-left, face-up, ...)
 
 What the stores hold (newest last; --json for one JSON object a line):
   events [--limit N] [--json]       analytics events (tally.db)
@@ -343,6 +349,26 @@ int notify(const std::vector<std::string>& words)
     return 0;
 }
 
+int orientation(const std::vector<std::string>& words)
+{
+    if (words.size() != 3 || (words[1] != "device" && words[1] != "ui"))
+        throw UsageError{"orientation device|ui VALUE"};
+    auto value = orientationFromText(words[2]);
+    if (!value)
+        throw UsageError{fmt::format("\"{}\" is no orientation: a number, or unknown, portrait, "
+                                     "portrait-upside-down, landscape-left, landscape-right, face-up, face-down",
+                                     words[2])};
+    OrientationChange change{words[1] == "device" ? OrientationKind::Device : OrientationKind::UI, *value};
+    if (std::uint32_t status = DatagramOrientation::post(MxReportingPath("run/harmonia/orientation.sock"), change)) {
+        std::fprintf(stderr, "orientation: cannot post: %s\n",
+                     std::generic_category().message(static_cast<int>(status)).c_str());
+        return kExitUnreachable;
+    }
+    std::printf("orientation: posted %s (%s)\n", formatOrientationDatagram(change).c_str(),
+                std::string(orientationText(*value)).c_str());
+    return 0;
+}
+
 class QuietLog final : public MxLogSink {
 public:
     void write(const MxLogRecord&) override {}
@@ -359,7 +385,10 @@ int demo(MxReportingClient& client)
         {"type", reporter, "longformaudio"},
         {"configure", reporter, R"({"HostApplicationDisplayID": "com.example.player", "output route": "Speaker"})"},
         {"start", reporter},
+        // After a reply: the start (whose own reply waits for the stop) has been taken.
         {"send", R"({"sample rate": 48000, "codec": "aac"})", "Session_Playback", "Start", reporter},
+        {"orientation", "device", "landscape-left"},
+        {"orientation", "ui", "landscape-right"},
         {"send", R"({"route": "Headphones", "reason": "new device"})", "Routing_RouteChange", "Generic", reporter},
         {"send", R"({"EngineOnTime": 12.5, "mxreporting_timestamp": )" + timestamp + "}", "Volume", "Generic",
          reporter},
@@ -388,10 +417,14 @@ int demo(MxReportingClient& client)
             std::printf("(driver growth since the start, sent as a DriverStats message: %s)\n",
                         growth ? Value(*growth).description().c_str() : "none grew");
         }
-        if (!session.run(words))
+        if (words[0] == "orientation" ? orientation(words) != 0 : !session.run(words))
             return kExitRefused;
         std::fflush(stdout);
     }
+    if (JsonDeviceProperties(MxReportingPath("etc/harmonia/device.json")).boolProperty("InternalBuild"))
+        std::printf("\nAn internal build: the summary event (the last of mxreport messages) carries the\n"
+                    "orientation changes with their times since the start, and a summary file is in\n%s.\n",
+                    MxReportingPath("var/log/harmonia/reporting").c_str());
     std::printf("\nSee what the daemon stored: mxreport events, mxreport power, mxreport sessions,\n"
                 "mxreport messages (add --json for machine-readable lines).\n");
     return 0;
@@ -612,6 +645,8 @@ int run(int argc, char** argv)
             return throttleKey(commands[0]);
         if (commands[0][0] == "notify")
             return notify(commands[0]);
+        if (commands[0][0] == "orientation")
+            return orientation(commands[0]);
         if (auto status = viewStore(commands[0]))
             return *status;
 

@@ -18,6 +18,8 @@ public:
         // Work still queued holds sessions; they must go while the fakes they log and
         // trace through are still installed.
         dispatch.discardAll();
+        // Registrations left behind hold their sessions too.
+        orientation.clear();
         MxReportingResetInternalBuildForTesting();
     }
 
@@ -28,6 +30,7 @@ public:
     FakeJoule joule{journal};
     FakeUplink uplink;
     FakeDeviceProperties device;
+    FakeOrientation orientation{journal};
     FakeDispatch dispatch;
     FakeFileSystem files;
 
@@ -38,6 +41,7 @@ private:
     ScopedInstall<Joule> installJoule_{joule};
     ScopedInstall<Uplink> installUplink_{uplink};
     ScopedInstall<DeviceProperties> installDevice_{device};
+    ScopedInstall<Orientation> installOrientation_{orientation};
     ScopedInstall<Dispatch> installDispatch_{dispatch};
     ScopedInstall<FileSystem> installFiles_{files};
 };

@@ -12,6 +12,7 @@
 #include "platform/DeviceProperties.h"
 #include "platform/FileSystem.h"
 #include "platform/Joule.h"
+#include "platform/Orientation.h"
 #include "platform/Tally.h"
 #include "platform/TracePoints.h"
 
@@ -114,11 +115,16 @@ public:
         ++queries_;
         return bools_.count(std::string(key)) ? bools_[std::string(key)] : false;
     }
-    std::int64_t integerProperty(std::string_view) override
+    std::int64_t integerProperty(std::string_view key) override
     {
         std::lock_guard lock(mutex_);
         ++queries_;
-        return 0;
+        return integers_.count(std::string(key)) ? integers_[std::string(key)] : 0;
+    }
+    void setInteger(const std::string& key, std::int64_t value)
+    {
+        std::lock_guard lock(mutex_);
+        integers_[key] = value;
     }
     void setBool(const std::string& key, bool value)
     {
@@ -134,7 +140,61 @@ public:
 private:
     mutable std::mutex mutex_;
     std::map<std::string, bool> bools_;
+    std::map<std::string, std::int64_t> integers_;
     int queries_ = 0;
+};
+
+// Registrations by identifier; change() runs the callbacks of a kind on the caller's
+// thread. An unregistration waits for a change in progress, as the service's does.
+class FakeOrientation final : public Orientation {
+public:
+    explicit FakeOrientation(EffectJournal& journal) : journal_(journal) {}
+    void registerDeviceOrientation(const std::string& id, std::function<void(int)> callback) override
+    {
+        enter("register device", id, std::move(callback));
+    }
+    void registerUIOrientation(const std::string& id, std::function<void(int)> callback) override
+    {
+        enter("register ui", id, std::move(callback));
+    }
+    void unregisterDeviceOrientation(const std::string& id) override { enter("unregister device", id, nullptr); }
+    void unregisterUIOrientation(const std::string& id) override { enter("unregister ui", id, nullptr); }
+    std::string orientationName(int orientation) override { return fmt::format("orientation-{}", orientation); }
+
+    // `kind` is "device" or "ui".
+    void change(const std::string& kind, int orientation)
+    {
+        std::lock_guard lock(mutex_);
+        for (const auto& [key, callback] : callbacks_)
+            if (key.first == kind)
+                callback(orientation);
+    }
+    std::size_t registrations() const
+    {
+        std::lock_guard lock(mutex_);
+        return callbacks_.size();
+    }
+    void clear()
+    {
+        std::lock_guard lock(mutex_);
+        callbacks_.clear();
+    }
+
+private:
+    void enter(const std::string& what, const std::string& id, std::function<void(int)> callback)
+    {
+        std::lock_guard lock(mutex_);
+        journal_.record(fmt::format("orientation {} {}", what, id));
+        std::string kind = what.substr(what.find(' ') + 1);
+        if (callback)
+            callbacks_[{kind, id}] = std::move(callback);
+        else
+            callbacks_.erase({kind, id});
+    }
+
+    EffectJournal& journal_;
+    mutable std::recursive_mutex mutex_;
+    std::map<std::pair<std::string, std::string>, std::function<void(int)>> callbacks_;
 };
 
 // Files kept in memory: what was written where, and directories that fail on demand.

@@ -20,6 +20,7 @@
 
 #include "client/MxReportingClient.h"
 #include "integration/DaemonProcess.h"
+#include "platform/linux/UnixDatagram.h"
 
 namespace mx::testing {
 namespace {
@@ -463,6 +464,82 @@ TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRows
          std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting")))
         ++summaries;
     EXPECT_EQ(summaries, 2u);
+}
+
+TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnStartIntoTheirSummaryEvent)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    daemon.addEnvironment("reporting_session_verbose=5");
+    daemon.start();
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(client);
+    auto post = [&](const std::string& datagram) {
+        ASSERT_EQ(sendUnixDatagram(daemon.path("run/harmonia/orientation.sock"), datagram), 0u);
+    };
+    auto recorded = [&](const std::string& mode, const std::string& text, ReporterID id) {
+        return daemon.waitForLog(fmt::format("mode={} orientation=\"{}\" app=\"(null)\"", mode, text)) &&
+            daemon.waitForLog(fmt::format("id=\"MxReportingService {}\"", id));
+    };
+    // Types 7 and 2 are tracked, 1 is not, and nor is 7 on a device of class 6.
+    for (auto [id, type] : {std::pair{1, 7}, {2, 2}, {3, 1}, {4, 7}}) {
+        ASSERT_TRUE(*client->createReportingSession(id).value);
+        ASSERT_TRUE(*client->setServiceType(static_cast<ServiceType>(type), id).value);
+    }
+    auto startAndWait = [&](ReporterID id) {
+        client->startReportingSessionForID(id, nullptr);
+        ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{id}));
+    };
+    post("device 1"); // before any start: nobody hears it
+    startAndWait(1);
+    startAndWait(3);
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true, "DeviceClassNumber": 6})");
+    startAndWait(4);
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    post("device 3\n");
+    EXPECT_TRUE(recorded("device", "landscape-left", 1));
+    post("sideways 3");
+    EXPECT_TRUE(daemon.waitForLog(R"(orientation feed: ignored "sideways 3")"));
+    startAndWait(2);
+    post("ui 4");
+    EXPECT_TRUE(recorded("ui", "landscape-right", 2));
+    for (ReporterID id : {1, 2, 3, 4})
+        ASSERT_TRUE(*client->stopReportingSessionForID(id).value);
+    post("device 5"); // between periods
+    startAndWait(1);
+    post("device 6");
+    EXPECT_TRUE(recorded("device", "face-down", 1));
+    ASSERT_TRUE(*client->stopReportingSessionForID(1).value);
+
+    // The stop's reply comes before its backend flush: wait for every summary.
+    std::map<std::string, std::vector<nlohmann::json>> byReporter;
+    ASSERT_TRUE(waitUntil([&] {
+        byReporter.clear();
+        for (const auto& row : daemon.query("uplink",
+                                            "SELECT json_extract(s.session_info, '$.SessionID'), "
+                                            "m.payload FROM messages m JOIN sessions s ON m.session = s.id "
+                                            "WHERE m.category = 65535 ORDER BY m.id"))
+            byReporter[row[0]].push_back(nlohmann::json::parse(row[1]));
+        return byReporter.size() == 4 && byReporter["1"].size() == 2;
+    }));
+    auto first = byReporter["1"][0];
+    EXPECT_EQ(first["device_orientation"], "landscape-left");
+    EXPECT_EQ(first["ui_orientation"], "landscape-right");
+    EXPECT_EQ(byReporter["1"][1]["device_orientation"], "face-down") << "nothing from before or between periods";
+    auto second = byReporter["2"].at(0);
+    EXPECT_FALSE(second.contains("device_orientation"));
+    EXPECT_LE(std::stod(second["ui_orientation_time"].get<std::string>()),
+              std::stod(first["ui_orientation_time"].get<std::string>()))
+        << "each session times a change from its own start";
+    for (const char* untracked : {"3", "4"})
+        EXPECT_FALSE(byReporter[untracked].at(0).contains("ui_orientation")) << "reporter " << untracked;
+    for (const auto& file : std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))) {
+        auto entries = nlohmann::json::parse(std::ifstream(file.path()));
+        // Element 0 is the user information, the last the summary event.
+        for (std::size_t i = 1; i + 1 < entries.size(); ++i)
+            EXPECT_FALSE(entries[i].dump().find("orientation") != std::string::npos)
+                << "a record is no entry of the file: " << entries[i].dump();
+    }
 }
 
 TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)

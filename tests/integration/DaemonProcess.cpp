@@ -1,5 +1,6 @@
 #include "integration/DaemonProcess.h"
 
+#include <algorithm>
 #include <csignal>
 #include <cstdlib>
 #include <fcntl.h>
@@ -20,16 +21,22 @@ namespace {
 // Everything the child needs is made before fork: the test's other threads may hold
 // the allocator's locks, so the child calls nothing but what is async-signal-safe.
 pid_t forkExec(const std::filesystem::path& root, const std::vector<std::string>& arguments, const std::string& log,
-               int logFlags, const std::string& input = "/dev/null")
+               int logFlags, const std::string& input = "/dev/null", const std::vector<std::string>& extra = {})
 {
     std::vector<std::string> environment;
     for (char** entry = environ; *entry != nullptr; ++entry) {
         std::string_view text(*entry);
         if (!text.starts_with("MXREPORTING_ROOT=") && !text.starts_with("JOURNAL_STREAM=") &&
-            !text.starts_with("LISTEN_FDS="))
+            !text.starts_with("LISTEN_FDS=") && !text.starts_with("DBUS_SYSTEM_BUS_ADDRESS="))
             environment.emplace_back(text);
     }
     environment.push_back("MXREPORTING_ROOT=" + root.string());
+    // Whatever bus the machine has is not the test's: no bus, unless a test brings one.
+    bool ownBus = std::any_of(extra.begin(), extra.end(),
+                              [](const std::string& text) { return text.starts_with("DBUS_SYSTEM_BUS_ADDRESS="); });
+    if (!ownBus)
+        environment.push_back("DBUS_SYSTEM_BUS_ADDRESS=unix:path=" + (root / "run/no-system-bus").string());
+    environment.insert(environment.end(), extra.begin(), extra.end());
     auto pointers = [](const std::vector<std::string>& strings) {
         std::vector<char*> result;
         result.reserve(strings.size() + 1);
@@ -109,7 +116,7 @@ void DaemonProcess::start()
     std::string log = (root_ / "daemon.log").string();
     // Emptied here, not in the child: a restart must not find the last run's banner.
     std::ofstream(log, std::ios::trunc).close();
-    pid_ = forkExec(root_, {MXREPORTINGD_PATH}, log, O_TRUNC);
+    pid_ = forkExec(root_, {MXREPORTINGD_PATH}, log, O_TRUNC, "/dev/null", environment_);
     waitForLog("listening on");
 }
 

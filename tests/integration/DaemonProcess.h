@@ -24,6 +24,8 @@ public:
     std::filesystem::path socketPath() const { return path("run/harmonia/reporting.sock"); }
     void writeFile(const std::string& relative, const std::string& contents) const;
 
+    // NAME=VALUE in the daemon's environment from its next start.
+    void addEnvironment(std::string entry) { environment_.push_back(std::move(entry)); }
     // Starts the daemon and waits until it accepts connections.
     void start();
     pid_t pid() const { return pid_; }
@@ -50,6 +52,7 @@ public:
 private:
     std::filesystem::path root_;
     pid_t pid_ = -1;
+    std::vector<std::string> environment_;
 };
 
 // Polls `condition` until it holds or `bound` passes.

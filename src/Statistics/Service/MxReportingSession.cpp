@@ -1,8 +1,12 @@
 #include "Statistics/Service/MxReportingSession.h"
 
+#include <cmath>
+
 #include <fmt/format.h>
 
 #include "Statistics/Service/MxReportingSessionSummary.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Orientation.h"
 #include "platform/TracePoints.h"
 
 namespace mx {
@@ -96,6 +100,8 @@ void MxReportingSession::start()
     aggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>());
     nestedAggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>());
     MxTrace(kTraceSessionStarted);
+    if (shouldReportOrientation())
+        registerOrientation();
 
     MxReportingSessionUplink::Configuration configuration{userInfo_, serviceName(), serviceType(),
                                                           uplinkSessionStarted()};
@@ -107,6 +113,10 @@ void MxReportingSession::start()
 void MxReportingSession::stop()
 {
     MXLOG_VERBOSE(logScope(), "ending session {}", reporterID_);
+    // Asked again, whatever the session was started as: a session retyped while
+    // started keeps its registration, as intended.
+    if (shouldReportOrientation() && orientationCallbackID())
+        unregisterOrientation();
     if (!started())
         return;
     // Intended: the same verbose line once more for a session that was started.
@@ -171,6 +181,55 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
     });
     if (reply)
         reply(std::nullopt);
+}
+
+bool MxReportingSession::shouldReportOrientation() const
+{
+    if (!MxReportingInternalBuild())
+        return false;
+    ServiceType type = serviceType();
+    if (type != service_type::kLongFormAudio && type != service_type::kTelephony)
+        return false;
+    return ProcessWide<DeviceProperties>::get().integerProperty("DeviceClassNumber") != 6;
+}
+
+void MxReportingSession::registerOrientation()
+{
+    std::string identifier = fmt::format("MxReportingService {}", reporterID_);
+    orientationCallbackID_.set(identifier);
+    startDate_.set(std::chrono::time_point_cast<Date::duration>(std::chrono::system_clock::now()));
+    auto& orientation = ProcessWide<Orientation>::get();
+    orientation.registerDeviceOrientation(
+        identifier, [self = shared_from_this()](int value) { self->recordOrientation("device", value); });
+    orientation.registerUIOrientation(identifier,
+                                      [self = shared_from_this()](int value) { self->recordOrientation("ui", value); });
+}
+
+void MxReportingSession::unregisterOrientation()
+{
+    std::string identifier = *orientationCallbackID();
+    auto& orientation = ProcessWide<Orientation>::get();
+    orientation.unregisterDeviceOrientation(identifier);
+    orientation.unregisterUIOrientation(identifier);
+    orientationCallbackID_.set(std::nullopt);
+}
+
+void MxReportingSession::recordOrientation(std::string_view mode, int orientation)
+{
+    std::string text = ProcessWide<Orientation>::get().orientationName(orientation);
+    auto now = std::chrono::system_clock::now();
+    auto backToStart = std::chrono::duration<double>(startDate_.get().value_or(now) - now).count();
+    double seconds = std::round(backToStart * 1000.0) / -1000.0;
+    if (MxLogEnabled(logScope(), kMxLogVerboseLevel)) {
+        auto app = userInfo_->find("HostApplicationDisplayID");
+        MXLOG(logScope(), Debug,
+              "Orientation handler callback mode={} orientation=\"{}\" app=\"{}\", time={}, id=\"{}\"", mode, text,
+              app ? app->description() : std::string("(null)"), seconds, orientationCallbackID().value_or("(null)"));
+    }
+    Dictionary record;
+    record.set(fmt::format("{}_orientation", mode), std::move(text));
+    record.set(fmt::format("{}_orientation_time", mode), seconds);
+    appendAggregated(aggregatedPayloadData_, std::move(record));
 }
 
 std::optional<Dictionary> MxReportingSession::createSummaryEventForSession()

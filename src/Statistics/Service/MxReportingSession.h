@@ -99,6 +99,10 @@ public:
         MxReportingSessionUplink::sendSingleMessage(message, category, type, serviceType, userInfo, std::move(reply));
     }
 
+    // Whether this session records orientation changes: asked at every start and stop.
+    bool shouldReportOrientation() const;
+    std::optional<std::string> orientationCallbackID() const { return orientationCallbackID_.get(); }
+
     std::optional<Dictionary> createSummaryEventForSession();
     void writeSummaryJson();
     std::string summaryFileName(std::time_t now) const;
@@ -106,6 +110,10 @@ public:
     std::string description() const;
 
 private:
+    void registerOrientation();
+    void unregisterOrientation();
+    // `mode` is "device" or "ui"; runs on a thread of the orientation service.
+    void recordOrientation(std::string_view mode, int orientation);
     static void appendAggregated(const MxAtomicProperty<AggregationArray>& field, Value value);
     static void dropAggregated(MxAtomicProperty<AggregationArray>& field);
 
@@ -120,6 +128,8 @@ private:
     MxAtomicProperty<AggregationArray> nestedAggregatedPayloadData_;
     std::map<std::string, std::int64_t> messageTypeCounts_;
     MxAtomicProperty<std::string> serviceName_{std::string("unknown")};
+    MxAtomicProperty<std::optional<std::string>> orientationCallbackID_;
+    MxAtomicProperty<std::optional<Date>> startDate_;
     MxReportingSessionUplink uplink_;
 };
 

@@ -1,5 +1,7 @@
 #include "Statistics/Service/MxReportingSession.h"
 
+#include <algorithm>
+#include <cmath>
 #include <thread>
 
 #include <gmock/gmock.h>
@@ -250,6 +252,138 @@ TEST_F(MxReportingSessionTest, DiscoveryAnsweredDuringTheWaitContinuesWithTheBac
     EXPECT_EQ(onlyBackendSession()->messages().size(), 1u);
     EXPECT_NE(session->uplinkSession(), nullptr);
     EXPECT_FALSE(session->uplinkSessionStarted()) << "nothing ever sets the seed";
+}
+
+class MxReportingSessionOrientationTest : public MxReportingSessionTest {
+protected:
+    MxReportingSessionOrientationTest() { platform.device.setBool("InternalBuild", true); }
+
+    std::vector<std::string> orientationEffects() const
+    {
+        std::vector<std::string> effects;
+        for (const auto& effect : platform.journal.effects())
+            if (effect.starts_with("orientation "))
+                effects.push_back(effect);
+        return effects;
+    }
+
+    // The orientation records in a store (the session's current one by default).
+    static std::vector<Dictionary> records(const MxReportingSession& session)
+    {
+        return records(session.aggregatedPayloadData()->snapshot());
+    }
+    static std::vector<Dictionary> records(const Array& store)
+    {
+        std::vector<Dictionary> found;
+        for (const auto& entry : store)
+            if (const Dictionary* record = entry.asDictionary();
+                record && record->size() == 2 && (record->find("device_orientation") || record->find("ui_orientation")))
+                found.push_back(*record);
+        return found;
+    }
+};
+
+TEST_F(MxReportingSessionOrientationTest, OnlyLongFormAudioAndTelephonyOffClassSixOfAnInternalBuildAreTracked)
+{
+    struct Case {
+        bool internal;
+        ServiceType type;
+        std::int64_t deviceClass;
+        bool tracked;
+    };
+    for (auto [internal, type, deviceClass, tracked] :
+         {Case{true, 7, 0, true}, Case{true, 2, 1, true}, Case{true, 1, 0, false}, Case{true, 7, 6, false},
+          Case{false, 7, 0, false}}) {
+        SCOPED_TRACE(fmt::format("internal {} type {} class {}", internal, type, deviceClass));
+        MxReportingResetInternalBuildForTesting();
+        platform.device.setBool("InternalBuild", internal);
+        platform.device.setInteger("DeviceClassNumber", deviceClass);
+        platform.journal.clear();
+        auto session = makeSession(42, type);
+        session->start();
+        EXPECT_EQ(session->orientationCallbackID(),
+                  tracked ? std::optional<std::string>("MxReportingService 42") : std::nullopt);
+        session->stop();
+        session->stop();
+        if (tracked)
+            EXPECT_THAT(orientationEffects(),
+                        ElementsAre("orientation register device MxReportingService 42",
+                                    "orientation register ui MxReportingService 42",
+                                    "orientation unregister device MxReportingService 42",
+                                    "orientation unregister ui MxReportingService 42"));
+        else
+            EXPECT_THAT(orientationEffects(), IsEmpty());
+        EXPECT_EQ(session->orientationCallbackID(), std::nullopt);
+    }
+}
+
+TEST_F(MxReportingSessionOrientationTest, RecordsGoIntoTheSummaryEventOnlyWhileStartedTimedFromTheStart)
+{
+    auto session = makeSession(5, 2);
+    session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "Dialer"}});
+    platform.orientation.change("device", 3);
+    EXPECT_THAT(orientationEffects(), IsEmpty()) << "nothing is registered before a start";
+    session->start();
+    session->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, nullptr);
+    platform.orientation.change("device", 3);
+    platform.orientation.change("ui", 1);
+
+    auto found = records(*session);
+    ASSERT_EQ(found.size(), 2u);
+    EXPECT_EQ(found[0].find("device_orientation")->description(), "orientation-3");
+    EXPECT_EQ(found[1].find("ui_orientation")->description(), "orientation-1");
+    double seconds = found[0].find("device_orientation_time")->doubleValue();
+    EXPECT_GE(seconds, 0.0);
+    EXPECT_LT(seconds, 10.0);
+    EXPECT_EQ(std::round(seconds * 1000) / 1000, seconds) << "rounded to the millisecond";
+    EXPECT_THAT(identifiers(*session), ElementsAre("Playback_Start_1")) << "records are no file entries";
+
+    session->stop();
+    run();
+    auto summary = onlyBackendSession()->messages().back().payload;
+    EXPECT_EQ(summary.find("device_orientation")->description(), "orientation-3");
+    EXPECT_EQ(summary.find("ui_orientation")->description(), "orientation-1");
+    EXPECT_EQ(summary.find("rate")->description(), "48000");
+    EXPECT_EQ(platform.orientation.registrations(), 0u) << "the callbacks no longer hold the session";
+}
+
+TEST_F(MxReportingSessionOrientationTest, ASessionRetypedWhileStartedStaysRegisteredAndRecordsIntoItsNextPeriod)
+{
+    auto session = makeSession(5, 7);
+    session->start();
+    session->setServiceType(1);
+    session->stop();
+    EXPECT_EQ(session->orientationCallbackID(), std::optional<std::string>("MxReportingService 5"));
+    platform.orientation.change("device", 4);
+    EXPECT_EQ(session->aggregatedPayloadData(), nullptr) << "the record between periods is lost";
+    session->start();
+    platform.orientation.change("device", 4);
+    EXPECT_EQ(records(*session).size(), 1u);
+}
+
+TEST_F(MxReportingSessionOrientationTest, ChangesRacingStopsNeverReachADroppedStoreAndNoneWhileStartedIsLost)
+{
+    auto session = makeSession(5, 7);
+    std::atomic<bool> done{false};
+    std::thread toolbox([&] {
+        while (!done.load())
+            platform.orientation.change("ui", 2);
+    });
+    for (int period = 0; period < 200 && !HasFailure(); ++period) {
+        session->start();
+        auto store = session->aggregatedPayloadData();
+        platform.orientation.change("device", 1);
+        session->stop();
+        auto kept = records(store->snapshot());
+        EXPECT_EQ(std::count_if(kept.begin(), kept.end(),
+                                [](const Dictionary& record) { return record.find("device_orientation"); }),
+                  1)
+            << "period " << period;
+        platform.orientation.change("ui", 2);
+        EXPECT_EQ(records(store->snapshot()).size(), kept.size()) << "nothing lands in a dropped store";
+    }
+    done.store(true);
+    toolbox.join();
 }
 
 } // namespace
