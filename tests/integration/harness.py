@@ -77,11 +77,13 @@ def wait_for(condition, bound=BOUND):
 class Daemon:
     """mxreportingd in a private root, its log in the root; `files` are written first."""
 
-    def __init__(self, binary, files=None):
+    def __init__(self, binary, files=None, env=None):
         self.root = tempfile.mkdtemp(prefix="mxreporting-python-")
         for relative, text in (files or {}).items():
             self.write(relative, text)
-        env = dict(os.environ, MXREPORTING_ROOT=self.root)
+        # No system bus but the one a test brings.
+        env = dict(os.environ, MXREPORTING_ROOT=self.root,
+                   DBUS_SYSTEM_BUS_ADDRESS="unix:path=" + self.path("run/no-system-bus")) | (env or {})
         env.pop("JOURNAL_STREAM", None)
         self.log_file = open(self.path("daemon.log"), "w")
         self.process = subprocess.Popen([binary], env=env, stderr=self.log_file, stdout=self.log_file)

@@ -110,7 +110,6 @@ int SensorProxyListener::onClaimed(sd_bus_message* message, void* self, sd_bus_e
         listener.release();
         return 0;
     }
-    MXLOG(nullptr, Info, "orientation: device orientation from the sensor proxy");
     sd_bus_call_method_async(listener.bus_, nullptr, kProxy, kProxyPath, "org.freedesktop.DBus.Properties", "Get",
                              onFirstReading, self, "ss", kProxy, kProperty);
     return 0;
@@ -119,8 +118,10 @@ int SensorProxyListener::onClaimed(sd_bus_message* message, void* self, sd_bus_e
 int SensorProxyListener::onFirstReading(sd_bus_message* message, void* self, sd_bus_error*)
 {
     const char* text = nullptr;
-    if (!sd_bus_message_is_method_error(message, nullptr) && sd_bus_message_read(message, "v", "s", &text) > 0)
-        static_cast<SensorProxyListener*>(self)->observe(text);
+    if (sd_bus_message_is_method_error(message, nullptr) || sd_bus_message_read(message, "v", "s", &text) <= 0)
+        return 0;
+    static_cast<SensorProxyListener*>(self)->observe(text);
+    MXLOG(nullptr, Info, "orientation: device orientation from the sensor proxy, {} now", text);
     return 0;
 }
 
