@@ -44,6 +44,7 @@ constexpr int kExitUsage = 64;
 
 constexpr const char* kUsage =
     R"(usage: mxreport [--socket PATH] [--timeout SECONDS] COMMAND [ARGS] [-- COMMAND [ARGS]]...
+       mxreport --help | --version
 
 Talks to mxreportingd on $MXREPORTING_ROOT/run/harmonia/reporting.sock. Commands joined
 by "--" run in order on one connection (a session lives as long as its connection).
@@ -437,7 +438,7 @@ public:
     void write(const MxLogRecord& record) override
     {
         if (record.level != MxLogLevel::Debug || verbose_)
-            std::fprintf(stderr, "%s\n", record.message.c_str());
+            std::fprintf(stderr, "%s\n", record.text.c_str());
     }
 
 private:
@@ -623,6 +624,8 @@ int run(int argc, char** argv)
             words.erase(words.begin());
             if (option == "--help")
                 words = {"help"};
+            else if (option == "--version")
+                words = {"version"};
             else if (option == "--socket" && !words.empty())
                 socket = words[0], words.erase(words.begin());
             else if (option == "--timeout" && !words.empty())
@@ -636,6 +639,10 @@ int run(int argc, char** argv)
         if (commands.empty() || help || commands[0][0] == "help") {
             std::fputs(kUsage, commands.empty() ? stderr : stdout);
             return commands.empty() ? kExitUsage : 0;
+        }
+        if (commands[0][0] == "version") {
+            std::puts("mxreport " MXREPORTING_VERSION);
+            return 0;
         }
         if (commands[0][0] == "defaults")
             return defaults(commands[0]);

@@ -1,10 +1,13 @@
 #include "platform/MxLog.h"
 
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
+#include <utility>
 
 namespace mx {
 
@@ -29,6 +32,47 @@ int verboseLevelFromEnvironment(const std::string& verboseSwitch)
     char* end = nullptr;
     long level = std::strtol(value, &end, 10);
     return end != value ? static_cast<int>(level) : 0;
+}
+
+// Error lines by the place that writes them: within a window, the first few pass and
+// the rest are counted; the count rides on the first line let through after it.
+class ErrorBursts {
+public:
+    // Nothing: suppress the line. Else the number suppressed since the last one shown.
+    std::optional<std::uint64_t> admit(const char* file, int line)
+    {
+        auto now = std::chrono::steady_clock::now();
+        std::lock_guard lock(mutex_);
+        auto& burst = bursts_[{file, line}];
+        if (now - burst.windowStart >= kWindow) {
+            burst.windowStart = now;
+            burst.shown = 0;
+        }
+        if (burst.shown >= kLinesPerWindow) {
+            ++burst.suppressed;
+            return std::nullopt;
+        }
+        ++burst.shown;
+        return std::exchange(burst.suppressed, 0);
+    }
+
+private:
+    static constexpr std::chrono::seconds kWindow{10};
+    static constexpr int kLinesPerWindow = 10;
+
+    struct Burst {
+        std::chrono::steady_clock::time_point windowStart;
+        int shown = 0;
+        std::uint64_t suppressed = 0;
+    };
+    std::mutex mutex_;
+    std::map<std::pair<std::string_view, int>, Burst> bursts_;
+};
+
+ErrorBursts& errorBursts()
+{
+    static auto* bursts = new ErrorBursts; // outlives every logging thread
+    return *bursts;
 }
 
 } // namespace
@@ -79,13 +123,18 @@ std::string_view MxLogFunctionName(std::string_view signature)
 void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, std::string_view signature,
                 std::string_view text)
 {
-    std::string function(MxLogFunctionName(signature));
-    std::string message = fmt::format("{}:{}:{}: {}", file, line, function, text);
-    MxLogRecord record{scope, level, file, line, std::move(function), std::move(message)};
+    MxLogRecord record{scope, level, file, line, std::string(MxLogFunctionName(signature)), std::string(text)};
+    if (level == MxLogLevel::Error) {
+        auto suppressed = errorBursts().admit(file, line);
+        if (!suppressed)
+            return;
+        if (*suppressed > 0)
+            record.text += fmt::format(" ({} more like it suppressed)", *suppressed);
+    }
     if (ProcessWide<MxLogSink>::installed())
         ProcessWide<MxLogSink>::get().write(record);
     else
-        std::fprintf(stderr, "%s\n", record.message.c_str());
+        std::fprintf(stderr, "%s\n", record.message().c_str());
 }
 
 } // namespace mx

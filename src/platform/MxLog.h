@@ -1,8 +1,10 @@
 #pragma once
 // MxLog: the daemon's scoped logging facility. Every diagnostic line goes through a
 // registered scope (or the default log) to the one installed MxLogSink: journald
-// under systemd, stderr otherwise, a capturing sink in tests. Every message starts
-// with the "file:line:function: " prefix of the line that wrote it.
+// under systemd, stderr otherwise, a capturing sink in tests. A line is the service's
+// text led by the "file:line:function: " of the code that wrote it; the journal keeps
+// the location in fields of its own. An error line repeated from one place in a burst
+// is let through a few times, then counted until the burst is over.
 
 #include <cstdint>
 #include <string>
@@ -32,7 +34,10 @@ struct MxLogRecord {
     const char* file = "";
     int line = 0;
     std::string function; // the enclosing function's name, also for lines written in a lambda
-    std::string message;  // prefix included
+    std::string text;     // what the service wrote, without its location
+
+    // "file:line:function: text".
+    std::string message() const { return fmt::format("{}:{}:{}: {}", file, line, function, text); }
 };
 
 class MxLogSink {

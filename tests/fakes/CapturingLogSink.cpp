@@ -6,11 +6,9 @@ namespace mx::testing {
 
 void CapturingLogSink::write(const MxLogRecord& record)
 {
-    std::string prefix = fmt::format("{}:{}:{}: ", record.file, record.line, record.function);
-    std::string text = record.message.rfind(prefix, 0) == 0 ? record.message.substr(prefix.size()) : record.message;
     std::lock_guard lock(mutex_);
     lines_.push_back(
-        {record.scope ? record.scope->code : "", record.level, record.function, std::move(text), record.message});
+        {record.scope ? record.scope->code : "", record.level, record.function, record.text, record.message()});
 }
 
 std::vector<CapturedLine> CapturingLogSink::lines() const

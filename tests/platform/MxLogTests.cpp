@@ -53,5 +53,19 @@ TEST(MxLogTest, VerboseLinesNeedTheScopesSwitchAtLevelFive)
     EXPECT_EQ(formatted, 1) << "a silent verbose line is not even formatted";
 }
 
+TEST(MxLogTest, AnErrorBurstFromOnePlaceIsCutToAFewLinesOthersPass)
+{
+    CapturingLogSink sink;
+    ScopedInstall<MxLogSink> install(sink);
+    for (int row = 0; row < 1000; ++row) {
+        MXLOG(nullptr, Error, "write failed for row {}", row);
+        MXLOG(nullptr, Info, "row {} held", row);
+    }
+    MXLOG(nullptr, Error, "another place");
+    EXPECT_EQ(sink.texts(MxLogLevel::Error).size(), 11u);
+    EXPECT_EQ(sink.texts(MxLogLevel::Info).size(), 1000u) << "only error lines are cut";
+    EXPECT_EQ(sink.texts(MxLogLevel::Error).back(), "another place");
+}
+
 } // namespace
 } // namespace mx::testing

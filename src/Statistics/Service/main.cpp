@@ -39,7 +39,7 @@ using namespace mx;
 
 namespace {
 
-constexpr const char* kUsage = R"(usage: mxreportingd [--help]
+constexpr const char* kUsage = R"(usage: mxreportingd [--help] [--version]
 
 The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default /):
   run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
@@ -77,6 +77,10 @@ int run(int argc, char** argv)
     for (int i = 1; i < argc; ++i) {
         if (std::strcmp(argv[i], "--help") == 0 || std::strcmp(argv[i], "-h") == 0) {
             std::fputs(kUsage, stdout);
+            return 0;
+        }
+        if (std::strcmp(argv[i], "--version") == 0) {
+            std::puts("mxreportingd " MXREPORTING_VERSION);
             return 0;
         }
         std::fprintf(stderr, "mxreportingd: unknown argument %s\n%s", argv[i], kUsage);
@@ -158,10 +162,8 @@ int run(int argc, char** argv)
     listener->setDelegate(root);
     listener->resume();
     sd_notify(0, "READY=1");
-    std::fprintf(stderr,
-                 "mxreportingd %d listening on %s\n"
-                 "  talk to it:  MXREPORTING_ROOT=%s mxreport demo\n",
-                 getpid(), listener->endpointDescription().c_str(), MxReportingRoot().c_str());
+    MXLOG(nullptr, Default, "mxreportingd {} (pid {}) listening on {}; talk to it: MXREPORTING_ROOT={} mxreport demo",
+          MXREPORTING_VERSION, getpid(), listener->endpointDescription(), MxReportingRoot().string());
 
     int signal = terminated.get_future().get();
     sd_notify(0, "STOPPING=1");

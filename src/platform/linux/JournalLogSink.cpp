@@ -33,7 +33,7 @@ void JournalLogSink::write(const MxLogRecord& record)
 {
     const char* subsystem = record.scope ? record.scope->subsystem.c_str() : "";
     const char* scope = record.scope ? record.scope->code.c_str() : "default";
-    sd_journal_send("MESSAGE=%s", record.message.c_str(), "PRIORITY=%i", priority(record.level), "MXLOG_SUBSYSTEM=%s",
+    sd_journal_send("MESSAGE=%s", record.text.c_str(), "PRIORITY=%i", priority(record.level), "MXLOG_SUBSYSTEM=%s",
                     subsystem, "MXLOG_SCOPE=%s", scope, "CODE_FILE=%s", record.file, "CODE_LINE=%i", record.line,
                     "CODE_FUNC=%s", record.function.c_str(), nullptr);
 }
