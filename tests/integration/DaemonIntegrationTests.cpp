@@ -391,6 +391,8 @@ TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
     ASSERT_TRUE(*client->createReportingSession(3).value);
     ASSERT_TRUE(client->sendMessage(Dictionary{{"EngineOnTime", 1}}, 3, 1, std::vector<ReporterID>{3}));
     EXPECT_TRUE(waitUntil([&] { return daemon.query("joule", "SELECT count(*) FROM events")[0][0] == "1"; }));
+    // Committed before the directory goes, or the new store would hold it too.
+    EXPECT_TRUE(waitUntil([&] { return daemon.query("tally", "SELECT count(*) FROM events")[0][0] == "1"; }));
     bool setAside = false;
     for (const auto& entry : std::filesystem::directory_iterator(daemon.path("var/lib/harmonia")))
         setAside |= entry.path().filename().string().starts_with("joule.db.corrupt-");
