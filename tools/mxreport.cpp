@@ -32,6 +32,7 @@
 #include "platform/linux/FileChanstat.h"
 #include "platform/linux/JsonDeviceProperties.h"
 #include "platform/linux/JsonPreferences.h"
+#include "wire/MxReportingMethods.h"
 #include "wire/RootPath.h"
 
 using namespace mx;
@@ -92,6 +93,10 @@ The block throttle (a burst of one message key delivers only its last message):
 Driver channels (run/harmonia/chanstat/GROUP[/SUBGROUP]/NAME, one integer a file):
   channels [--json]                 the channels of the daemon's four drivers and their
                                     values now, with the key their growth is reported as
+
+  status [--json]                   what the daemon is doing: clients, sessions, reports and
+                                    their rate, each store's rows, queue, size and failures,
+                                    each exporter's lag and last error
 
   demo                              play a realistic session and show what happens
   help                              this text
@@ -544,6 +549,85 @@ int stream(MxReportingClient& client, const std::vector<std::string>& words)
     return failures > 0 ? kExitRefused : 0;
 }
 
+std::string humanBytes(double bytes)
+{
+    const char* units[] = {"B", "KiB", "MiB", "GiB", "TiB"};
+    std::size_t unit = 0;
+    while (bytes >= 1024 && unit + 1 < std::size(units))
+        bytes /= 1024, ++unit;
+    return unit == 0 ? fmt::format("{:.0f} B", bytes) : fmt::format("{:.1f} {}", bytes, units[unit]);
+}
+
+std::string humanDuration(double seconds)
+{
+    auto whole = static_cast<std::int64_t>(seconds);
+    if (whole < 60)
+        return fmt::format("{:.1f} s", seconds);
+    if (whole < 3600)
+        return fmt::format("{}m {}s", whole / 60, whole % 60);
+    return fmt::format("{}h {}m", whole / 3600, whole % 3600 / 60);
+}
+
+void printStatus(const Dictionary& status)
+{
+    static const Value nothing;
+    auto get = [](const Dictionary& from, const char* key) -> const Value& {
+        const Value* value = from.find(key);
+        return value ? *value : nothing;
+    };
+    std::printf("mxreportingd %s, up %s\n", get(status, "version").description().c_str(),
+                humanDuration(get(status, "uptime_seconds").doubleValue()).c_str());
+    const Array* clients = get(status, "clients").asArray();
+    std::printf("clients: %zu\n", clients ? clients->size() : 0);
+    for (const auto& client : clients ? *clients : Array()) {
+        const Dictionary& entry = client.asDictionary() ? *client.asDictionary() : Dictionary();
+        std::printf("  pid %lld %s (%lld sessions)\n", static_cast<long long>(get(entry, "pid").int64Value()),
+                    get(entry, "process").description().c_str(),
+                    static_cast<long long>(get(entry, "sessions").int64Value()));
+    }
+    std::printf("sessions started: %lld\nreports received: %lld (%.1f/s)\n",
+                static_cast<long long>(get(status, "sessions_started").int64Value()),
+                static_cast<long long>(get(status, "reports_received").int64Value()),
+                get(status, "reports_per_second").doubleValue());
+    std::printf("stores:\n");
+    if (const Dictionary* stores = get(status, "stores").asDictionary())
+        for (const auto& [name, value] : *stores) {
+            const Dictionary& store = value.asDictionary() ? *value.asDictionary() : Dictionary();
+            std::printf("  %-7s %lld rows written, %lld queued, %s on disk, %lld failed writes\n", name.c_str(),
+                        static_cast<long long>(get(store, "rows_written").int64Value()),
+                        static_cast<long long>(get(store, "queue_depth").int64Value()),
+                        humanBytes(get(store, "bytes").doubleValue()).c_str(),
+                        static_cast<long long>(get(store, "failures").int64Value()));
+        }
+    const Dictionary* exporters = get(status, "exporters").asDictionary();
+    std::printf("exporters:%s\n", exporters && !exporters->empty() ? "" : " none (the spool alone)");
+    for (const auto& [name, value] : exporters ? *exporters : Dictionary()) {
+        const Dictionary& exporter = value.asDictionary() ? *value.asDictionary() : Dictionary();
+        std::string error = get(exporter, "last_error").description();
+        std::printf("  %s: %lld unacknowledged, oldest %s%s%s\n", name.c_str(),
+                    static_cast<long long>(get(exporter, "unacknowledged").int64Value()),
+                    humanDuration(get(exporter, "oldest_seconds").doubleValue()).c_str(),
+                    error.empty() ? "" : ", failing: ", error.c_str());
+    }
+}
+
+int status(MxReportingClient& client, const std::vector<std::string>& words)
+{
+    bool json = words.size() == 2 && words[1] == "--json";
+    if (words.size() > 1 && !json)
+        throw UsageError{"status takes --json"};
+    auto result = client.call(method::kStatus, Array());
+    if (!result.value || !result.value->asDictionary()) {
+        std::fprintf(stderr, "status: %s\n", result.error ? result.error->message.c_str() : "no status in the reply");
+        return kExitRefused;
+    }
+    if (json)
+        std::printf("%s\n", toJsonText(*result.value).c_str());
+    else
+        printStatus(*result.value->asDictionary());
+    return 0;
+}
+
 // The daemon subscribes to the files present when it starts; a channel added since is
 // listed here but sampled only after a restart.
 int channels(const std::vector<std::string>& words)
@@ -668,6 +752,8 @@ int run(int argc, char** argv)
             return demo(*client);
         if (commands[0][0] == "stream")
             return stream(*client, commands[0]);
+        if (commands[0][0] == "status")
+            return status(*client, commands[0]);
         Session session(*client);
         for (const auto& command : commands)
             if (!session.run(command))

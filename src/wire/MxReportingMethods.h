@@ -18,5 +18,7 @@ inline constexpr std::string_view kDestroyReportingSession = "destroyReportingSe
 inline constexpr std::string_view kReporterIDValid = "reporterID:valid:";
 inline constexpr std::string_view kGetAllReporters = "getAllReporters:";
 inline constexpr std::string_view kKillService = "killService:";
+// Outside the reporting protocol: the daemon's counters, for operators.
+inline constexpr std::string_view kStatus = "status";
 
 } // namespace mx::method

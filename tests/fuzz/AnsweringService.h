@@ -4,6 +4,8 @@
 // held start reply of the real service are available, for targets that check the
 // connection's handling of them.
 
+#include <functional>
+
 #include "Statistics/Service/MxReportingServiceProtocol.h"
 
 namespace mx {
@@ -41,5 +43,7 @@ public:
 private:
     bool likeTheService_;
 };
+
+inline void answerStatus(std::function<void(Dictionary)> reply) { reply(Dictionary{{"version", "fuzz"}}); }
 
 } // namespace mx

@@ -47,7 +47,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     {
         auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), 1);
         connection->setExportedObject(
-            std::make_shared<MxReportingRequestDispatch>(std::make_shared<AnsweringService>(true)));
+            std::make_shared<MxReportingRequestDispatch>(std::make_shared<AnsweringService>(true), answerStatus));
         connection->setInvalidationHandler([&] { invalidated = true; });
         connection->resume();
     }

@@ -186,14 +186,22 @@ const std::map<std::string, Operation, std::less<>>& operations()
 
 } // namespace
 
-MxReportingRequestDispatch::MxReportingRequestDispatch(std::shared_ptr<MxReportingServiceProtocol> service)
-    : service_(std::move(service))
+MxReportingRequestDispatch::MxReportingRequestDispatch(std::shared_ptr<MxReportingServiceProtocol> service,
+                                                       StatusRequest status)
+    : service_(std::move(service)), status_(std::move(status))
 {
 }
 
 void MxReportingRequestDispatch::handleRequest(const std::string& method, const Array* params,
                                                std::shared_ptr<ServiceReply> reply)
 {
+    if (method == method::kStatus) {
+        if (!params || !params->empty())
+            reply->fail({kServiceErrorBadArguments, "status takes no arguments"});
+        else
+            status_([reply](Dictionary status) { reply->respond(std::move(status)); });
+        return;
+    }
     auto operation = operations().find(method);
     if (operation == operations().end()) {
         reply->fail({kServiceErrorUnknownMethod, fmt::format("unknown method {}", method)});

@@ -2,9 +2,11 @@
 // What a client connection exports: binds each method name of the wire to its
 // operation of the request protocol, reading the operation's arguments from the
 // request's parameters. A request that cannot be handed on (unknown method, wrong
-// number or types of arguments) is answered with a service error at once.
+// number or types of arguments) is answered with a service error at once. The one
+// method outside the protocol, "status", is answered by the service root.
 // Owned by its connection; runs on the connection layer's thread.
 
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -16,12 +18,16 @@ class MxReportingServiceProtocol;
 
 class MxReportingRequestDispatch final : public ServiceExportedObject {
 public:
-    explicit MxReportingRequestDispatch(std::shared_ptr<MxReportingServiceProtocol> service);
+    // Asks for the status view; the callback gets it on whatever thread built it.
+    using StatusRequest = std::function<void(std::function<void(Dictionary)>)>;
+
+    MxReportingRequestDispatch(std::shared_ptr<MxReportingServiceProtocol> service, StatusRequest status);
 
     void handleRequest(const std::string& method, const Array* params, std::shared_ptr<ServiceReply> reply) override;
 
 private:
     const std::shared_ptr<MxReportingServiceProtocol> service_;
+    const StatusRequest status_;
 };
 
 } // namespace mx

@@ -232,8 +232,10 @@ void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxBoolR
         return;
     }
     session->start();
-    if (auto root = delegate_.lock())
+    if (auto root = delegate_.lock()) {
+        root->noteSessionStarted();
         session->setDriverSnapShot(root->getSnapShot());
+    }
     session->parkTransactionCompleteBlock(reply);
 }
 
@@ -246,6 +248,7 @@ void MxReportingServerInstance::handleSendMessage(const Dictionary& payload, Mes
         reply(MxReportingError{kMxReportingErrorDomain, kMxReportingDisabledErrorCode});
         return;
     }
+    root->noteReportReceived();
     if (!reportingIDs) {
         sendToStartedSessions(payload, category, type, *root);
         reply(std::nullopt);

@@ -49,7 +49,11 @@ bool MxReportingServiceDelegate::shouldAcceptNewConnection(ServiceListener&,
     {
         std::lock_guard lock(lock_);
         client = std::make_shared<MxReportingServerInstance>(pid, weak_from_this(), serverQueue_);
-        connection->setExportedObject(std::make_shared<MxReportingRequestDispatch>(client));
+        connection->setExportedObject(std::make_shared<MxReportingRequestDispatch>(
+            client, [weakSelf = weak_from_this()](std::function<void(Dictionary)> reply) {
+                if (auto self = weakSelf.lock())
+                    self->requestStatus(std::move(reply));
+            }));
     }
 
     // Requests of the new client queue up behind its registration.
@@ -152,6 +156,23 @@ std::optional<Dictionary> MxReportingServiceDelegate::getDriverStatisticsRelativ
     const std::shared_ptr<MxReportingDriverSnapShot>& snapShot)
 {
     return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot.get());
+}
+
+Array MxReportingServiceDelegate::clientsStatus() const
+{
+    std::vector<Value> clients;
+    for (const auto& client : clients_)
+        clients.emplace_back(Dictionary{{"pid", client->processIdentifier()},
+                                        {"process", client->clientProcessName().value_or("")},
+                                        {"sessions", client->clientReportingSessionMap().size()}});
+    return Array(std::move(clients));
+}
+
+void MxReportingServiceDelegate::requestStatus(std::function<void(Dictionary)> reply)
+{
+    serverQueue_->dispatch([self = shared_from_this(), reply = std::move(reply)] {
+        reply(self->statusView_ ? self->statusView_() : Dictionary{});
+    });
 }
 
 void MxReportingServiceDelegate::removeClient(const MxReportingServerInstance& client)

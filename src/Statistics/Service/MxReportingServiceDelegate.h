@@ -7,6 +7,8 @@
 // queue; acceptance and the cross-client lookup also take the root's own lock.
 
 #include <atomic>
+#include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -47,6 +49,18 @@ public:
     std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
         const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) override;
     void removeClient(const MxReportingServerInstance& client) override;
+    void noteSessionStarted() override { sessionsStarted_.fetch_add(1, std::memory_order_relaxed); }
+    void noteReportReceived() override { reportsReceived_.fetch_add(1, std::memory_order_relaxed); }
+
+    // What the status view shows of the service itself, "status" of the wire
+    // answered with it. The view is set once, before the first connection.
+    std::uint64_t sessionsStarted() const { return sessionsStarted_.load(std::memory_order_relaxed); }
+    std::uint64_t reportsReceived() const { return reportsReceived_.load(std::memory_order_relaxed); }
+    // Server queue only: {pid, process, sessions} of each connected client.
+    Array clientsStatus() const;
+    void setStatusView(std::function<Dictionary()> view) { statusView_ = std::move(view); }
+    // Answers `reply` with the status view, built on the server queue.
+    void requestStatus(std::function<void(Dictionary)> reply);
 
     // The defaults dictionary as the preferences hold it now.
     Dictionary MxReportingDefaults();
@@ -70,6 +84,9 @@ private:
     std::recursive_mutex lock_;
 
     std::atomic<bool> reportingEnabled_{true};
+    std::atomic<std::uint64_t> sessionsStarted_{0};
+    std::atomic<std::uint64_t> reportsReceived_{0};
+    std::function<Dictionary()> statusView_;
     std::vector<std::shared_ptr<MxReportingServerInstance>> clients_;
     std::optional<Dictionary> defaults_;
     int notifyToken_ = 0;

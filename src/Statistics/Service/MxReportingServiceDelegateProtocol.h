@@ -33,6 +33,11 @@ public:
     virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
         const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) = 0;
     virtual void removeClient(const MxReportingServerInstance& client) = 0;
+
+    // The counters of the status view: a session went from stopped to started, a
+    // report was taken (refused ones are not counted).
+    virtual void noteSessionStarted() = 0;
+    virtual void noteReportReceived() = 0;
 };
 
 } // namespace mx

@@ -11,11 +11,14 @@
 #include <unistd.h>
 
 #include <asio/signal_set.hpp>
+#include <asio/steady_timer.hpp>
 #include <curl/curl.h>
 #include <systemd/sd-daemon.h>
 
+#include "Statistics/Service/MxReportingMetrics.h"
 #include "Statistics/Service/MxReportingServiceDelegate.h"
 #include "Statistics/Service/MxReportingSessionSummary.h"
+#include "Statistics/Service/MxReportingStatus.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/DatagramOrientation.h"
@@ -54,6 +57,48 @@ SIGHUP re-reads the preferences; SIGTERM commits the stores and exits.
 // How long a shutdown waits for the queues: sessions still waiting on backend
 // discovery take up to 9 s a round, and the unit's stop timeout is 90 s.
 constexpr std::chrono::milliseconds kDrainBound{60'000};
+
+// How often the metrics file and systemd's status line are brought up to date.
+constexpr std::chrono::seconds kStatusInterval{5};
+
+// Every period: the watchdog is told the connection thread lives, and the server
+// queue writes the metrics file and the status line. The watchdog is fed from the
+// connection thread, not the server queue, because the server queue may rightly
+// wait a long time on a full disk, and a restart then would lose what it holds.
+class Heartbeat {
+public:
+    Heartbeat(asio::io_context& io, std::shared_ptr<WorkQueue> serverQueue, MxReportingStatus& status)
+        : timer_(io), serverQueue_(std::move(serverQueue)), status_(status)
+    {
+        std::uint64_t watchdog = 0;
+        if (sd_watchdog_enabled(0, &watchdog) > 0)
+            period_ = std::min(
+                period_,
+                std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::microseconds(watchdog / 2)));
+    }
+
+    void beat()
+    {
+        sd_notify(0, "WATCHDOG=1");
+        serverQueue_->dispatch([&status = status_] {
+            auto snapshot = status.snapshot();
+            MxReportingMetrics::write(snapshot);
+            sd_notify(0, ("STATUS=" + MxReportingStatus::summaryLine(snapshot)).c_str());
+        });
+        timer_.expires_after(period_);
+        timer_.async_wait([this](const std::error_code& cancelled) {
+            if (!cancelled)
+                beat();
+        });
+    }
+    void stop() { timer_.cancel(); }
+
+private:
+    asio::steady_timer timer_;
+    std::shared_ptr<WorkQueue> serverQueue_;
+    MxReportingStatus& status_;
+    std::chrono::milliseconds period_ = kStatusInterval;
+};
 
 // Every client is a descriptor: take all the system allows, not the shell's default.
 void raiseDescriptorLimit()
@@ -159,8 +204,18 @@ int run(int argc, char** argv)
             terminated.set_value(signal);
     });
 
+    MxReportingStatus status(root);
+    status.addStore("tally", [&] { return tally->store().status(); });
+    status.addStore("joule", [&] { return joule->store().status(); });
+    status.addStore("uplink", [&] { return uplink->store().status(); });
+    for (const auto& exporter : uplink->exporters())
+        status.addExporter(exporter->url(), [&exporter = *exporter] { return exporter.status(); });
+    root->setStatusView([&status] { return status.snapshot(); });
+    Heartbeat heartbeat(listener->ioContext(), root->serverQueue(), status);
+
     listener->setDelegate(root);
     listener->resume();
+    heartbeat.beat();
     sd_notify(0, "READY=1");
     MXLOG(nullptr, Default, "mxreportingd {} (pid {}) listening on {}; talk to it: MXREPORTING_ROOT={} mxreport demo",
           MXREPORTING_VERSION, getpid(), listener->endpointDescription(), MxReportingRoot().string());
@@ -172,6 +227,7 @@ int run(int argc, char** argv)
     // Every request already taken runs to its end, and so does the work it queued
     // (deliveries, single messages, delayed ones at once), before the stores commit.
     listener->stopReading();
+    asio::post(listener->ioContext(), [&heartbeat] { heartbeat.stop(); });
     if (!dispatch.drain(kDrainBound))
         MXLOG(nullptr, Error, "queues still busy after {} s: committing what they handed over",
               kDrainBound.count() / 1000);

@@ -11,6 +11,7 @@
 #include <sqlite3.h>
 
 #include "platform/MxLog.h"
+#include "platform/linux/SqliteStore.h"
 
 namespace mx {
 
@@ -113,6 +114,18 @@ constexpr const char* kFlushedSessionsQuery =
 constexpr const char* kSessionMessagesQuery =
     "SELECT m.id, m.time, m.category, m.type, m.payload, s.session_info, s.user_info, m.session "
     "FROM messages m JOIN sessions s ON s.id = m.session WHERE m.session = ?1 AND m.id > ?2 ORDER BY m.id LIMIT ?3";
+
+// What is due for export and not acknowledged: one-shot and realtime messages past
+// the cursor, and the messages of flushed batch sessions not yet exported.
+constexpr const char* kStreamLagQuery =
+    "SELECT count(*), min(m.time) FROM messages m LEFT JOIN sessions s ON s.id = m.session "
+    "WHERE m.id > coalesce((SELECT stream_cursor FROM exports WHERE backend = ?1), 0) "
+    "AND (m.session IS NULL OR json_extract(s.session_info, '$.ContainsRealtimeEvents') = 1)";
+constexpr const char* kSessionLagQuery =
+    "SELECT count(*), min(m.time) FROM sessions s JOIN messages m ON m.session = s.id "
+    "WHERE s.flushed IS NOT NULL AND coalesce(json_extract(s.session_info, '$.ContainsRealtimeEvents'), 0) = 0 "
+    "AND NOT EXISTS (SELECT 1 FROM exported_sessions e WHERE e.backend = ?1 AND e.session = s.id)";
+constexpr std::chrono::seconds kLagInterval{2};
 
 } // namespace
 
@@ -224,6 +237,7 @@ void OtlpHttpExporter::run()
                 MXLOG(nullptr, Default, "otlp export to {} recovered", url_);
         }
         changed_.notify_all();
+        measureLag();
         if (failure) {
             // The collector's own word on when to come back wins over our backoff.
             pause = std::max<std::chrono::milliseconds>(backoff, retryAfter_);
@@ -241,6 +255,40 @@ void OtlpHttpExporter::run()
             break;
     }
     sqlite3_close(database_);
+}
+
+void OtlpHttpExporter::measureLag()
+{
+    auto now = std::chrono::steady_clock::now();
+    if (now - lagMeasured_ < kLagInterval)
+        return;
+    lagMeasured_ = now;
+    std::int64_t count = 0;
+    double oldest = 0;
+    for (const char* sql : {kStreamLagQuery, kSessionLagQuery}) {
+        sqlite3_stmt* statement = nullptr;
+        if (sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr) != SQLITE_OK)
+            return;
+        sqlite3_bind_text(statement, 1, url_.c_str(), -1, SQLITE_TRANSIENT);
+        if (sqlite3_step(statement) == SQLITE_ROW && sqlite3_column_int64(statement, 0) > 0) {
+            count += sqlite3_column_int64(statement, 0);
+            double first = sqlite3_column_double(statement, 1);
+            oldest = oldest == 0 ? first : std::min(oldest, first);
+        }
+        sqlite3_finalize(statement);
+    }
+    std::lock_guard lock(mutex_);
+    unacknowledged_ = count;
+    oldestUnacknowledged_ = oldest;
+}
+
+Dictionary OtlpHttpExporter::status() const
+{
+    std::lock_guard lock(mutex_);
+    double age = oldestUnacknowledged_ == 0 ? 0 : std::max(0.0, secondsSinceEpoch() - oldestUnacknowledged_);
+    return Dictionary{{"unacknowledged", unacknowledged_},
+                      {"oldest_seconds", age},
+                      {"last_error", error_ ? error_->description : std::string()}};
 }
 
 std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)

@@ -41,24 +41,32 @@ public:
     std::optional<UplinkError> waitForSession(std::int64_t session, std::chrono::milliseconds timeout);
     // The error of the last failed export while the collector has not yet recovered.
     std::optional<UplinkError> currentError() const;
+    // How far behind the collector is: "unacknowledged" (messages due for export and
+    // not yet acknowledged), "oldest_seconds" (the age of the oldest), "last_error"
+    // ("" while exports succeed). Measured by the exporter every few seconds.
+    Dictionary status() const;
 
 private:
     void run();
     // One batch; the number of messages acknowledged, or the error.
     std::optional<UplinkError> exportBatch(std::size_t& exported);
+    void measureLag();
     // `status` is the HTTP status, 0 when no response came at all.
     std::optional<UplinkError> post(const std::string& body, std::chrono::seconds& retryAfter, long& status);
 
     std::filesystem::path spool_;
     std::string url_;
     sqlite3* database_ = nullptr;
-    std::chrono::seconds retryAfter_{0}; // exporter thread only
+    std::chrono::seconds retryAfter_{0};                  // exporter thread only
+    std::chrono::steady_clock::time_point lagMeasured_{}; // exporter thread only
 
     mutable std::mutex mutex_;
     std::condition_variable changed_;
     bool stopping_ = false;
     bool woken_ = false;
     std::optional<UplinkError> error_;
+    std::int64_t unacknowledged_ = 0;
+    double oldestUnacknowledged_ = 0; // seconds since the epoch; 0 when none
     std::uint64_t passes_ = 0;
     std::set<std::int64_t> deliveredSessions_;
     std::optional<std::chrono::steady_clock::time_point> lastProbe_;

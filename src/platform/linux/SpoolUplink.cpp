@@ -99,7 +99,9 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
          "CREATE TABLE IF NOT EXISTS messages(id INTEGER PRIMARY KEY, session INTEGER NULL, time REAL, "
          "category INTEGER, type INTEGER, payload TEXT, session_info TEXT NULL, user_info TEXT NULL)",
          "CREATE TABLE IF NOT EXISTS exports(backend TEXT PRIMARY KEY, stream_cursor INTEGER)",
-         "CREATE TABLE IF NOT EXISTS exported_sessions(backend TEXT, session INTEGER, PRIMARY KEY(backend, session))"},
+         "CREATE TABLE IF NOT EXISTS exported_sessions(backend TEXT, session INTEGER, PRIMARY KEY(backend, session))",
+         // The exporters read a batch session's messages by session.
+         "CREATE INDEX IF NOT EXISTS messages_by_session ON messages(session)"},
         {"INSERT INTO sessions(id, session_info, user_info, opened) VALUES(?, ?, ?, ?)",
          "UPDATE sessions SET flushed = ? WHERE id = ?",
          "INSERT INTO messages(session, time, category, type, payload, session_info, user_info) "

@@ -37,6 +37,7 @@ public:
                         Dictionary payload, std::optional<UplinkError>& error) override;
 
     SqliteStore& store() { return *store_; }
+    const std::vector<std::unique_ptr<OtlpHttpExporter>>& exporters() const { return exporters_; }
 
     // The backends that answer now: "spool" when it is listed, and every collector
     // that responds. Blocks for the probes; backend threads only.

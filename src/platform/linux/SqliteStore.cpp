@@ -278,6 +278,19 @@ void SqliteStore::prune()
 
 // Holds the batch until it commits. Meanwhile nothing more is taken from the queue,
 // which fills, and then callers wait: that is the back-pressure, not a loss.
+Dictionary SqliteStore::status()
+{
+    std::uint64_t bytes = 0;
+    for (const char* suffix : {"", "-wal"}) {
+        struct stat file {};
+        if (::stat((path_.native() + suffix).c_str(), &file) == 0)
+            bytes += static_cast<std::uint64_t>(file.st_size);
+    }
+    std::lock_guard lock(mutex_);
+    return Dictionary{
+        {"rows_written", committed_}, {"queue_depth", queue_.size()}, {"bytes", bytes}, {"failures", failures_}};
+}
+
 void SqliteStore::write(std::deque<SqliteWrite>& batch)
 {
     auto retry = kFirstRetry;
@@ -292,6 +305,7 @@ void SqliteStore::write(std::deque<SqliteWrite>& batch)
             return;
         }
         std::unique_lock lock(mutex_);
+        ++failures_;
         if (attempts++ == 0)
             MXLOG(nullptr, Error,
                   "{}: cannot write ({}); holding {} rows and retrying, callers wait while {} more queue",

@@ -99,6 +99,9 @@ public:
     std::int64_t queryInteger(const std::string& sql);
 
     const std::filesystem::path& path() const { return path_; }
+    // "rows_written" (since start-up), "queue_depth" (rows waiting for the writer),
+    // "bytes" (the file and its log on disk), "failures" (failed write attempts).
+    Dictionary status();
 
 private:
     // One open database file with its prepared statements. Writer thread only, once
@@ -136,6 +139,7 @@ private:
     std::deque<SqliteWrite> queue_;
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
+    std::uint64_t failures_ = 0;
     bool stopping_ = false;
     bool writerWaiting_ = false;
     std::thread writer_;
