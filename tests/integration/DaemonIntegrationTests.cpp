@@ -468,6 +468,46 @@ TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRows
     EXPECT_EQ(summaries, 2u);
 }
 
+TEST(DaemonConfigurationTest, ACheckNamesTheBadLineAndAReloadWithErrorsKeepsTheConfigurationInUse)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("etc/harmonia/tally.json", R"({"disabled": ["com.kestrel.harmonia.Session_Playback"]})");
+    std::string output;
+    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH, "--check-config"}, output), 0) << output;
+    daemon.start();
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(client);
+    auto stored = [&](const std::string& name) {
+        return daemon.query("tally", "SELECT count(*) FROM events WHERE name = '" + name + "'")[0][0];
+    };
+    ASSERT_TRUE(*client->createReportingSession(1).value);
+    ASSERT_TRUE(*client->setServiceType(11, 1).value); // a test session: no backend waits
+    client->startReportingSessionForID(1, nullptr);
+    // Playback events are disabled; a volume event after each shows it was written.
+    auto sendBoth = [&](int round) {
+        ASSERT_TRUE(client->sendMessage(Dictionary{{"round", round}}, 0x08000003, 1, std::vector<ReporterID>{1}));
+        ASSERT_TRUE(client->sendMessage(Dictionary{{"round", round}}, 11, 0, std::vector<ReporterID>{1}));
+        ASSERT_TRUE(waitUntil([&] { return stored("com.kestrel.harmonia.Volume.Generic") == std::to_string(round); }));
+    };
+    sendBoth(1);
+
+    daemon.writeFile("etc/harmonia/tally.json", "{\"disabled\": [],\n \"disabld\": 1}");
+    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH, "--check-config"}, output), 1);
+    EXPECT_THAT(output,
+                ::testing::HasSubstr(daemon.path("etc/harmonia/tally.json").string() +
+                                     ":2:2: tally.json has no setting \"disabld\" (it has disabled)"));
+    daemon.signal(SIGHUP);
+    EXPECT_TRUE(daemon.waitForLog("keeping the configuration in use"));
+    sendBoth(2);
+    EXPECT_EQ(stored("com.kestrel.harmonia.Session_Playback.Start"), "0");
+
+    daemon.writeFile("etc/harmonia/tally.json", R"({"disabled": []})");
+    daemon.signal(SIGHUP);
+    EXPECT_TRUE(daemon.waitForLog("configuration read again: 0 collectors, 0 disabled event names"));
+    sendBoth(3);
+    EXPECT_EQ(stored("com.kestrel.harmonia.Session_Playback.Start"), "1");
+}
+
 TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnStartIntoTheirSummaryEvent)
 {
     DaemonProcess daemon;

@@ -25,11 +25,6 @@ void MxReportingStatus::addStore(std::string name, Source source)
     stores_.emplace_back(std::move(name), std::move(source));
 }
 
-void MxReportingStatus::addExporter(std::string name, Source source)
-{
-    exporters_.emplace_back(std::move(name), std::move(source));
-}
-
 Dictionary MxReportingStatus::snapshot()
 {
     auto now = std::chrono::steady_clock::now();
@@ -38,7 +33,7 @@ Dictionary MxReportingStatus::snapshot()
         {"version", MXREPORTING_VERSION},    {"uptime_seconds", std::chrono::duration<double>(now - started_).count()},
         {"clients", root_->clientsStatus()}, {"sessions_started", root_->sessionsStarted()},
         {"reports_received", reports},       {"reports_per_second", reportRate(reports, now)},
-        {"stores", collect(stores_)},        {"exporters", collect(exporters_)}};
+        {"stores", collect(stores_)},        {"exporters", exporters_ ? exporters_() : Dictionary{}}};
 }
 
 double MxReportingStatus::reportRate(std::uint64_t reports, std::chrono::steady_clock::time_point now)

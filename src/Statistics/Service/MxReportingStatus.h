@@ -23,9 +23,9 @@ public:
 
     explicit MxReportingStatus(std::shared_ptr<MxReportingServiceDelegate> root);
 
-    // Named parts, added before the first snapshot.
+    // Named stores, added before the first snapshot; the exporters' counters by name.
     void addStore(std::string name, Source source);
-    void addExporter(std::string name, Source source);
+    void setExporters(Source exporters) { exporters_ = std::move(exporters); }
 
     // Server queue only: "version", "uptime_seconds", "clients", "sessions_started",
     // "reports_received", "reports_per_second", "stores", "exporters".
@@ -39,7 +39,7 @@ private:
     const std::shared_ptr<MxReportingServiceDelegate> root_;
     const std::chrono::steady_clock::time_point started_ = std::chrono::steady_clock::now();
     std::vector<std::pair<std::string, Source>> stores_;
-    std::vector<std::pair<std::string, Source>> exporters_;
+    Source exporters_;
     // The rate is the growth since a sample at least a second old.
     std::chrono::steady_clock::time_point sampled_ = started_;
     std::uint64_t sampledReports_ = 0;

@@ -5,6 +5,7 @@
 #include <nlohmann/json.hpp>
 
 #include "platform/MxLog.h"
+#include "platform/linux/ConfigFile.h"
 
 namespace mx {
 
@@ -27,6 +28,26 @@ nlohmann::json readProperty(const std::filesystem::path& file, std::string_view 
 } // namespace
 
 JsonDeviceProperties::JsonDeviceProperties(std::filesystem::path file) : file_(std::move(file)) {}
+
+bool JsonDeviceProperties::check(const std::filesystem::path& file, std::vector<std::string>& errors)
+{
+    ConfigFile config(file, errors);
+    if (!config.exists())
+        return true;
+    const nlohmann::json* document = config.document();
+    if (!document)
+        return false;
+    if (!document->is_object()) {
+        config.fail("", "expected an object of device properties");
+        return false;
+    }
+    bool good = config.onlyKeys(*document, {"InternalBuild", "DeviceClassNumber"}, "device.json");
+    if (auto flag = document->find("InternalBuild"); flag != document->end())
+        good &= config.expect(flag->is_boolean(), "InternalBuild", "true or false");
+    if (auto number = document->find("DeviceClassNumber"); number != document->end())
+        good &= config.expect(number->is_number_integer(), "DeviceClassNumber", "an integer");
+    return good;
+}
 
 bool JsonDeviceProperties::boolProperty(std::string_view key)
 {

@@ -4,6 +4,8 @@
 // query: it is tiny, and queries are rare (the build flag is cached by its reader).
 
 #include <filesystem>
+#include <string>
+#include <vector>
 
 #include "platform/DeviceProperties.h"
 
@@ -12,6 +14,9 @@ namespace mx {
 class JsonDeviceProperties final : public DeviceProperties {
 public:
     explicit JsonDeviceProperties(std::filesystem::path file);
+    // Whether `file` is as above: only those two keys, a bool and an integer. Errors
+    // are added to `errors`.
+    static bool check(const std::filesystem::path& file, std::vector<std::string>& errors);
 
     bool boolProperty(std::string_view key) override;
     std::int64_t integerProperty(std::string_view key) override;

@@ -1,12 +1,14 @@
 #include "platform/linux/SpoolUplink.h"
 
-#include <fstream>
-#include <random>
+#include <algorithm>
 
+#include <curl/curl.h>
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
+#include <systemd/sd-id128.h>
 
 #include "platform/JsonValue.h"
+#include "platform/linux/ConfigFile.h"
 #include "platform/linux/SpoolUplinkSession.h"
 #include "platform/linux/StoreLimits.h"
 
@@ -14,33 +16,20 @@ namespace mx {
 
 namespace {
 
-// Reads uplink.json; false, with `error`, when it is there but unusable.
-bool readBackends(const std::filesystem::path& configuration, bool& spoolListed, std::vector<std::string>& collectors,
-                  std::string& error)
+// A collector's address: an http or https URL with a host, as curl reads it.
+bool isCollectorUrl(const std::string& url)
 {
-    std::ifstream stream(configuration);
-    if (!stream) {
-        spoolListed = true;
-        return true;
-    }
-    auto json = nlohmann::json::parse(stream, nullptr, false);
-    if (json.is_discarded() || !json.is_object() || !json.contains("backends") || !json["backends"].is_array()) {
-        error = configuration.string() + ": expected {\"backends\": [...]}";
-        return false;
-    }
-    spoolListed = false;
-    for (const auto& backend : json["backends"]) {
-        std::string type = backend.is_object() ? backend.value("type", "") : "";
-        if (type == "spool") {
-            spoolListed = true;
-        } else if (type == "otlp-http" && backend.contains("url") && backend["url"].is_string()) {
-            collectors.push_back(backend["url"].get<std::string>());
-        } else {
-            error = configuration.string() + ": unknown backend " + backend.dump();
-            return false;
-        }
-    }
-    return true;
+    CURLU* parsed = curl_url();
+    bool good = curl_url_set(parsed, CURLUPART_URL, url.c_str(), 0) == CURLUE_OK;
+    char* scheme = nullptr;
+    char* host = nullptr;
+    good = good && curl_url_get(parsed, CURLUPART_SCHEME, &scheme, 0) == CURLUE_OK &&
+        curl_url_get(parsed, CURLUPART_HOST, &host, 0) == CURLUE_OK && host && *host &&
+        (std::string_view(scheme) == "http" || std::string_view(scheme) == "https");
+    curl_free(scheme);
+    curl_free(host);
+    curl_url_cleanup(parsed);
+    return good;
 }
 
 constexpr auto kSettleTimeout = std::chrono::seconds(10);
@@ -84,14 +73,58 @@ SqliteRetention spoolRetention(const StoreLimit& limit, const std::vector<std::s
 
 } // namespace
 
-std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& database,
-                                               const std::filesystem::path& configuration, const StoreLimit& limit,
-                                               std::string& error)
+std::optional<SpoolUplink::Backends> SpoolUplink::readBackends(const std::filesystem::path& configuration,
+                                                               std::vector<std::string>& errors)
 {
-    bool spoolListed = false;
-    std::vector<std::string> collectors;
-    if (!readBackends(configuration, spoolListed, collectors, error))
-        return nullptr;
+    ConfigFile file(configuration, errors);
+    if (!file.exists())
+        return Backends{true, {}};
+    const nlohmann::json* document = file.document();
+    if (!document)
+        return std::nullopt;
+    if (!document->is_object() || !document->contains("backends")) {
+        file.fail("", "expected {\"backends\": [...]}");
+        return std::nullopt;
+    }
+    bool good = file.onlyKeys(*document, {"backends"}, "uplink.json");
+    const auto& listed = (*document)["backends"];
+    if (!file.expect(listed.is_array(), "backends", "an array of backends"))
+        return std::nullopt;
+    Backends backends{false, {}};
+    for (const auto& backend : listed) {
+        std::string type = backend.is_object() && backend.contains("type") && backend["type"].is_string()
+            ? backend["type"].get<std::string>()
+            : "";
+        if (type == "spool") {
+            good &= file.onlyKeys(backend, {"type"}, "a spool backend");
+            backends.spool = true;
+        } else if (type == "otlp-http") {
+            good &= file.onlyKeys(backend, {"type", "url"}, "an otlp-http backend");
+            auto url = backend.find("url");
+            if (!file.expect(url != backend.end() && url->is_string(), "url", "the collector's URL, a string")) {
+                good = false;
+                continue;
+            }
+            if (!isCollectorUrl(url->get<std::string>())) {
+                file.fail(url->dump(), fmt::format("{} is no http or https URL with a host", url->dump()));
+                good = false;
+            }
+            backends.collectors.push_back(url->get<std::string>());
+        } else {
+            file.fail(type.empty() ? "backends" : "\"" + type + "\"",
+                      fmt::format("unknown backend {}: the types are \"spool\" and \"otlp-http\"", backend.dump()));
+            good = false;
+        }
+    }
+    if (!good)
+        return std::nullopt;
+    return backends;
+}
+
+std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& database, const Backends& backends,
+                                               const StoreLimit& limit, std::string& error)
+{
+    const auto& collectors = backends.collectors;
     auto store = SqliteStore::open(
         database,
         {"CREATE TABLE IF NOT EXISTS sessions(id INTEGER PRIMARY KEY, session_info TEXT, user_info TEXT, "
@@ -109,7 +142,7 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
         spoolRetention(limit, collectors), error);
     if (!store)
         return nullptr;
-    return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store), spoolListed, collectors));
+    return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store), backends.spool, collectors));
 }
 
 SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed,
@@ -119,17 +152,47 @@ SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed,
       spoolListed_(spoolListed)
 {
     for (const auto& url : collectors)
-        exporters_.push_back(std::make_unique<OtlpHttpExporter>(store_->path(), url));
+        exporters_.push_back(std::make_shared<OtlpHttpExporter>(store_->path(), url));
 }
 
 SpoolUplink::~SpoolUplink() = default;
 
+void SpoolUplink::reconfigure(const Backends& backends, const StoreLimit& limit)
+{
+    store_->setRetention(spoolRetention(limit, backends.collectors));
+    std::vector<std::shared_ptr<OtlpHttpExporter>> kept;
+    for (const auto& url : backends.collectors) {
+        auto current = exporters();
+        auto found =
+            std::find_if(current.begin(), current.end(), [&](const auto& exporter) { return exporter->url() == url; });
+        kept.push_back(found != current.end() ? *found : std::make_shared<OtlpHttpExporter>(store_->path(), url));
+    }
+    spoolListed_.store(backends.spool);
+    std::lock_guard lock(exportersMutex_);
+    // A collector no longer listed stops once the last backend thread using it lets go.
+    exporters_.swap(kept);
+}
+
+std::vector<std::shared_ptr<OtlpHttpExporter>> SpoolUplink::exporters() const
+{
+    std::lock_guard lock(exportersMutex_);
+    return exporters_;
+}
+
+Dictionary SpoolUplink::exportersStatus() const
+{
+    Dictionary status;
+    for (const auto& exporter : exporters())
+        status.set(exporter->url(), exporter->status());
+    return status;
+}
+
 std::vector<std::string> SpoolUplink::discoverBackends()
 {
     std::vector<std::string> answered;
-    if (spoolListed_)
+    if (spoolListed_.load())
         answered.push_back("spool");
-    for (auto& exporter : exporters_)
+    for (auto& exporter : exporters())
         if (exporter->probe())
             answered.push_back(exporter->url());
     return answered;
@@ -137,11 +200,12 @@ std::vector<std::string> SpoolUplink::discoverBackends()
 
 std::optional<UplinkError> SpoolUplink::settleSession(std::int64_t session, bool realtime)
 {
-    if (exporters_.empty())
+    auto current = exporters();
+    if (current.empty())
         return std::nullopt;
     // The exporters read the spool: the session's rows must be committed first.
     store_->flush();
-    for (auto& exporter : exporters_) {
+    for (auto& exporter : current) {
         auto error = realtime ? exporter->currentError() : exporter->waitForSession(session, kSettleTimeout);
         if (error)
             return error;
@@ -151,15 +215,11 @@ std::optional<UplinkError> SpoolUplink::settleSession(std::int64_t session, bool
 
 UplinkSecureHierarchyToken SpoolUplink::newSecureHierarchyToken(const UplinkSecureHierarchyToken*)
 {
-    thread_local std::mt19937_64 generator{std::random_device{}()};
+    // A random version 4 UUID from the kernel's generator.
+    sd_id128_t id{};
+    sd_id128_randomize(&id);
     UplinkSecureHierarchyToken token;
-    for (std::size_t i = 0; i < token.uuid.size(); i += 8) {
-        std::uint64_t bits = generator();
-        for (std::size_t j = 0; j < 8; ++j)
-            token.uuid[i + j] = static_cast<std::uint8_t>(bits >> (8 * j));
-    }
-    token.uuid[6] = (token.uuid[6] & 0x0F) | 0x40; // version 4
-    token.uuid[8] = (token.uuid[8] & 0x3F) | 0x80; // RFC 4122 variant
+    std::copy(std::begin(id.bytes), std::end(id.bytes), token.uuid.begin());
     return token;
 }
 

@@ -12,6 +12,7 @@
 #include <atomic>
 #include <filesystem>
 #include <memory>
+#include <mutex>
 
 #include "platform/Uplink.h"
 #include "platform/linux/OtlpHttpExporter.h"
@@ -23,11 +24,19 @@ struct StoreLimit;
 
 class SpoolUplink final : public Uplink, public std::enable_shared_from_this<SpoolUplink> {
 public:
-    // The spool at `database`, exporting to the backends that `configuration`
-    // (uplink.json) lists; without that file, the spool alone.
-    static std::shared_ptr<SpoolUplink> open(const std::filesystem::path& database,
-                                             const std::filesystem::path& configuration, const StoreLimit& limit,
-                                             std::string& error);
+    // The backends uplink.json lists: whether the spool is one, and the collectors.
+    struct Backends {
+        bool spool = true;
+        std::vector<std::string> collectors;
+    };
+    // The backends of `configuration`; without the file, the spool alone. Nothing,
+    // with `errors` added, for a file that lists anything else.
+    static std::optional<Backends> readBackends(const std::filesystem::path& configuration,
+                                                std::vector<std::string>& errors);
+
+    // The spool at `database`, exporting to the collectors of `backends`.
+    static std::shared_ptr<SpoolUplink> open(const std::filesystem::path& database, const Backends& backends,
+                                             const StoreLimit& limit, std::string& error);
     ~SpoolUplink() override;
 
     UplinkSecureHierarchyToken newSecureHierarchyToken(const UplinkSecureHierarchyToken* parent) override;
@@ -37,7 +46,12 @@ public:
                         Dictionary payload, std::optional<UplinkError>& error) override;
 
     SqliteStore& store() { return *store_; }
-    const std::vector<std::unique_ptr<OtlpHttpExporter>>& exporters() const { return exporters_; }
+    // The collectors exported to now, and what each says of itself, by URL.
+    std::vector<std::shared_ptr<OtlpHttpExporter>> exporters() const;
+    Dictionary exportersStatus() const;
+    // A configuration read again: the spool listed or not, collectors started and
+    // stopped to match, the spool's retention. Callable from any thread.
+    void reconfigure(const Backends& backends, const StoreLimit& limit);
 
     // The backends that answer now: "spool" when it is listed, and every collector
     // that responds. Blocks for the probes; backend threads only.
@@ -53,8 +67,9 @@ private:
 
     std::unique_ptr<SqliteStore> store_;
     std::atomic<std::int64_t> lastSessionID_;
-    bool spoolListed_;
-    std::vector<std::unique_ptr<OtlpHttpExporter>> exporters_;
+    std::atomic<bool> spoolListed_;
+    mutable std::mutex exportersMutex_;
+    std::vector<std::shared_ptr<OtlpHttpExporter>> exporters_;
 };
 
 } // namespace mx

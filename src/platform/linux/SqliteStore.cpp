@@ -179,6 +179,8 @@ void SqliteStore::run()
             std::this_thread::sleep_for(kBatchWindow);
             lock.lock();
         }
+        if (newRetention_)
+            retention_ = *std::exchange(newRetention_, std::nullopt);
         std::deque<SqliteWrite> batch;
         while (!queue_.empty() && batch.size() < kBatchLimit) {
             batch.push_back(std::move(queue_.front()));
@@ -278,6 +280,12 @@ void SqliteStore::prune()
 
 // Holds the batch until it commits. Meanwhile nothing more is taken from the queue,
 // which fills, and then callers wait: that is the back-pressure, not a loss.
+void SqliteStore::setRetention(SqliteRetention retention)
+{
+    std::lock_guard lock(mutex_);
+    newRetention_ = std::move(retention);
+}
+
 Dictionary SqliteStore::status()
 {
     std::uint64_t bytes = 0;

@@ -17,6 +17,7 @@
 #include <filesystem>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <sys/types.h>
 #include <thread>
@@ -99,6 +100,8 @@ public:
     std::int64_t queryInteger(const std::string& sql);
 
     const std::filesystem::path& path() const { return path_; }
+    // From the next batch on, keep this much instead.
+    void setRetention(SqliteRetention retention);
     // "rows_written" (since start-up), "queue_depth" (rows waiting for the writer),
     // "bytes" (the file and its log on disk), "failures" (failed write attempts).
     Dictionary status();
@@ -130,7 +133,8 @@ private:
     const std::filesystem::path path_;
     const std::vector<std::string> schema_;
     const std::vector<std::string> statementTexts_;
-    const SqliteRetention retention_;
+    SqliteRetention retention_; // writer thread only
+    std::optional<SqliteRetention> newRetention_;
     Connection connection_;
     std::chrono::steady_clock::time_point lastPrune_{};
 

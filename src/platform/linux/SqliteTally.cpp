@@ -1,55 +1,74 @@
 #include "platform/linux/SqliteTally.h"
 
+#include <algorithm>
 #include <chrono>
-#include <fstream>
 
 #include "platform/JsonValue.h"
 #include "platform/MxLog.h"
+#include "platform/linux/ConfigFile.h"
 #include "platform/linux/StoreLimits.h"
 
 namespace mx {
 
-namespace {
-
-std::vector<std::string> readDisabled(const std::filesystem::path& configuration)
+std::optional<std::vector<std::string>> SqliteTally::readDisabled(const std::filesystem::path& configuration,
+                                                                  std::vector<std::string>& errors)
 {
-    std::ifstream stream(configuration);
-    if (!stream)
-        return {};
-    auto json = nlohmann::json::parse(stream, nullptr, /*allow_exceptions=*/false);
-    std::vector<std::string> disabled;
-    if (json.is_object() && json.contains("disabled") && json["disabled"].is_array()) {
-        for (const auto& entry : json["disabled"])
-            if (entry.is_string())
-                disabled.push_back(entry.get<std::string>());
-    } else {
-        MXLOG(nullptr, Error, "ignoring {}: expected {{\"disabled\": [names or prefixes]}}", configuration.string());
+    ConfigFile file(configuration, errors);
+    if (!file.exists())
+        return std::vector<std::string>{};
+    const nlohmann::json* document = file.document();
+    if (!document)
+        return std::nullopt;
+    if (!document->is_object()) {
+        file.fail("", "expected {\"disabled\": [names or prefixes]}");
+        return std::nullopt;
     }
+    bool good = file.onlyKeys(*document, {"disabled"}, "tally.json");
+    std::vector<std::string> disabled;
+    auto listed = document->find("disabled");
+    if (listed == document->end())
+        return good ? std::optional(disabled) : std::nullopt;
+    bool strings = listed->is_array() &&
+        std::all_of(listed->begin(), listed->end(), [](const auto& entry) { return entry.is_string(); });
+    if (!file.expect(strings, "disabled", "an array of event names or prefixes") || !good)
+        return std::nullopt;
+    for (const auto& entry : *listed)
+        disabled.push_back(entry.get<std::string>());
     return disabled;
 }
 
-} // namespace
-
-std::unique_ptr<SqliteTally> SqliteTally::open(const std::filesystem::path& database,
-                                               const std::filesystem::path& configuration, const StoreLimit& limit,
-                                               std::string& error)
+std::unique_ptr<SqliteTally> SqliteTally::open(const std::filesystem::path& database, std::vector<std::string> disabled,
+                                               const StoreLimit& limit, std::string& error)
 {
     auto store = SqliteStore::open(
         database, {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, name TEXT, payload TEXT)"},
         {"INSERT INTO events(time, name, payload) VALUES(?, ?, ?)"}, eventsRetention(limit), error);
     if (!store)
         return nullptr;
-    return std::unique_ptr<SqliteTally>(new SqliteTally(std::move(store), readDisabled(configuration)));
+    return std::unique_ptr<SqliteTally>(new SqliteTally(std::move(store), std::move(disabled)));
 }
 
 SqliteTally::SqliteTally(std::unique_ptr<SqliteStore> store, std::vector<std::string> disabled)
-    : store_(std::move(store)), disabled_(std::move(disabled))
+    : store_(std::move(store)), disabled_(std::make_shared<const std::vector<std::string>>(std::move(disabled)))
 {
+}
+
+void SqliteTally::reconfigure(std::vector<std::string> disabled, const StoreLimit& limit)
+{
+    store_->setRetention(eventsRetention(limit));
+    auto replacement = std::make_shared<const std::vector<std::string>>(std::move(disabled));
+    std::lock_guard lock(disabledMutex_);
+    disabled_.swap(replacement);
 }
 
 bool SqliteTally::wanted(std::string_view name) const
 {
-    for (const auto& prefix : disabled_)
+    std::shared_ptr<const std::vector<std::string>> disabled;
+    {
+        std::lock_guard lock(disabledMutex_);
+        disabled = disabled_;
+    }
+    for (const auto& prefix : *disabled)
         if (name.starts_with(prefix))
             return false;
     return true;

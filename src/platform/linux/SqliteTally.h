@@ -6,6 +6,8 @@
 
 #include <filesystem>
 #include <memory>
+#include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -18,19 +20,26 @@ struct StoreLimit;
 
 class SqliteTally final : public Tally {
 public:
-    static std::unique_ptr<SqliteTally> open(const std::filesystem::path& database,
-                                             const std::filesystem::path& configuration, const StoreLimit& limit,
-                                             std::string& error);
+    // The names and prefixes that `configuration` disables; none without the file.
+    // Nothing, with `errors` added, for a file that is not as above.
+    static std::optional<std::vector<std::string>> readDisabled(const std::filesystem::path& configuration,
+                                                                std::vector<std::string>& errors);
+    static std::unique_ptr<SqliteTally> open(const std::filesystem::path& database, std::vector<std::string> disabled,
+                                             const StoreLimit& limit, std::string& error);
 
     void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override;
     bool wanted(std::string_view name) const;
     SqliteStore& store() { return *store_; }
 
+    // A configuration read again: from now on these are wanted and kept.
+    void reconfigure(std::vector<std::string> disabled, const StoreLimit& limit);
+
 private:
     SqliteTally(std::unique_ptr<SqliteStore> store, std::vector<std::string> disabled);
 
     std::unique_ptr<SqliteStore> store_;
-    std::vector<std::string> disabled_;
+    mutable std::mutex disabledMutex_;
+    std::shared_ptr<const std::vector<std::string>> disabled_;
 };
 
 } // namespace mx

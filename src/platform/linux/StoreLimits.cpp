@@ -1,9 +1,9 @@
 #include "platform/linux/StoreLimits.h"
 
-#include <fstream>
-
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
+
+#include "platform/linux/ConfigFile.h"
 
 namespace mx {
 
@@ -11,46 +11,35 @@ namespace {
 
 using Json = nlohmann::json;
 
-bool readNumber(const Json& section, const char* key, double& value, std::string& error, const std::string& where)
-{
-    if (!section.contains(key))
-        return true;
-    const Json& number = section[key];
-    if (!number.is_number() || number.get<double>() < 0) {
-        error = fmt::format("{}: \"{}\" must be a number of at least 0", where, key);
-        return false;
-    }
-    value = number.get<double>();
-    return true;
-}
-
-bool readSection(const Json& document, const char* name, const std::vector<const char*>& keys,
-                 std::vector<double*> values, std::string& error, const std::string& file)
+// The section `name` of the document: each of `keys` a number of at least 0.
+bool readSection(ConfigFile& file, const Json& document, const char* name, std::initializer_list<std::string_view> keys,
+                 std::vector<double*> values)
 {
     if (!document.contains(name))
         return true;
     const Json& section = document[name];
-    std::string where = fmt::format("{}: \"{}\"", file, name);
-    if (!section.is_object()) {
-        error = where + " must be an object";
+    if (!file.expect(section.is_object(), name, "an object"))
         return false;
+    bool good = file.onlyKeys(section, keys, fmt::format("\"{}\"", name));
+    std::size_t index = 0;
+    for (auto key : keys) {
+        auto found = section.find(key);
+        double* value = values[index++];
+        if (found == section.end())
+            continue;
+        if (file.expect(found->is_number() && found->get<double>() >= 0, key, "a number of at least 0"))
+            *value = found->get<double>();
+        else
+            good = false;
     }
-    for (const auto& [key, value] : section.items())
-        if (std::find(keys.begin(), keys.end(), key) == keys.end()) {
-            error = fmt::format("{} has no setting \"{}\"", where, key);
-            return false;
-        }
-    for (std::size_t i = 0; i < keys.size(); ++i)
-        if (!readNumber(section, keys[i], *values[i], error, where))
-            return false;
-    return true;
+    return good;
 }
 
-bool readStore(const Json& document, const char* name, StoreLimit& limit, std::string& error, const std::string& file)
+bool readStore(ConfigFile& file, const Json& document, const char* name, StoreLimit& limit)
 {
     double bytes = static_cast<double>(limit.maxBytes);
     double days = static_cast<double>(limit.maxAge.count()) / 86400;
-    if (!readSection(document, name, {"max_bytes", "max_age_days"}, {&bytes, &days}, error, file))
+    if (!readSection(file, document, name, {"max_bytes", "max_age_days"}, {&bytes, &days}))
         return false;
     limit.maxBytes = static_cast<std::uint64_t>(bytes);
     limit.maxAge = std::chrono::seconds(static_cast<std::int64_t>(days * 86400));
@@ -59,28 +48,27 @@ bool readStore(const Json& document, const char* name, StoreLimit& limit, std::s
 
 } // namespace
 
-std::optional<StoreLimits> StoreLimits::read(const std::filesystem::path& file, std::string& error)
+std::optional<StoreLimits> StoreLimits::read(const std::filesystem::path& path, std::vector<std::string>& errors)
 {
     StoreLimits limits;
-    std::ifstream stream(file);
-    if (!stream)
+    ConfigFile file(path, errors);
+    if (!file.exists())
         return limits;
-    Json document = Json::parse(stream, nullptr, /*allow_exceptions=*/false);
-    if (!document.is_object()) {
-        error = file.string() + ": expected an object of store limits";
+    const Json* document = file.document();
+    if (!document)
+        return std::nullopt;
+    if (!document->is_object()) {
+        file.fail("", "expected an object of store limits");
         return std::nullopt;
     }
-    for (const auto& [key, value] : document.items())
-        if (key != "tally" && key != "joule" && key != "uplink" && key != "summaries") {
-            error = fmt::format("{}: no store is called \"{}\"", file.string(), key);
-            return std::nullopt;
-        }
+    bool good = file.onlyKeys(*document, {"tally", "joule", "uplink", "summaries"}, "stores.json");
     double files = static_cast<double>(limits.summaries.maxFiles);
     double bytes = static_cast<double>(limits.summaries.maxBytes);
-    if (!readStore(document, "tally", limits.tally, error, file.string()) ||
-        !readStore(document, "joule", limits.joule, error, file.string()) ||
-        !readStore(document, "uplink", limits.uplink, error, file.string()) ||
-        !readSection(document, "summaries", {"max_files", "max_bytes"}, {&files, &bytes}, error, file.string()))
+    good &= readStore(file, *document, "tally", limits.tally);
+    good &= readStore(file, *document, "joule", limits.joule);
+    good &= readStore(file, *document, "uplink", limits.uplink);
+    good &= readSection(file, *document, "summaries", {"max_files", "max_bytes"}, {&files, &bytes});
+    if (!good)
         return std::nullopt;
     limits.summaries = {static_cast<std::size_t>(files), static_cast<std::uint64_t>(bytes)};
     return limits;

@@ -2,13 +2,14 @@
 // How much disk the daemon's stores and summary files may take, from
 // etc/harmonia/stores.json: {"tally": {"max_bytes": N, "max_age_days": D}, "joule":
 // ..., "uplink": ..., "summaries": {"max_files": N, "max_bytes": N}}. What the file
-// leaves out keeps its default. Read once at start-up by main.
+// leaves out keeps its default. Read at start-up and again on SIGHUP.
 
 #include <chrono>
 #include <cstdint>
 #include <filesystem>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/linux/SqliteStore.h"
 
@@ -33,8 +34,8 @@ struct StoreLimits {
     SummaryLimit summaries{500, std::uint64_t{128} << 20};
 
     // The limits in `file`, the defaults where it is silent or absent; nothing, with
-    // `error`, for a file that is not as above.
-    static std::optional<StoreLimits> read(const std::filesystem::path& file, std::string& error);
+    // `errors` added, for a file that is not as above.
+    static std::optional<StoreLimits> read(const std::filesystem::path& file, std::vector<std::string>& errors);
 };
 
 // The retention of a store whose rows live in one table `events` with a `time` column.

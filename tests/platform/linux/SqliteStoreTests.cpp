@@ -1,8 +1,11 @@
+#include "platform/linux/JsonDeviceProperties.h"
+#include "platform/linux/SpoolUplink.h"
 #include "platform/linux/SqliteTally.h"
 #include "platform/linux/StoreLimits.h"
 
 #include <fstream>
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 
@@ -40,8 +43,11 @@ protected:
 TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
 {
     std::ofstream(directory / "tally.json") << R"({"disabled": ["com.kestrel.harmonia.DriverStats", "exact.name"]})";
+    std::vector<std::string> errors;
+    auto disabled = SqliteTally::readDisabled(directory / "tally.json", errors);
+    ASSERT_TRUE(disabled);
     std::string error;
-    auto tally = SqliteTally::open(directory / "tally.db", directory / "tally.json", StoreLimit{}, error);
+    auto tally = SqliteTally::open(directory / "tally.db", *disabled, StoreLimit{}, error);
     ASSERT_TRUE(tally) << error;
     int built = 0;
     auto build = [&] {
@@ -59,6 +65,44 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
     EXPECT_EQ(count("SELECT count(*) FROM events"), events);
     EXPECT_EQ(count("SELECT count(*) FROM events WHERE payload = '{\"k\":\"v\",\"when\":\"1970-01-01T00:00:00Z\"}'"),
               events);
+}
+
+TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)
+{
+    auto write = [&](const char* name, const char* text) {
+        std::ofstream(directory / name) << text;
+        return directory / name;
+    };
+    std::vector<std::string> errors;
+    EXPECT_FALSE(SpoolUplink::readBackends(write("uplink.json",
+                                                 "{\"backends\": [\n  {\"type\": \"spool\"},\n"
+                                                 "  {\"type\": \"otlp-http\", \"url\": \"not a url\"},\n"
+                                                 "  {\"type\": \"otlp-http\", \"urll\": 1}]}"),
+                                           errors));
+    EXPECT_FALSE(
+        StoreLimits::read(write("stores.json", "{\"tally\": {\"max_bytes\": \"big\"},\n \"tallly\": {}}"), errors));
+    EXPECT_FALSE(SqliteTally::readDisabled(write("tally.json", "{\"disabled\": [\"a\",]}"), errors));
+    EXPECT_FALSE(JsonDeviceProperties::check(write("device.json", "{\"InternalBuild\": \"yes\"}"), errors));
+    auto in = [&](const std::string& file) {
+        return (directory / file).string();
+    };
+    EXPECT_THAT(
+        errors,
+        ::testing::ElementsAre(
+            in("uplink.json") + ":3:32: \"not a url\" is no http or https URL with a host",
+            in("uplink.json") + ":4:25: an otlp-http backend has no setting \"urll\" (it has type, url)",
+            in("uplink.json") + ":3:25: \"url\" must be the collector's URL, a string",
+            in("stores.json") + ":2:2: stores.json has no setting \"tallly\" (it has tally, joule, uplink, summaries)",
+            in("stores.json") + ":1:12: \"max_bytes\" must be a number of at least 0",
+            ::testing::StartsWith(in("tally.json") + ":1:19: syntax error"),
+            in("device.json") + ":1:2: \"InternalBuild\" must be true or false"));
+
+    errors.clear();
+    std::filesystem::remove(directory / "uplink.json");
+    auto backends = SpoolUplink::readBackends(directory / "uplink.json", errors);
+    ASSERT_TRUE(backends) << "an absent file is the spool alone";
+    EXPECT_TRUE(backends->spool);
+    EXPECT_TRUE(errors.empty());
 }
 
 } // namespace

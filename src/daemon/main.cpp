@@ -11,14 +11,14 @@
 #include <unistd.h>
 
 #include <asio/signal_set.hpp>
-#include <asio/steady_timer.hpp>
 #include <curl/curl.h>
 #include <systemd/sd-daemon.h>
 
-#include "Statistics/Service/MxReportingMetrics.h"
 #include "Statistics/Service/MxReportingServiceDelegate.h"
 #include "Statistics/Service/MxReportingSessionSummary.h"
 #include "Statistics/Service/MxReportingStatus.h"
+#include "daemon/DaemonConfiguration.h"
+#include "daemon/DaemonHeartbeat.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/DatagramOrientation.h"
@@ -42,63 +42,25 @@ using namespace mx;
 
 namespace {
 
-constexpr const char* kUsage = R"(usage: mxreportingd [--help] [--version]
+constexpr const char* kUsage = R"(usage: mxreportingd [--help] [--version] [--check-config]
 
 The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default /):
   run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
   run/harmonia/notify.sock          the notification endpoint
   run/harmonia/orientation.sock     the orientation feed ("device N", "ui N")
   var/lib/harmonia/                 tally.db, joule.db, uplink.db, preferences/
-  etc/harmonia/                     device.json, tally.json
+  var/lib/harmonia/metrics/         mxreportingd.prom, the status counters for Prometheus
+  etc/harmonia/                     device.json, tally.json, uplink.json, stores.json
+  var/log/harmonia/reporting/       session summary files (internal builds)
+--check-config checks etc/harmonia/ and exits 0, or 1 with every error found.
 Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
-SIGHUP re-reads the preferences; SIGTERM commits the stores and exits.
+SIGHUP re-reads etc/harmonia/ (a configuration with errors is refused, the one in use
+kept) and the preferences; SIGTERM commits the stores and exits.
 )";
 
 // How long a shutdown waits for the queues: sessions still waiting on backend
 // discovery take up to 9 s a round, and the unit's stop timeout is 90 s.
 constexpr std::chrono::milliseconds kDrainBound{60'000};
-
-// How often the metrics file and systemd's status line are brought up to date.
-constexpr std::chrono::seconds kStatusInterval{5};
-
-// Every period: the watchdog is told the connection thread lives, and the server
-// queue writes the metrics file and the status line. The watchdog is fed from the
-// connection thread, not the server queue, because the server queue may rightly
-// wait a long time on a full disk, and a restart then would lose what it holds.
-class Heartbeat {
-public:
-    Heartbeat(asio::io_context& io, std::shared_ptr<WorkQueue> serverQueue, MxReportingStatus& status)
-        : timer_(io), serverQueue_(std::move(serverQueue)), status_(status)
-    {
-        std::uint64_t watchdog = 0;
-        if (sd_watchdog_enabled(0, &watchdog) > 0)
-            period_ = std::min(
-                period_,
-                std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::microseconds(watchdog / 2)));
-    }
-
-    void beat()
-    {
-        sd_notify(0, "WATCHDOG=1");
-        serverQueue_->dispatch([&status = status_] {
-            auto snapshot = status.snapshot();
-            MxReportingMetrics::write(snapshot);
-            sd_notify(0, ("STATUS=" + MxReportingStatus::summaryLine(snapshot)).c_str());
-        });
-        timer_.expires_after(period_);
-        timer_.async_wait([this](const std::error_code& cancelled) {
-            if (!cancelled)
-                beat();
-        });
-    }
-    void stop() { timer_.cancel(); }
-
-private:
-    asio::steady_timer timer_;
-    std::shared_ptr<WorkQueue> serverQueue_;
-    MxReportingStatus& status_;
-    std::chrono::milliseconds period_ = kStatusInterval;
-};
 
 // Every client is a descriptor: take all the system allows, not the shell's default.
 void raiseDescriptorLimit()
@@ -110,11 +72,51 @@ void raiseDescriptorLimit()
     }
 }
 
+int checkConfiguration()
+{
+    std::vector<std::string> errors;
+    if (DaemonConfiguration::read(errors)) {
+        std::printf("mxreportingd: the configuration in %s is good\n", MxReportingPath("etc/harmonia").c_str());
+        return 0;
+    }
+    for (const auto& error : errors)
+        std::fprintf(stderr, "%s\n", error.c_str());
+    return 1;
+}
+
+std::string joined(const std::vector<std::string>& errors)
+{
+    std::string text;
+    for (const auto& error : errors)
+        text += (text.empty() ? "" : "; ") + error;
+    return text;
+}
+
 [[noreturn]] void fail(const std::string& message)
 {
     MXLOG(nullptr, Error, "mxreportingd cannot start: {}", message);
     // Worker threads already run: no static destructor may pull the world from under them.
     std::_Exit(1);
+}
+
+// SIGHUP: the configuration read again and put to use, unless it has errors.
+void reconfigure(SqliteTally& tally, SqliteJoule& joule, SpoolUplink& uplink)
+{
+    std::vector<std::string> errors;
+    auto configuration = DaemonConfiguration::read(errors);
+    if (!configuration) {
+        for (const auto& error : errors)
+            MXLOG(nullptr, Error, "configuration refused: {}", error);
+        MXLOG(nullptr, Error, "keeping the configuration in use");
+        return;
+    }
+    const auto& limits = configuration->limits;
+    tally.reconfigure(configuration->disabledEvents, limits.tally);
+    joule.store().setRetention(eventsRetention(limits.joule));
+    uplink.reconfigure(configuration->backends, limits.uplink);
+    MxReportingSessionSummary::setRetention(limits.summaries.maxFiles, limits.summaries.maxBytes);
+    MXLOG(nullptr, Default, "configuration read again: {} collectors, {} disabled event names",
+          configuration->backends.collectors.size(), configuration->disabledEvents.size());
 }
 
 int run(int argc, char** argv)
@@ -128,6 +130,8 @@ int run(int argc, char** argv)
             std::puts("mxreportingd " MXREPORTING_VERSION);
             return 0;
         }
+        if (std::strcmp(argv[i], "--check-config") == 0)
+            return checkConfiguration();
         std::fprintf(stderr, "mxreportingd: unknown argument %s\n%s", argv[i], kUsage);
         return 64;
     }
@@ -155,12 +159,14 @@ int run(int argc, char** argv)
         fail(error);
     ProcessWide<Orientation>::install(&orientation);
 
-    auto limits = StoreLimits::read(MxReportingPath("etc/harmonia/stores.json"), error);
-    if (!limits)
-        fail(error);
+    std::vector<std::string> errors;
+    auto configuration = DaemonConfiguration::read(errors);
+    if (!configuration)
+        fail(joined(errors));
+    const StoreLimits* limits = &configuration->limits;
     MxReportingSessionSummary::setRetention(limits->summaries.maxFiles, limits->summaries.maxBytes);
-    auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"),
-                                   MxReportingPath("etc/harmonia/tally.json"), limits->tally, error);
+    auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"), configuration->disabledEvents,
+                                   limits->tally, error);
     if (!tally)
         fail(error);
     ProcessWide<Tally>::install(tally.get());
@@ -169,8 +175,8 @@ int run(int argc, char** argv)
         fail(error);
     ProcessWide<Joule>::install(joule.get());
     curl_global_init(CURL_GLOBAL_DEFAULT);
-    auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"),
-                                    MxReportingPath("etc/harmonia/uplink.json"), limits->uplink, error);
+    auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), configuration->backends,
+                                    limits->uplink, error);
     if (!uplink)
         fail(error);
     ProcessWide<Uplink>::install(uplink.get());
@@ -193,7 +199,12 @@ int run(int argc, char** argv)
         reload.async_wait([&](const std::error_code& cancelled, int) {
             if (cancelled)
                 return;
-            notifications.deliver(kMxReportingDefaultsNotification);
+            // Off the connection thread: a collector no longer listed may take a
+            // while to stop.
+            dispatch.globalQueue(QueuePriority::Utility).dispatch([&] {
+                reconfigure(*tally, *joule, *uplink);
+                notifications.deliver(kMxReportingDefaultsNotification);
+            });
             waitForReload();
         });
     };
@@ -208,10 +219,9 @@ int run(int argc, char** argv)
     status.addStore("tally", [&] { return tally->store().status(); });
     status.addStore("joule", [&] { return joule->store().status(); });
     status.addStore("uplink", [&] { return uplink->store().status(); });
-    for (const auto& exporter : uplink->exporters())
-        status.addExporter(exporter->url(), [&exporter = *exporter] { return exporter.status(); });
+    status.setExporters([&] { return uplink->exportersStatus(); });
     root->setStatusView([&status] { return status.snapshot(); });
-    Heartbeat heartbeat(listener->ioContext(), root->serverQueue(), status);
+    DaemonHeartbeat heartbeat(listener->ioContext(), root->serverQueue(), status);
 
     listener->setDelegate(root);
     listener->resume();

@@ -1,0 +1,34 @@
+#include "daemon/DaemonHeartbeat.h"
+
+#include <systemd/sd-daemon.h>
+
+#include "Statistics/Service/MxReportingMetrics.h"
+
+namespace mx {
+
+DaemonHeartbeat::DaemonHeartbeat(asio::io_context& io, std::shared_ptr<WorkQueue> serverQueue,
+                                 MxReportingStatus& status)
+    : timer_(io), serverQueue_(std::move(serverQueue)), status_(status)
+{
+    std::uint64_t watchdog = 0;
+    if (sd_watchdog_enabled(0, &watchdog) > 0)
+        interval_ = std::min(
+            interval_, std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::microseconds(watchdog / 2)));
+}
+
+void DaemonHeartbeat::beat()
+{
+    sd_notify(0, "WATCHDOG=1");
+    serverQueue_->dispatch([&status = status_] {
+        auto snapshot = status.snapshot();
+        MxReportingMetrics::write(snapshot);
+        sd_notify(0, ("STATUS=" + MxReportingStatus::summaryLine(snapshot)).c_str());
+    });
+    timer_.expires_after(interval_);
+    timer_.async_wait([this](const std::error_code& cancelled) {
+        if (!cancelled)
+            beat();
+    });
+}
+
+} // namespace mx

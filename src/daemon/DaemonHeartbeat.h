@@ -1,0 +1,38 @@
+#pragma once
+// The daemon's pulse, every few seconds: systemd's watchdog is told the connection
+// thread lives, and the server queue writes the metrics file and systemd's status
+// line from the status view. The watchdog is fed from the connection thread, not the
+// server queue, because the server queue may rightly wait a long time on a full
+// disk, and a restart then would lose what the stores still hold.
+
+#include <chrono>
+#include <memory>
+
+#include <asio/io_context.hpp>
+#include <asio/steady_timer.hpp>
+
+#include "Statistics/Service/MxReportingStatus.h"
+#include "platform/WorkQueue.h"
+
+namespace mx {
+
+class DaemonHeartbeat {
+public:
+    static constexpr std::chrono::seconds kInterval{5};
+
+    // Beats on `io`'s thread; `status` is read on `serverQueue`. The interval is
+    // shortened to half the watchdog's when systemd asks for one.
+    DaemonHeartbeat(asio::io_context& io, std::shared_ptr<WorkQueue> serverQueue, MxReportingStatus& status);
+
+    // Beats now and then every interval. Connection thread only, as is stop.
+    void beat();
+    void stop() { timer_.cancel(); }
+
+private:
+    asio::steady_timer timer_;
+    std::shared_ptr<WorkQueue> serverQueue_;
+    MxReportingStatus& status_;
+    std::chrono::milliseconds interval_ = kInterval;
+};
+
+} // namespace mx
