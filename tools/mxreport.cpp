@@ -324,7 +324,14 @@ int defaults(const std::vector<std::string>& words)
     }
     if (verb == "write" && words.size() == 4) {
         auto json = nlohmann::ordered_json::parse(words[3], nullptr, false);
-        stored.set(words[2], json.is_discarded() ? Value(words[3]) : fromJson(json));
+        Value value = json.is_discarded() ? Value(words[3]) : fromJson(json);
+        // The daemon reads these two as a bool and a string: a typo must not turn
+        // "flase" into a string that reads as false.
+        if (words[2] == "disable_reporting" && !value.asBool())
+            throw UsageError{fmt::format("disable_reporting is true or false, not {}", words[3])};
+        if (words[2] == "device_name" && !value.asString())
+            throw UsageError{fmt::format("device_name is a text, not {} (quote it: '\"{}\"')", words[3], words[3])};
+        stored.set(words[2], std::move(value));
     } else if (verb == "delete" && words.size() == 3) {
         stored.erase(words[2]);
     } else {
