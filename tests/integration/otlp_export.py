@@ -4,6 +4,7 @@ loopback gets valid log batches for a flushed batch session and a standalone
 message; with the receiver down a flush reports the error, the daemon goes on, and
 what it could not send reaches the receiver once it is back."""
 
+import gzip
 import http.server
 import json
 import sys
@@ -19,6 +20,7 @@ class Receiver:
 
     def __init__(self, port=0):
         self.records = []
+        self.gzipped = 0
         self.refusals = 0  # answer this many requests with 503 and Retry-After: 1
         self.lock = threading.Lock()
         receiver = self
@@ -26,6 +28,10 @@ class Receiver:
         class Handler(http.server.BaseHTTPRequestHandler):
             def do_POST(self):
                 body = self.rfile.read(int(self.headers["Content-Length"]))
+                if self.headers.get("Content-Encoding") == "gzip":
+                    body = gzip.decompress(body)
+                    with receiver.lock:
+                        receiver.gzipped += 1
                 request = json.loads(body)
                 with receiver.lock:
                     if receiver.refusals > 0:
@@ -96,6 +102,7 @@ def main():
         check("session information travels", attrs["harmonia.session.SessionID"] == {"intValue": "1"}, attrs)
         check("service name travels", attrs["harmonia.user.ServiceName"] == {"stringValue": "longformaudio_session"})
         check("summary event last", attributes(records[3])["harmonia.type"] == {"intValue": "65535"})
+        check("bodies are gzipped", receiver.gzipped > 0)
 
         client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"alone": True}, 1, 0, None)
         check("standalone message exported at once",

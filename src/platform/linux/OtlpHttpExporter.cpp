@@ -9,6 +9,7 @@
 #include <nlohmann/json.hpp>
 #include <pthread.h>
 #include <sqlite3.h>
+#include <zlib.h>
 
 #include "platform/MxLog.h"
 #include "platform/linux/SqliteStore.h"
@@ -100,6 +101,24 @@ std::string logsRequest(const Json& records)
 
 std::size_t discardBody(char*, std::size_t size, std::size_t count, void*) { return size * count; }
 
+// The request body as gzip: OTLP batches are repetitive JSON and shrink several times.
+std::string gzip(const std::string& text)
+{
+    z_stream stream{};
+    constexpr int kGzipWindow = 15 + 16;
+    if (deflateInit2(&stream, Z_DEFAULT_COMPRESSION, Z_DEFLATED, kGzipWindow, 8, Z_DEFAULT_STRATEGY) != Z_OK)
+        return {};
+    std::string out(deflateBound(&stream, text.size()), '\0');
+    stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+    stream.avail_in = static_cast<uInt>(text.size());
+    stream.next_out = reinterpret_cast<Bytef*>(out.data());
+    stream.avail_out = static_cast<uInt>(out.size());
+    deflate(&stream, Z_FINISH);
+    out.resize(stream.total_out);
+    deflateEnd(&stream);
+    return out;
+}
+
 // One-shot messages and realtime sessions' messages, in spool order, past the cursor.
 constexpr const char* kStreamQuery =
     "SELECT m.id, m.time, m.category, m.type, m.payload, coalesce(s.session_info, m.session_info), "
@@ -173,37 +192,43 @@ bool OtlpHttpExporter::probe()
     }
     std::chrono::seconds retryAfter{0};
     long status = 0;
-    post(logsRequest(Json::array()), retryAfter, status);
+    // A handle of its own: the exporter thread's may be in the middle of a request.
+    CURL* curl = curl_easy_init();
+    post(curl, logsRequest(Json::array()), retryAfter, status);
+    curl_easy_cleanup(curl);
     std::lock_guard lock(mutex_);
     lastProbe_ = std::chrono::steady_clock::now();
     probeAnswered_ = status != 0;
     return probeAnswered_;
 }
 
-std::optional<UplinkError> OtlpHttpExporter::post(const std::string& body, std::chrono::seconds& retryAfter,
+std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string& body, std::chrono::seconds& retryAfter,
                                                   long& status)
 {
-    CURL* curl = curl_easy_init();
+    status = 0;
     if (!curl)
         return UplinkError{-1, "cannot create an HTTP request"};
+    std::string compressed = gzip(body);
     char failure[CURL_ERROR_SIZE] = "";
     curl_easy_setopt(curl, CURLOPT_URL, url_.c_str());
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, body.c_str());
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, compressed.data());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(compressed.size()));
     curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, 3L);
     curl_easy_setopt(curl, CURLOPT_TIMEOUT, 15L);
     curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(curl, CURLOPT_ACCEPT_ENCODING, "");
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, failure);
     curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, discardBody);
     curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
+    headers = curl_slist_append(headers, "Content-Encoding: gzip");
     curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
     CURLcode result = curl_easy_perform(curl);
-    status = 0;
     curl_off_t retry = 0;
     curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
     curl_easy_getinfo(curl, CURLINFO_RETRY_AFTER, &retry);
+    curl_easy_setopt(curl, CURLOPT_HTTPHEADER, nullptr);
+    curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, nullptr);
     curl_slist_free_all(headers);
-    curl_easy_cleanup(curl);
     retryAfter = std::chrono::seconds(retry);
     if (result != CURLE_OK)
         return UplinkError{result, fmt::format("{}: {}", url_, failure[0] ? failure : curl_easy_strerror(result))};
@@ -220,6 +245,8 @@ void OtlpHttpExporter::run()
     }
     // The spool made the exports tables before any exporter started.
     sqlite3_busy_timeout(database_, 5000);
+    // One handle for the thread's life keeps the collector's connection open.
+    handle_ = curl_easy_init();
 
     auto backoff = kFirstBackoff;
     for (;;) {
@@ -254,6 +281,7 @@ void OtlpHttpExporter::run()
         if (stopping_)
             break;
     }
+    curl_easy_cleanup(handle_);
     sqlite3_close(database_);
 }
 
@@ -315,7 +343,7 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
     auto send = [&](const Json& records, std::optional<UplinkError>& failure) {
         std::chrono::seconds retryAfter{0};
         long status = 0;
-        failure = post(logsRequest(records), retryAfter, status);
+        failure = post(handle_, logsRequest(records), retryAfter, status);
         if (failure && retryAfter.count() > 0) {
             failure->description += fmt::format(" (retry after {} s)", retryAfter.count());
             retryAfter_ = retryAfter;

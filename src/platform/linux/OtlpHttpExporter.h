@@ -52,11 +52,13 @@ private:
     std::optional<UplinkError> exportBatch(std::size_t& exported);
     void measureLag();
     // `status` is the HTTP status, 0 when no response came at all.
-    std::optional<UplinkError> post(const std::string& body, std::chrono::seconds& retryAfter, long& status);
+    std::optional<UplinkError> post(void* curl, const std::string& body, std::chrono::seconds& retryAfter,
+                                    long& status);
 
     std::filesystem::path spool_;
     std::string url_;
     sqlite3* database_ = nullptr;
+    void* handle_ = nullptr;                              // the exporter thread's curl handle
     std::chrono::seconds retryAfter_{0};                  // exporter thread only
     std::chrono::steady_clock::time_point lagMeasured_{}; // exporter thread only
 
