@@ -5,11 +5,11 @@
 // killService (status 2).
 
 #include <cstdio>
-#include <cstring>
 #include <future>
 #include <sys/resource.h>
 #include <unistd.h>
 
+#include <CLI/CLI.hpp>
 #include <asio/signal_set.hpp>
 #include <curl/curl.h>
 #include <systemd/sd-daemon.h>
@@ -42,9 +42,9 @@ using namespace mx;
 
 namespace {
 
-constexpr const char* kUsage = R"(usage: mxreportingd [--help] [--version] [--check-config]
+constexpr const char* kDescription = "mxreportingd: the Harmonia audio reporting daemon";
 
-The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default /):
+constexpr const char* kFiles = R"(Every path lives under $MXREPORTING_ROOT (default /):
   run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
   run/harmonia/notify.sock          the notification endpoint
   run/harmonia/orientation.sock     the orientation feed ("device N", "ui N")
@@ -52,11 +52,10 @@ The Harmonia reporting daemon. Every path lives under $MXREPORTING_ROOT (default
   var/lib/harmonia/metrics/         mxreportingd.prom, the status counters for Prometheus
   etc/harmonia/                     device.json, tally.json, uplink.json, stores.json
   var/log/harmonia/reporting/       session summary files (internal builds)
---check-config checks etc/harmonia/ and exits 0, or 1 with every error found.
 Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
 SIGHUP re-reads etc/harmonia/ (a configuration with errors is refused, the one in use
 kept) and the preferences; SIGTERM commits the stores and exits.
-)";
+See what it does: mxreport status.)";
 
 // How long a shutdown waits for the queues: sessions still waiting on backend
 // discovery take up to 9 s a round, and the unit's stop timeout is 90 s.
@@ -121,20 +120,22 @@ void reconfigure(SqliteTally& tally, SqliteJoule& joule, SpoolUplink& uplink)
 
 int run(int argc, char** argv)
 {
-    for (int i = 1; i < argc; ++i) {
-        if (std::strcmp(argv[i], "--help") == 0 || std::strcmp(argv[i], "-h") == 0) {
-            std::fputs(kUsage, stdout);
-            return 0;
-        }
-        if (std::strcmp(argv[i], "--version") == 0) {
-            std::puts("mxreportingd " MXREPORTING_VERSION);
-            return 0;
-        }
-        if (std::strcmp(argv[i], "--check-config") == 0)
-            return checkConfiguration();
-        std::fprintf(stderr, "mxreportingd: unknown argument %s\n%s", argv[i], kUsage);
+    CLI::App options(kDescription, "mxreportingd");
+    options.set_version_flag("--version", "mxreportingd " MXREPORTING_VERSION);
+    bool check = false;
+    options.add_flag("--check-config", check,
+                     "Check the configuration in etc/harmonia/ and exit: 0, or 1 with every error found");
+    options.footer(kFiles);
+    try {
+        options.parse(argc, argv);
+    } catch (const CLI::Success& done) {
+        return options.exit(done);
+    } catch (const CLI::ParseError& wrong) {
+        options.exit(wrong);
         return 64;
     }
+    if (check)
+        return checkConfiguration();
 
     raiseDescriptorLimit();
     StderrLogSink stderrSink;
