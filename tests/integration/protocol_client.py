@@ -96,6 +96,10 @@ def main():
         send_anything = lambda: a.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {}, 1, 0, None)
         checks.check("refused while reporting is off", wait_for(lambda: send_anything() == refusal))
 
+        line = re.compile(r"^\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{3}[+-]\d\d:\d\d (DEBUG|INFO|NOTICE|ERROR) \S+:\d+:\S+: ")
+        unstamped = [text for text in daemon.log().splitlines() if not line.match(text)]
+        check("every log line leads with its time and level", unstamped, [])
+
         a.send("killService:")
         check("kill service exit status", daemon.process.wait(timeout=BOUND), 2)
     finally:
