@@ -4,7 +4,9 @@
 // server on the same socket type as the ceiling. Prints reports/s, p50/p99 reply
 // latency, the daemon's peak memory and the ratios to the echo.
 //
-//   mxreporting_load [--connections N] [--in-flight K] [--seconds S]
+//   mxreporting_load [--connections N] [--in-flight K] [--seconds S] [--memory-reports N]
+// Then one session is sent N reports (200 000; 0 skips it) and keeps them: the
+// daemon's memory per kept report against its size on the wire, and after the stop.
 //   MXREPORTING_BENCH_TALLY_JSON='{"disabled":["com"]}' gives the daemon that tally.json, to
 //   see what the analytics store costs.
 
@@ -25,6 +27,8 @@
 
 #include "EchoServer.h"
 #include "client/MxReportingClient.h"
+#include "wire/MsgpackRpcMessage.h"
+#include "wire/MxReportingMethods.h"
 
 using namespace mx;
 using Clock = std::chrono::steady_clock;
@@ -35,6 +39,7 @@ struct Options {
     int connections = 8;
     int inFlight = 32;
     double seconds = 5;
+    int memoryReports = 200'000;
 };
 
 struct Figures {
@@ -155,14 +160,81 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
     return figures;
 }
 
-long peakMemoryKiB(pid_t pid)
+// A field of /proc/PID/status in KiB ("VmHWM", "VmRSS").
+long memoryKiB(pid_t pid, const std::string& field)
 {
     std::ifstream status("/proc/" + std::to_string(pid) + "/status");
     std::string line;
     while (std::getline(status, line))
-        if (line.rfind("VmHWM:", 0) == 0)
-            return std::stol(line.substr(6));
+        if (line.rfind(field + ":", 0) == 0)
+            return std::stol(line.substr(field.size() + 1));
     return -1;
+}
+
+std::size_t wireSize(const Dictionary& payload)
+{
+    msgpack::sbuffer buffer;
+    encodeRpcRequest(buffer, 1, method::kSendMessage,
+                     Array({Value(payload), Value(0x08000003), Value(1), Value(Array({Value(1)}))}));
+    return buffer.size();
+}
+
+// Whether every store has written what it was handed.
+bool storesIdle(MxReportingClient& client)
+{
+    auto status = client.call(method::kStatus, Array());
+    const Dictionary* stores = status.value && status.value->asDictionary()
+        ? status.value->asDictionary()->find("stores")->asDictionary()
+        : nullptr;
+    if (!stores)
+        return false;
+    for (const auto& [name, store] : *stores)
+        if (store.asDictionary()->find("queue_depth")->int64Value() != 0)
+            return false;
+    return true;
+}
+
+// One started session is sent `reports` reports and keeps them all until its stop:
+// the daemon's growth per report against the report's size on the wire, and how far
+// its memory comes back once the session is gone.
+void measureMemory(const std::filesystem::path& socket, pid_t daemon, int reports)
+{
+    std::string error;
+    auto client = MxReportingClient::connect(socket, error);
+    client->createReportingSession(100);
+    client->setServiceType(7, 100);
+    client->startReportingSessionForID(100, nullptr);
+    while (!storesIdle(*client))
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    long before = memoryKiB(daemon, "VmRSS");
+
+    std::mt19937 random(7);
+    std::size_t wireBytes = 0;
+    std::atomic<int> answered{0};
+    for (int seq = 0; seq < reports; ++seq) {
+        auto payload = realisticPayload(random, seq);
+        wireBytes += wireSize(payload);
+        client->sendMessage(payload, 0x08000003, 1, std::vector<ReporterID>{100},
+                            [&](MxClientResult<MxSendOutcome>) { ++answered; });
+        while (seq - answered.load() > 256)
+            std::this_thread::yield();
+    }
+    while (answered.load() < reports || !storesIdle(*client))
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    long kept = memoryKiB(daemon, "VmRSS");
+    double perReport = static_cast<double>(kept - before) * 1024 / reports;
+    double wire = static_cast<double>(wireBytes) / reports;
+    std::printf("memory: %d reports kept by one session: %.0f bytes each (wire %.0f bytes, ratio %.2f); "
+                "RSS %ld -> %ld KiB\n",
+                reports, perReport, wire, perReport / wire, before, kept);
+
+    client->stopReportingSessionForID(100);
+    client->destroyReportingSession(100);
+    auto stopped = Clock::now();
+    for (int second : {1, 5, 15}) {
+        std::this_thread::sleep_until(stopped + std::chrono::seconds(second));
+        std::printf("memory: %2d s after the stop: RSS %ld KiB\n", second, memoryKiB(daemon, "VmRSS"));
+    }
 }
 
 void print(const char* name, const Figures& figures)
@@ -184,8 +256,12 @@ int main(int argc, char** argv)
             options.inFlight = std::stoi(argv[i + 1]);
         else if (option == "--seconds")
             options.seconds = std::stod(argv[i + 1]);
+        else if (option == "--memory-reports")
+            options.memoryReports = std::stoi(argv[i + 1]);
         else {
-            std::fprintf(stderr, "usage: mxreporting_load [--connections N] [--in-flight K] [--seconds S]\n");
+            std::fprintf(stderr,
+                         "usage: mxreporting_load [--connections N] [--in-flight K] [--seconds S] "
+                         "[--memory-reports N]\n");
             return 64;
         }
     }
@@ -216,6 +292,9 @@ int main(int argc, char** argv)
         return 1;
     }
 
+    // First, while the daemon has allocated nothing else.
+    if (options.memoryReports > 0)
+        measureMemory(daemonSocket, daemon, options.memoryReports);
     std::printf("%d connections x %d in flight, %.0f s each, 7-key reports (sendMessage to one started session)\n",
                 options.connections, options.inFlight, options.seconds);
     Figures ceiling = drive(echoSocket, options, false);
@@ -224,7 +303,7 @@ int main(int argc, char** argv)
     print("daemon", daemonFigures);
     std::printf("daemon/echo: throughput %.2f, p99 %.2f; daemon peak memory %ld KiB\n",
                 daemonFigures.reportsPerSecond / ceiling.reportsPerSecond,
-                daemonFigures.p99Microseconds / ceiling.p99Microseconds, peakMemoryKiB(daemon));
+                daemonFigures.p99Microseconds / ceiling.p99Microseconds, memoryKiB(daemon, "VmHWM"));
 
     ::kill(echo, SIGKILL);
     ::kill(daemon, SIGTERM);

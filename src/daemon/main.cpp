@@ -40,6 +40,15 @@
 
 using namespace mx;
 
+#ifdef MXREPORTING_WITH_JEMALLOC
+// The allocator gives memory back to the system by itself, a few seconds after it is
+// freed: a daemon idle after a busy session would otherwise keep its peak for good.
+extern "C" {
+// NOLINTNEXTLINE(bugprone-reserved-identifier, cppcoreguidelines-avoid-non-const-global-variables)
+const char* malloc_conf = "background_thread:true,dirty_decay_ms:5000,muzzy_decay_ms:5000";
+}
+#endif
+
 namespace {
 
 constexpr const char* kDescription = "mxreportingd: the Harmonia audio reporting daemon";

@@ -1,5 +1,7 @@
 #include "wire/MsgpackValue.h"
 
+#include <fmt/format.h>
+
 #include <cstring>
 
 namespace mx {
@@ -44,10 +46,11 @@ std::optional<Date> decodeTimestamp(const msgpack::object_ext& ext)
     return Date(std::chrono::seconds(seconds) + std::chrono::nanoseconds(nanoseconds));
 }
 
-std::optional<Value> decode(const msgpack::object& object, std::size_t depth, std::string& reason)
+std::optional<Value> decode(const msgpack::object& object, std::size_t depth, std::size_t maximumDepth,
+                            std::string& reason)
 {
-    if (depth > kMsgpackMaximumDepth) {
-        reason = "nesting deeper than 64";
+    if (depth > maximumDepth) {
+        reason = fmt::format("nesting deeper than {}", maximumDepth);
         return std::nullopt;
     }
     switch (object.type) {
@@ -85,7 +88,7 @@ std::optional<Value> decode(const msgpack::object& object, std::size_t depth, st
         std::vector<Value> items;
         items.reserve(object.via.array.size);
         for (std::uint32_t i = 0; i < object.via.array.size; ++i) {
-            auto item = decode(object.via.array.ptr[i], depth + 1, reason);
+            auto item = decode(object.via.array.ptr[i], depth + 1, maximumDepth, reason);
             if (!item)
                 return std::nullopt;
             items.push_back(std::move(*item));
@@ -100,7 +103,7 @@ std::optional<Value> decode(const msgpack::object& object, std::size_t depth, st
                 reason = "map key is not a string";
                 return std::nullopt;
             }
-            auto item = decode(entry.val, depth + 1, reason);
+            auto item = decode(entry.val, depth + 1, maximumDepth, reason);
             if (!item)
                 return std::nullopt;
             dictionary.set(std::string(entry.key.via.str.ptr, entry.key.via.str.size), std::move(*item));
@@ -137,9 +140,9 @@ void encodeDate(msgpack::packer<msgpack::sbuffer>& packer, Date date)
 
 } // namespace
 
-std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& reason)
+std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& reason, std::size_t maximumDepth)
 {
-    return decode(object, 1, reason);
+    return decode(object, 1, maximumDepth, reason);
 }
 
 void encodeMsgpack(msgpack::packer<msgpack::sbuffer>& packer, const Value& value)

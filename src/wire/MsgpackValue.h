@@ -16,8 +16,9 @@ inline constexpr std::size_t kMsgpackMaximumDepth = 64;
 
 // Nothing, with `reason` set, when the object holds what a Value cannot: a map key
 // that is not a string, an extension other than the timestamp, or nesting deeper
-// than kMsgpackMaximumDepth.
-std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& reason);
+// than `maximumDepth`.
+std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& reason,
+                                   std::size_t maximumDepth = kMsgpackMaximumDepth);
 
 void encodeMsgpack(msgpack::packer<msgpack::sbuffer>& packer, const Value& value);
 

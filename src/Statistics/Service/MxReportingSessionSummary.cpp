@@ -63,7 +63,7 @@ std::optional<Dictionary> MxReportingSessionSummary::createSummaryEvent(const Mx
     if (!aggregated)
         return std::nullopt;
     std::lock_guard lock(aggregated->monitor());
-    if (aggregated->items().empty())
+    if (aggregated->empty())
         return std::nullopt;
 
     // Keys keep the order of their first appearance; values keep message order.
@@ -80,10 +80,11 @@ std::optional<Dictionary> MxReportingSessionSummary::createSummaryEvent(const Mx
         joined += text;
     };
     collect("Mx_Session_Summary_Event", std::to_string(serviceType));
-    for (const auto& payload : aggregated->items())
+    aggregated->forEach([&](const Value& payload) {
         if (const Dictionary* entries = payload.asDictionary())
             for (const auto& [key, value] : *entries)
                 collect(key, value.description());
+    });
 
     Dictionary summary;
     for (auto& [key, joined] : collected)
@@ -126,13 +127,12 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
     std::string text;
     {
         std::lock_guard lock(nested->monitor());
-        if (nested->items().empty())
+        if (nested->empty())
             return;
         nested->insert(0, userInfo);
         try {
             nlohmann::ordered_json document = nlohmann::ordered_json::array();
-            for (const auto& item : nested->items())
-                document.push_back(toJson(item));
+            nested->forEach([&](const Value& item) { document.push_back(toJson(item)); });
             text = document.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
         } catch (const std::exception& error) {
             MXLOG(logScope(), Error, "dataWithJSONObject: {}", error.what());
