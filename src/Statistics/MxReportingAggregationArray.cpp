@@ -1,16 +1,12 @@
 #include "Statistics/MxReportingAggregationArray.h"
 
 #include <algorithm>
-#include <cstring>
 
 #include "wire/MsgpackValue.h"
 
 namespace mx {
 
 namespace {
-
-constexpr std::size_t kFirstChunk = 1024;
-constexpr std::size_t kLargestChunk = 64 * 1024;
 
 // One encoding buffer per thread, kept between appends.
 msgpack::sbuffer& scratch()
@@ -20,55 +16,53 @@ msgpack::sbuffer& scratch()
     return buffer;
 }
 
-Value decode(const char* bytes, std::size_t size)
-{
-    auto handle = msgpack::unpack(bytes, size);
-    std::string reason;
-    // Entries were Values from the wire, at most a level deeper inside a message's
-    // identifier: they all decode.
-    return decodeMsgpack(handle.get(), reason, kMsgpackMaximumDepth + 1).value_or(Value());
-}
-
 } // namespace
 
-MxReportingAggregationArray::Entry MxReportingAggregationArray::store(const char* bytes, std::size_t size)
+MxReportingAggregationArray::MxReportingAggregationArray(std::shared_ptr<MxReportingEncodedArena> arena)
+    : arena_(std::move(arena))
 {
-    if (chunks_.empty() || chunks_.back().capacity - chunks_.back().used < size) {
-        // Chunks double up to the largest, so a small session holds little and a
-        // large one wastes at most part of its last chunk.
-        std::size_t capacity = chunks_.empty() ? kFirstChunk : std::min(chunks_.back().capacity * 2, kLargestChunk);
-        capacity = std::max(capacity, size);
-        chunks_.push_back({std::make_unique<char[]>(capacity), capacity, 0});
-    }
-    Chunk& chunk = chunks_.back();
-    std::memcpy(chunk.bytes.get() + chunk.used, bytes, size);
-    Entry entry{static_cast<std::uint32_t>(chunks_.size() - 1), static_cast<std::uint32_t>(chunk.used),
-                static_cast<std::uint32_t>(size)};
-    chunk.used += size;
-    return entry;
 }
 
-void MxReportingAggregationArray::append(const Value& value)
+MxReportingAggregationArray::Range MxReportingAggregationArray::store(MxReportingEncodedArena& arena,
+                                                                      const Value& value)
 {
     auto& buffer = scratch();
     msgpack::packer<msgpack::sbuffer> packer(buffer);
     encodeMsgpack(packer, value);
-    entries_.push_back(store(buffer.data(), buffer.size()));
+    return arena.store(std::string_view(buffer.data(), buffer.size()));
 }
+
+void MxReportingAggregationArray::append(const Value& value) { appendStored(store(*arena_, value)); }
 
 void MxReportingAggregationArray::insert(std::size_t index, const Value& value)
 {
+    Entry entry{{}, store(*arena_, value)};
+    entries_.insert(entries_.begin() + static_cast<std::ptrdiff_t>(std::min(index, entries_.size())), entry);
+}
+
+void MxReportingAggregationArray::appendStored(Range stored) { entries_.push_back({{}, stored}); }
+
+void MxReportingAggregationArray::appendStoredUnder(const std::string& key, Range stored)
+{
     auto& buffer = scratch();
     msgpack::packer<msgpack::sbuffer> packer(buffer);
-    encodeMsgpack(packer, value);
-    Entry entry = store(buffer.data(), buffer.size());
-    entries_.insert(entries_.begin() + static_cast<std::ptrdiff_t>(std::min(index, entries_.size())), entry);
+    packer.pack_map(1);
+    packer.pack(key);
+    entries_.push_back({arena_->store(std::string_view(buffer.data(), buffer.size())), stored});
 }
 
 void MxReportingAggregationArray::forEach(const std::function<void(const Value&)>& visit) const
 {
-    for (const auto& entry : entries_)
-        visit(decode(chunks_[entry.chunk].bytes.get() + entry.offset, entry.size));
+    std::string bytes;
+    for (const auto& entry : entries_) {
+        bytes.clear();
+        arena_->read({entry.lead, entry.body}, [&](std::string_view part) { bytes += part; });
+        auto handle = msgpack::unpack(bytes.data(), bytes.size());
+        std::string reason;
+        // Entries were Values from the wire, at most a level deeper under a message's
+        // identifier: they all decode.
+        visit(decodeMsgpack(handle.get(), reason, kMsgpackMaximumDepth + 1).value_or(Value()));
+    }
 }
 
 std::vector<Value> MxReportingAggregationArray::items() const
@@ -77,14 +71,6 @@ std::vector<Value> MxReportingAggregationArray::items() const
     values.reserve(entries_.size());
     forEach([&](const Value& value) { values.push_back(value); });
     return values;
-}
-
-std::size_t MxReportingAggregationArray::heldBytes() const
-{
-    std::size_t bytes = entries_.capacity() * sizeof(Entry) + chunks_.capacity() * sizeof(Chunk);
-    for (const auto& chunk : chunks_)
-        bytes += chunk.capacity;
-    return bytes;
 }
 
 Array MxReportingAggregationArray::snapshot() const

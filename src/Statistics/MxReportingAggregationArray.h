@@ -5,54 +5,59 @@
 // it from the session, holds that monitor.
 //
 // A busy session keeps every report of its period, and nothing reads them before the
-// stop: they are kept encoded (MessagePack, back to back in chunks that grow to
-// 64 KiB), about their size on the wire, and decoded only when read.
+// stop: entries are kept encoded in the period's arena, about their size on the
+// wire, and decoded only when read. The period's two stores share one arena, so a
+// report that both keep (the nested one under its identifier) is kept once.
 
-#include <cstdint>
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <string>
 #include <vector>
 
+#include "Statistics/MxReportingEncodedArena.h"
 #include "platform/Value.h"
 
 namespace mx {
 
 class MxReportingAggregationArray {
 public:
+    using Range = MxReportingEncodedArena::Range;
+
+    explicit MxReportingAggregationArray(
+        std::shared_ptr<MxReportingEncodedArena> arena = std::make_shared<MxReportingEncodedArena>());
+
     std::recursive_mutex& monitor() const { return monitor_; }
+    const std::shared_ptr<MxReportingEncodedArena>& arena() const { return arena_; }
+
+    // `value` encoded into `arena`, for appendStored and appendStoredUnder.
+    static Range store(MxReportingEncodedArena& arena, const Value& value);
 
     // Callers hold monitor().
     void append(const Value& value);
     void insert(std::size_t index, const Value& value);
+    // An entry already in this array's arena, as it is or as {key: entry}.
+    void appendStored(Range stored);
+    void appendStoredUnder(const std::string& key, Range stored);
     std::size_t size() const { return entries_.size(); }
     bool empty() const { return entries_.empty(); }
     // Each entry decoded in turn, in order: one at a time, however many there are.
     void forEach(const std::function<void(const Value&)>& visit) const;
     // The entries decoded, in order.
     std::vector<Value> items() const;
-    // The bytes the array holds for its entries, spare room included.
-    std::size_t heldBytes() const;
 
     // A copy taken under the monitor.
     Array snapshot() const;
 
 private:
+    // The bytes of `lead` (when it has any) then those of `body` make the entry.
     struct Entry {
-        std::uint32_t chunk;
-        std::uint32_t offset;
-        std::uint32_t size;
+        Range lead;
+        Range body;
     };
-    struct Chunk {
-        std::unique_ptr<char[]> bytes;
-        std::size_t capacity = 0;
-        std::size_t used = 0;
-    };
-
-    Entry store(const char* bytes, std::size_t size);
 
     mutable std::recursive_mutex monitor_;
-    std::vector<Chunk> chunks_;
+    const std::shared_ptr<MxReportingEncodedArena> arena_;
     std::vector<Entry> entries_;
 };
 

@@ -53,12 +53,9 @@ const MxLogScope* MxReportingSession::logScope()
 }
 
 MxReportingSession::MxReportingSession(ReporterID reporterID, std::vector<std::int32_t> processIdentifiers)
-    : reporterID_(reporterID),
-      processIdentifiers_(std::move(processIdentifiers)),
-      aggregatedPayloadData_(std::make_shared<MxReportingAggregationArray>()),
-      nestedAggregatedPayloadData_(std::make_shared<MxReportingAggregationArray>()),
-      uplink_(reporterID)
+    : reporterID_(reporterID), processIdentifiers_(std::move(processIdentifiers)), uplink_(reporterID)
 {
+    makePeriodStores();
     MXLOG(logScope(), Info, "created reporting session for ID: {}", reporterID_);
     MxTrace(kTraceSessionCreated);
 }
@@ -97,8 +94,7 @@ void MxReportingSession::start()
         return;
     }
     started_.store(true);
-    aggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>());
-    nestedAggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>());
+    makePeriodStores();
     MxTrace(kTraceSessionStarted);
     if (shouldReportOrientation())
         registerOrientation();
@@ -168,10 +164,7 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
     MXLOG_VERBOSE(logScope(), "sending message for session owned by {}", reporterID_);
     Dictionary cleaned = MxReportingCleanKeys(message);
     std::string identifier = messageIdForCategory(category, type);
-    Dictionary nested;
-    nested.set(std::move(identifier), cleaned);
-    appendAggregated(aggregatedPayloadData_, cleaned);
-    appendAggregated(nestedAggregatedPayloadData_, std::move(nested));
+    aggregate(identifier, cleaned);
     MxTrace(kTraceMessageQueued);
 
     // Whether the message goes in-session or alone is decided now, not at delivery.
@@ -229,7 +222,7 @@ void MxReportingSession::recordOrientation(std::string_view mode, int orientatio
     Dictionary record;
     record.set(fmt::format("{}_orientation", mode), std::move(text));
     record.set(fmt::format("{}_orientation_time", mode), seconds);
-    appendAggregated(aggregatedPayloadData_, std::move(record));
+    appendAggregated(aggregatedPayloadData_, [&](MxReportingAggregationArray& array) { array.append(record); });
 }
 
 std::optional<Dictionary> MxReportingSession::createSummaryEventForSession()
@@ -249,7 +242,28 @@ std::string MxReportingSession::summaryFileName(std::time_t now) const
     return MxReportingSessionSummary::summaryFileName(now, userInfo_->snapshot(), serviceType());
 }
 
-void MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArray>& field, Value value)
+void MxReportingSession::makePeriodStores()
+{
+    auto arena = std::make_shared<MxReportingEncodedArena>();
+    aggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>(arena));
+    nestedAggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>(arena));
+}
+
+void MxReportingSession::aggregate(const std::string& identifier, const Dictionary& cleaned)
+{
+    // Both stores change only here and at start and stop, all on the server queue:
+    // the arena read now is the one both stores of the period share.
+    auto current = aggregatedPayloadData();
+    if (!current)
+        return;
+    auto payload = MxReportingAggregationArray::store(*current->arena(), cleaned);
+    appendAggregated(aggregatedPayloadData_, [&](MxReportingAggregationArray& array) { array.appendStored(payload); });
+    appendAggregated(nestedAggregatedPayloadData_,
+                     [&](MxReportingAggregationArray& array) { array.appendStoredUnder(identifier, payload); });
+}
+
+void MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArray>& field,
+                                          const std::function<void(MxReportingAggregationArray&)>& append)
 {
     // The field is read again under the array's monitor: an append races a stop (or a
     // restart) either into the live array or into nothing, never into a dropped one.
@@ -260,7 +274,7 @@ void MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArra
         std::lock_guard lock(array->monitor());
         auto current = field.get();
         if (current == array) {
-            array->append(std::move(value));
+            append(*array);
             return;
         }
     }

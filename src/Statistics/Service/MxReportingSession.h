@@ -114,7 +114,12 @@ private:
     void unregisterOrientation();
     // `mode` is "device" or "ui"; runs on a thread of the orientation service.
     void recordOrientation(std::string_view mode, int orientation);
-    static void appendAggregated(const MxAtomicProperty<AggregationArray>& field, Value value);
+    // New empty stores for a period, sharing one arena.
+    void makePeriodStores();
+    // Keeps a message in both stores: as it is, and under its identifier.
+    void aggregate(const std::string& identifier, const Dictionary& cleaned);
+    static void appendAggregated(const MxAtomicProperty<AggregationArray>& field,
+                                 const std::function<void(MxReportingAggregationArray&)>& append);
     static void dropAggregated(MxAtomicProperty<AggregationArray>& field);
 
     std::atomic<bool> started_{false};
