@@ -387,6 +387,31 @@ public:
     void write(const MxLogRecord&) override {}
 };
 
+// The summary event of the demo's session, as its summary file ends: on an internal
+// build it carries the orientation changes with their times since the start.
+void showSummaryEvent()
+{
+    std::error_code error;
+    std::filesystem::path newest;
+    auto newestTime = std::filesystem::file_time_type::min();
+    for (const auto& entry :
+         std::filesystem::directory_iterator(MxReportingPath("var/log/harmonia/reporting"), error)) {
+        if (entry.path().filename().string().find("com.example.player") != std::string::npos &&
+            entry.last_write_time() >= newestTime) {
+            newest = entry.path();
+            newestTime = entry.last_write_time();
+        }
+    }
+    auto document = nlohmann::ordered_json::parse(std::ifstream(newest), nullptr, false);
+    if (newest.empty() || !document.is_array() || document.empty()) {
+        std::printf("\n(no summary file to show in %s)\n", MxReportingPath("var/log/harmonia/reporting").c_str());
+        return;
+    }
+    std::printf("\nAn internal build: the session's summary file %s ends with its summary event,\n"
+                "orientation changes and their times since the start included:\n%s\n",
+                newest.c_str(), document.back().dump(2).c_str());
+}
+
 int demo(MxReportingClient& client)
 {
     std::mt19937_64 random{std::random_device{}()};
@@ -435,9 +460,7 @@ int demo(MxReportingClient& client)
         std::fflush(stdout);
     }
     if (JsonDeviceProperties(MxReportingPath("etc/harmonia/device.json")).boolProperty("InternalBuild"))
-        std::printf("\nAn internal build: the summary event (the last of mxreport messages) carries the\n"
-                    "orientation changes with their times since the start, and a summary file is in\n%s.\n",
-                    MxReportingPath("var/log/harmonia/reporting").c_str());
+        showSummaryEvent();
     std::printf("\nSee what the daemon stored: mxreport events, mxreport power, mxreport sessions,\n"
                 "mxreport messages (add --json for machine-readable lines).\n");
     return 0;
