@@ -105,6 +105,19 @@ TEST_F(MxReportingSessionTest, KeysAreCleanedAtTheTopLevelOnly)
     session->start();
     session->sendMessage(Dictionary{{"peak level", 3}}, 3, 1, nullptr);
     EXPECT_EQ(session->aggregatedPayloadData()->snapshot()[0], Value(Dictionary{{"peak_level", 3}}));
+
+    // Kept encoded and read back: a payload nested almost as deep as a request may be,
+    // every kind of value, and one level deeper again under its identifier.
+    Value deepest = Dictionary{{"when", Date(std::chrono::seconds(1'800'000'000))},
+                               {"raw", Data{1, 2}},
+                               {"big", std::numeric_limits<std::uint64_t>::max()},
+                               {"level", -3.5}};
+    for (int depth = 2; depth < 60; ++depth)
+        deepest = Array({deepest});
+    session->sendMessage(Dictionary{{"deep", deepest}}, 3, 1, nullptr);
+    EXPECT_EQ(session->aggregatedPayloadData()->snapshot()[1], Value(Dictionary{{"deep", deepest}}));
+    EXPECT_EQ(session->nestedAggregatedPayloadData()->snapshot()[1],
+              Value(Dictionary{{"Playback_Start_2", Dictionary{{"deep", deepest}}}}));
 }
 
 TEST_F(MxReportingSessionTest, BackendGetsSessionDescriptionAndMessagesInOrderThenTheFlush)
