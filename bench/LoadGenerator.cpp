@@ -215,7 +215,7 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
         auto payload = realisticPayload(random, seq);
         wireBytes += wireSize(payload);
         client->sendMessage(payload, 0x08000003, 1, std::vector<ReporterID>{100},
-                            [&](MxClientResult<MxSendOutcome>) { ++answered; });
+                            [&](const MxClientResult<MxSendOutcome>&) { ++answered; });
         while (seq - answered.load() > 256)
             std::this_thread::yield();
     }

@@ -8,7 +8,7 @@ namespace mx {
 namespace {
 
 constexpr std::size_t kFirstChunk = 1024;
-constexpr std::size_t kLargestChunk = 64 * 1024;
+constexpr std::size_t kLargestChunk = std::size_t{64} * 1024;
 
 } // namespace
 

@@ -33,7 +33,8 @@ ConfigFile::ConfigFile(std::filesystem::path path, std::vector<std::string>& err
 std::string ConfigFile::place(std::size_t offset) const
 {
     offset = std::min(offset, text_.size());
-    std::size_t line = 1 + static_cast<std::size_t>(std::count(text_.begin(), text_.begin() + offset, '\n'));
+    std::size_t line = 1 +
+        static_cast<std::size_t>(std::count(text_.begin(), text_.begin() + static_cast<std::ptrdiff_t>(offset), '\n'));
     std::size_t lineStart = text_.rfind('\n', offset == 0 ? 0 : offset - 1);
     std::size_t column = offset - (lineStart == std::string::npos || offset == 0 ? 0 : lineStart + 1) + 1;
     return fmt::format("{}:{}:{}", path_.string(), line, column);

@@ -2,6 +2,7 @@
 
 #include <cstring>
 #include <poll.h>
+#include <system_error>
 
 #include "platform/MxLog.h"
 
@@ -13,7 +14,7 @@ constexpr const char* kProxy = "net.hadess.SensorProxy";
 constexpr const char* kProxyPath = "/net/hadess/SensorProxy";
 constexpr const char* kProperty = "AccelerometerOrientation";
 
-std::string errorText(int failure) { return std::strerror(-failure); }
+std::string errorText(int failure) { return std::generic_category().message(-failure); }
 
 std::string errorText(const sd_bus_error* error)
 {

@@ -34,6 +34,12 @@ bool isCollectorUrl(const std::string& url)
 
 constexpr auto kSettleTimeout = std::chrono::seconds(10);
 
+constexpr const char* kSessionsTable = "CREATE TABLE IF NOT EXISTS sessions(id INTEGER PRIMARY KEY, session_info TEXT, "
+                                       "user_info TEXT, opened REAL, flushed REAL)";
+constexpr const char* kMessagesTable =
+    "CREATE TABLE IF NOT EXISTS messages(id INTEGER PRIMARY KEY, session INTEGER NULL, time REAL, category INTEGER, "
+    "type INTEGER, payload TEXT, session_info TEXT NULL, user_info TEXT NULL)";
+
 // Spool rows go oldest first, those every collector acknowledged before any other. A
 // one-shot or realtime message is acknowledged by a collector whose stream cursor
 // passed it, a batch session's message by one that exported its session.
@@ -127,10 +133,7 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
     const auto& collectors = backends.collectors;
     auto store = SqliteStore::open(
         database,
-        {"CREATE TABLE IF NOT EXISTS sessions(id INTEGER PRIMARY KEY, session_info TEXT, user_info TEXT, "
-         "opened REAL, flushed REAL)",
-         "CREATE TABLE IF NOT EXISTS messages(id INTEGER PRIMARY KEY, session INTEGER NULL, time REAL, "
-         "category INTEGER, type INTEGER, payload TEXT, session_info TEXT NULL, user_info TEXT NULL)",
+        {kSessionsTable, kMessagesTable,
          "CREATE TABLE IF NOT EXISTS exports(backend TEXT PRIMARY KEY, stream_cursor INTEGER)",
          "CREATE TABLE IF NOT EXISTS exported_sessions(backend TEXT, session INTEGER, PRIMARY KEY(backend, session))",
          // The exporters read a batch session's messages by session.
