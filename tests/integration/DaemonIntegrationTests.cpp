@@ -519,6 +519,13 @@ TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnS
     auto post = [&](const std::string& datagram) {
         ASSERT_EQ(sendUnixDatagram(daemon.path("run/harmonia/orientation.sock"), datagram), 0u);
     };
+    // The feed is read in order: once a bad datagram's line is out, all before it were handled.
+    int barrier = 0;
+    auto handled = [&] {
+        std::string mark = fmt::format("barrier {}", ++barrier);
+        post(mark);
+        ASSERT_TRUE(daemon.waitForLog(fmt::format("orientation feed: ignored \"{}\"", mark)));
+    };
     auto recorded = [&](const std::string& mode, const std::string& text, ReporterID id) {
         return daemon.waitForLog(fmt::format("mode={} orientation=\"{}\" app=\"(null)\"", mode, text)) &&
             daemon.waitForLog(fmt::format("id=\"MxReportingService {}\"", id));
@@ -533,6 +540,7 @@ TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnS
         ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{id}));
     };
     post("device 1"); // before any start: nobody hears it
+    handled();
     startAndWait(1);
     startAndWait(3);
     daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true, "DeviceClassNumber": 6})");
@@ -548,6 +556,7 @@ TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnS
     for (ReporterID id : {1, 2, 3, 4})
         ASSERT_TRUE(*client->stopReportingSessionForID(id).value);
     post("device 5"); // between periods
+    handled();
     startAndWait(1);
     post("device 6");
     EXPECT_TRUE(recorded("device", "face-down", 1));
