@@ -34,16 +34,20 @@ int verboseLevelFromEnvironment(const std::string& verboseSwitch)
     return end != value ? static_cast<int>(level) : 0;
 }
 
-// Error lines by the place that writes them: within a window, the first few pass and
-// the rest are counted; the count rides on the first line let through after it.
+// Identical error lines: within a window the first few pass and the rest are
+// counted; the count rides on the first identical line let through after it. Lines
+// that differ (another reporter, another file) are never held back by each other.
 class ErrorBursts {
 public:
     // Nothing: suppress the line. Else the number suppressed since the last one shown.
-    std::optional<std::uint64_t> admit(const char* file, int line)
+    std::optional<std::uint64_t> admit(const MxLogRecord& record)
     {
         auto now = std::chrono::steady_clock::now();
+        std::string key = record.message();
         std::lock_guard lock(mutex_);
-        auto& burst = bursts_[{file, line}];
+        if (bursts_.size() >= kMostRemembered)
+            forgetQuiet(now);
+        auto& burst = bursts_[key];
         if (now - burst.windowStart >= kWindow) {
             burst.windowStart = now;
             burst.shown = 0;
@@ -59,14 +63,24 @@ public:
 private:
     static constexpr std::chrono::seconds kWindow{10};
     static constexpr int kLinesPerWindow = 10;
+    static constexpr std::size_t kMostRemembered = 4096;
 
     struct Burst {
         std::chrono::steady_clock::time_point windowStart;
         int shown = 0;
         std::uint64_t suppressed = 0;
     };
+
+    // Lines whose window is over hold nothing worth keeping but an uncounted tail.
+    void forgetQuiet(std::chrono::steady_clock::time_point now)
+    {
+        std::erase_if(bursts_, [&](const auto& entry) { return now - entry.second.windowStart >= kWindow; });
+        if (bursts_.size() >= kMostRemembered)
+            bursts_.clear();
+    }
+
     std::mutex mutex_;
-    std::map<std::pair<std::string_view, int>, Burst> bursts_;
+    std::map<std::string, Burst> bursts_;
 };
 
 ErrorBursts& errorBursts()
@@ -125,7 +139,7 @@ void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int
 {
     MxLogRecord record{scope, level, file, line, std::string(MxLogFunctionName(signature)), std::string(text)};
     if (level == MxLogLevel::Error) {
-        auto suppressed = errorBursts().admit(file, line);
+        auto suppressed = errorBursts().admit(record);
         if (!suppressed)
             return;
         if (*suppressed > 0)

@@ -3,7 +3,7 @@
 // registered scope (or the default log) to the one installed MxLogSink: journald
 // under systemd, stderr otherwise, a capturing sink in tests. A line is the service's
 // text led by the "file:line:function: " of the code that wrote it; the journal keeps
-// the location in fields of its own. An error line repeated from one place in a burst
+// the location in fields of its own. An error line repeated word for word in a burst
 // is let through a few times, then counted until the burst is over.
 
 #include <cstdint>
