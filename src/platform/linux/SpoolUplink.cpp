@@ -163,9 +163,9 @@ SpoolUplink::~SpoolUplink() = default;
 void SpoolUplink::reconfigure(const Backends& backends, const StoreLimit& limit)
 {
     store_->setRetention(spoolRetention(limit, backends.collectors));
+    auto current = exporters();
     std::vector<std::shared_ptr<OtlpHttpExporter>> kept;
     for (const auto& url : backends.collectors) {
-        auto current = exporters();
         auto found =
             std::find_if(current.begin(), current.end(), [&](const auto& exporter) { return exporter->url() == url; });
         kept.push_back(found != current.end() ? *found : std::make_shared<OtlpHttpExporter>(store_->path(), url));
