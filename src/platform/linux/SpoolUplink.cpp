@@ -163,17 +163,22 @@ SpoolUplink::~SpoolUplink() = default;
 void SpoolUplink::reconfigure(const Backends& backends, const StoreLimit& limit)
 {
     store_->setRetention(spoolRetention(limit, backends.collectors));
-    auto current = exporters();
-    std::vector<std::shared_ptr<OtlpHttpExporter>> kept;
-    for (const auto& url : backends.collectors) {
-        auto found =
-            std::find_if(current.begin(), current.end(), [&](const auto& exporter) { return exporter->url() == url; });
-        kept.push_back(found != current.end() ? *found : std::make_shared<OtlpHttpExporter>(store_->path(), url));
-    }
     spoolListed_.store(backends.spool);
-    std::lock_guard lock(exportersMutex_);
-    // A collector no longer listed stops once the last backend thread using it lets go.
-    exporters_.swap(kept);
+    std::vector<std::shared_ptr<OtlpHttpExporter>> replaced;
+    {
+        // One reconfiguration at a time, or two could each start an exporter for one URL.
+        std::lock_guard lock(exportersMutex_);
+        std::vector<std::shared_ptr<OtlpHttpExporter>> kept;
+        for (const auto& url : backends.collectors) {
+            auto found = std::find_if(exporters_.begin(), exporters_.end(),
+                                      [&](const auto& exporter) { return exporter->url() == url; });
+            kept.push_back(found != exporters_.end() ? *found
+                                                     : std::make_shared<OtlpHttpExporter>(store_->path(), url));
+        }
+        replaced = std::exchange(exporters_, std::move(kept));
+    }
+    // A collector no longer listed stops, out of the lock, once the last backend
+    // thread using it lets go.
 }
 
 std::vector<std::shared_ptr<OtlpHttpExporter>> SpoolUplink::exporters() const
