@@ -233,8 +233,9 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
 
     client->stopReportingSessionForID(100);
     client->destroyReportingSession(100);
+    client.reset();
     auto stopped = Clock::now();
-    for (int second : {1, 5, 15}) {
+    for (int second : {1, 5, 15, 30}) {
         std::this_thread::sleep_until(stopped + std::chrono::seconds(second));
         std::printf("memory: %2d s after the stop: RSS %ld KiB\n", second, memoryKiB(daemon, "VmRSS"));
     }
