@@ -7,6 +7,7 @@ what it could not send reaches the receiver once it is back."""
 import gzip
 import http.server
 import json
+import os
 import sys
 import threading
 
@@ -125,6 +126,12 @@ def main():
               wait_for(lambda: "(retry after 1 s)" in daemon.log()))
         check("and the message arrives after it",
               wait_for(lambda: any("patient" in json.dumps(b) for b in receiver.bodies()), 30))
+
+        for suffix in ["", "-wal", "-shm"]:
+            os.remove(daemon.path("var/lib/harmonia/uplink.db" + suffix))
+        client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"after": True}, 1, 0, None)
+        check("a spool made anew is exported from",
+              wait_for(lambda: any("after" in json.dumps(b) for b in receiver.bodies()), 30))
     finally:
         daemon.close(checks.failed)
     return checks.summary()

@@ -9,6 +9,7 @@
 #include <nlohmann/json.hpp>
 #include <pthread.h>
 #include <sqlite3.h>
+#include <sys/stat.h>
 #include <zlib.h>
 
 #include "platform/MxLog.h"
@@ -237,21 +238,40 @@ std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string&
     return std::nullopt;
 }
 
+bool OtlpHttpExporter::openSpool()
+{
+    struct stat file {};
+    bool present = ::stat(spool_.c_str(), &file) == 0;
+    if (database_ && present && file.st_dev == spoolDevice_ && file.st_ino == spoolInode_)
+        return true;
+    if (database_) {
+        // The store set the file aside or made it anew: the rows to export are there now.
+        MXLOG(nullptr, Default, "otlp exporter to {}: {} was made anew, reading the new one", url_, spool_.string());
+        sqlite3_close(database_);
+        database_ = nullptr;
+    }
+    // The spool makes the file and the exports tables; until it has, there is nothing to read.
+    if (!present || sqlite3_open_v2(spool_.c_str(), &database_, SQLITE_OPEN_READWRITE, nullptr) != SQLITE_OK) {
+        sqlite3_close(database_);
+        database_ = nullptr;
+        return false;
+    }
+    sqlite3_busy_timeout(database_, 5000);
+    spoolDevice_ = file.st_dev;
+    spoolInode_ = file.st_ino;
+    return true;
+}
+
 void OtlpHttpExporter::run()
 {
-    if (sqlite3_open_v2(spool_.c_str(), &database_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) != SQLITE_OK) {
-        MXLOG(nullptr, Error, "otlp exporter cannot open {}: {}", spool_.string(), sqlite3_errmsg(database_));
-        return;
-    }
-    // The spool made the exports tables before any exporter started.
-    sqlite3_busy_timeout(database_, 5000);
     // One handle for the thread's life keeps the collector's connection open.
     handle_ = curl_easy_init();
 
     auto backoff = kFirstBackoff;
     for (;;) {
         std::size_t exported = 0;
-        auto failure = exportBatch(exported);
+        auto failure = openSpool() ? exportBatch(exported)
+                                   : std::optional<UplinkError>(UplinkError{-1, spool_.string() + " cannot be read"});
         std::chrono::milliseconds pause = kIdlePoll;
         {
             std::lock_guard lock(mutex_);
@@ -288,7 +308,7 @@ void OtlpHttpExporter::run()
 void OtlpHttpExporter::measureLag()
 {
     auto now = std::chrono::steady_clock::now();
-    if (now - lagMeasured_ < kLagInterval)
+    if (!database_ || now - lagMeasured_ < kLagInterval)
         return;
     lagMeasured_ = now;
     std::int64_t count = 0;

@@ -4,7 +4,8 @@
 // spooled, a batch session's messages once the session is flushed. What the
 // collector has not acknowledged stays in the spool and is sent again, with
 // exponential backoff that honours Retry-After, so a collector that is down loses
-// nothing. One thread per exporter; it reads the spool on a connection of its own.
+// nothing. One thread per exporter; it reads the spool on a connection of its own,
+// opened again whenever the store makes the spool anew.
 
 #include <atomic>
 #include <chrono>
@@ -15,6 +16,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <sys/types.h>
 #include <thread>
 
 #include "platform/Uplink.h"
@@ -50,6 +52,8 @@ private:
     void run();
     // One batch; the number of messages acknowledged, or the error.
     std::optional<UplinkError> exportBatch(std::size_t& exported);
+    // The spool's file opened, again if the store made it anew; false while it cannot be.
+    bool openSpool();
     void measureLag();
     // `status` is the HTTP status, 0 when no response came at all.
     std::optional<UplinkError> post(void* curl, const std::string& body, std::chrono::seconds& retryAfter,
@@ -57,7 +61,9 @@ private:
 
     std::filesystem::path spool_;
     std::string url_;
-    sqlite3* database_ = nullptr;
+    sqlite3* database_ = nullptr; // exporter thread only, as are the two below
+    dev_t spoolDevice_ = 0;
+    ino_t spoolInode_ = 0;
     void* handle_ = nullptr;                              // the exporter thread's curl handle
     std::chrono::seconds retryAfter_{0};                  // exporter thread only
     std::chrono::steady_clock::time_point lagMeasured_{}; // exporter thread only
