@@ -105,6 +105,12 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
             return fail(std::string(sqlite3_errmsg(connection.database)) + " in: " + sql);
         connection.statements.push_back(statement);
     }
+    // Asked after every batch of a store with a size bound: prepared once.
+    if (sqlite3_prepare_v3(connection.database,
+                           "SELECT max(0, page_count - freelist_count) * page_size "
+                           "FROM pragma_page_count(), pragma_freelist_count(), pragma_page_size()",
+                           -1, SQLITE_PREPARE_PERSISTENT, &connection.dataSize, nullptr) != SQLITE_OK)
+        return fail(std::string(sqlite3_errmsg(connection.database)) + " in the size query");
     struct stat status {};
     if (::stat(path.c_str(), &status) != 0)
         return fail("vanished as it was opened");
@@ -118,6 +124,8 @@ void SqliteStore::disconnect(Connection& connection)
     for (auto* statement : connection.statements)
         sqlite3_finalize(statement);
     connection.statements.clear();
+    sqlite3_finalize(connection.dataSize);
+    connection.dataSize = nullptr;
     sqlite3_close(connection.database);
     connection.database = nullptr;
 }
@@ -202,17 +210,11 @@ void SqliteStore::run()
 
 std::uint64_t SqliteStore::dataBytes()
 {
-    auto pragma = [&](const char* sql) {
-        sqlite3_stmt* statement = nullptr;
-        std::int64_t value = 0;
-        if (sqlite3_prepare_v2(connection_.database, sql, -1, &statement, nullptr) == SQLITE_OK &&
-            sqlite3_step(statement) == SQLITE_ROW)
-            value = sqlite3_column_int64(statement, 0);
-        sqlite3_finalize(statement);
-        return value;
-    };
-    std::int64_t used = pragma("PRAGMA page_count") - pragma("PRAGMA freelist_count");
-    return static_cast<std::uint64_t>(std::max<std::int64_t>(0, used) * pragma("PRAGMA page_size"));
+    std::int64_t bytes = 0;
+    if (sqlite3_step(connection_.dataSize) == SQLITE_ROW)
+        bytes = sqlite3_column_int64(connection_.dataSize, 0);
+    sqlite3_reset(connection_.dataSize);
+    return static_cast<std::uint64_t>(bytes);
 }
 
 // Rows removed by one step in one transaction, or -1 when it failed.

@@ -112,6 +112,7 @@ private:
     struct Connection {
         sqlite3* database = nullptr;
         std::vector<sqlite3_stmt*> statements;
+        sqlite3_stmt* dataSize = nullptr; // the bytes the rows take
         dev_t device = 0;
         ino_t inode = 0;
     };
