@@ -37,13 +37,4 @@ void MxReportingEncodedArena::read(const std::vector<Range>& ranges,
         read(std::string_view(chunks_[range.chunk].bytes.get() + range.offset, range.size));
 }
 
-std::size_t MxReportingEncodedArena::heldBytes() const
-{
-    std::lock_guard lock(mutex_);
-    std::size_t bytes = chunks_.capacity() * sizeof(Chunk);
-    for (const auto& chunk : chunks_)
-        bytes += chunk.capacity;
-    return bytes;
-}
-
 } // namespace mx

@@ -24,8 +24,6 @@ public:
     Range store(std::string_view bytes);
     // `read` gets the bytes of each range in turn, under the arena's lock.
     void read(const std::vector<Range>& ranges, const std::function<void(std::string_view)>& read) const;
-    // The bytes the arena holds, spare room included.
-    std::size_t heldBytes() const;
 
 private:
     struct Chunk {

@@ -22,6 +22,20 @@ std::string errorText(const sd_bus_error* error)
         (error && error->message ? error->message : "");
 }
 
+// The feed's value of a proxy orientation text ("left-up" is 3, landscape-left).
+int orientationOfProxyText(std::string_view text)
+{
+    if (text == "normal")
+        return 1;
+    if (text == "bottom-up")
+        return 2;
+    if (text == "left-up")
+        return 3;
+    if (text == "right-up")
+        return 4;
+    return 0;
+}
+
 } // namespace
 
 SensorProxyListener::SensorProxyListener(asio::io_context& io, std::function<void(int)> changed)
@@ -35,19 +49,6 @@ SensorProxyListener::~SensorProxyListener()
         descriptor_.release();
     if (bus_)
         sd_bus_flush_close_unref(bus_);
-}
-
-int SensorProxyListener::orientationOfProxyText(std::string_view text)
-{
-    if (text == "normal")
-        return 1;
-    if (text == "bottom-up")
-        return 2;
-    if (text == "left-up")
-        return 3;
-    if (text == "right-up")
-        return 4;
-    return 0;
 }
 
 bool SensorProxyListener::connect()

@@ -35,9 +35,6 @@ public:
     // Whether the accelerometer should be claimed.
     void setWanted(bool wanted);
 
-    // The feed's value of a proxy orientation text ("left-up" is 3, landscape-left).
-    static int orientationOfProxyText(std::string_view text);
-
 private:
     static int onPropertiesChanged(sd_bus_message* message, void* self, sd_bus_error* error);
     static int onOwnerChanged(sd_bus_message* message, void* self, sd_bus_error* error);

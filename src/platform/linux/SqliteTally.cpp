@@ -49,26 +49,21 @@ std::unique_ptr<SqliteTally> SqliteTally::open(const std::filesystem::path& data
 }
 
 SqliteTally::SqliteTally(std::unique_ptr<SqliteStore> store, std::vector<std::string> disabled)
-    : store_(std::move(store)), disabled_(std::make_shared<const std::vector<std::string>>(std::move(disabled)))
+    : store_(std::move(store)), disabled_(std::move(disabled))
 {
 }
 
 void SqliteTally::reconfigure(std::vector<std::string> disabled, const StoreLimit& limit)
 {
     store_->setRetention(eventsRetention(limit));
-    auto replacement = std::make_shared<const std::vector<std::string>>(std::move(disabled));
     std::lock_guard lock(disabledMutex_);
-    disabled_.swap(replacement);
+    disabled_.swap(disabled);
 }
 
 bool SqliteTally::wanted(std::string_view name) const
 {
-    std::shared_ptr<const std::vector<std::string>> disabled;
-    {
-        std::lock_guard lock(disabledMutex_);
-        disabled = disabled_;
-    }
-    for (const auto& prefix : *disabled)
+    std::lock_guard lock(disabledMutex_);
+    for (const auto& prefix : disabled_)
         if (name.starts_with(prefix))
             return false;
     return true;

@@ -39,7 +39,7 @@ private:
 
     std::unique_ptr<SqliteStore> store_;
     mutable std::mutex disabledMutex_;
-    std::shared_ptr<const std::vector<std::string>> disabled_;
+    std::vector<std::string> disabled_;
 };
 
 } // namespace mx
