@@ -173,20 +173,20 @@ int run(int argc, char** argv)
     auto configuration = DaemonConfiguration::read(errors);
     if (!configuration)
         fail(joined(errors));
-    const StoreLimits* limits = &configuration->limits;
-    MxReportingSessionSummary::setRetention(limits->summaries.maxFiles, limits->summaries.maxBytes);
+    const StoreLimits& limits = configuration->limits;
+    MxReportingSessionSummary::setRetention(limits.summaries.maxFiles, limits.summaries.maxBytes);
     auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"), configuration->disabledEvents,
-                                   limits->tally, error);
+                                   limits.tally, error);
     if (!tally)
         fail(error);
     ProcessWide<Tally>::install(tally.get());
-    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), limits->joule, error);
+    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), limits.joule, error);
     if (!joule)
         fail(error);
     ProcessWide<Joule>::install(joule.get());
     curl_global_init(CURL_GLOBAL_DEFAULT);
-    auto uplink = SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), configuration->backends,
-                                    limits->uplink, error);
+    auto uplink =
+        SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), configuration->backends, limits.uplink, error);
     if (!uplink)
         fail(error);
     ProcessWide<Uplink>::install(uplink.get());
