@@ -1,5 +1,6 @@
 #include "daemon/DaemonHeartbeat.h"
 
+#include <asio/post.hpp>
 #include <systemd/sd-daemon.h>
 
 #include "Statistics/Service/MxReportingMetrics.h"
@@ -8,12 +9,22 @@ namespace mx {
 
 DaemonHeartbeat::DaemonHeartbeat(asio::io_context& io, std::shared_ptr<WorkQueue> serverQueue,
                                  MxReportingStatus& status)
-    : timer_(io), serverQueue_(std::move(serverQueue)), status_(status)
+    : strand_(asio::make_strand(io)), timer_(strand_), serverQueue_(std::move(serverQueue)), status_(status)
 {
     std::uint64_t watchdog = 0;
     if (sd_watchdog_enabled(0, &watchdog) > 0)
         interval_ = std::min(
             interval_, std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::microseconds(watchdog / 2)));
+}
+
+void DaemonHeartbeat::start()
+{
+    asio::post(strand_, [this] { beat(); });
+}
+
+void DaemonHeartbeat::stop()
+{
+    asio::post(strand_, [this] { timer_.cancel(); });
 }
 
 void DaemonHeartbeat::beat()

@@ -1,6 +1,7 @@
 // mxreportingd: installs the Linux platform services, creates the service root and
-// hands it the listener; from then on the process lives on the connection thread,
-// the server queue and the session queues. It ends when the platform ends it
+// hands it the listener; from then on the process lives on its queues: the server
+// queue's thread also reads and writes the connections, and the sessions' queues
+// and the stores' writers have threads of their own. It ends when the platform ends it
 // (SIGTERM: the stores commit what they were handed first) or when a client calls
 // killService (status 2).
 
@@ -197,20 +198,21 @@ int run(int argc, char** argv)
 
     FileChanstat chanstat(MxReportingPath("run/harmonia/chanstat"));
     auto root = MxReportingServiceDelegate::make(preferences, notifications, processTable, chanstat);
-    auto listener = MsgpackRpcListener::make(MxReportingPath("run/harmonia/reporting.sock"), error);
+    auto listener =
+        MsgpackRpcListener::make(MxReportingPath("run/harmonia/reporting.sock"), dispatch.interactiveContext(), error);
     if (!listener)
         fail(error);
-    if (!notifications.listen(listener->ioContext(), error))
+    if (!notifications.listen(dispatch.interactiveContext(), error))
         fail(error);
 
     std::promise<int> terminated;
-    asio::signal_set reload(listener->ioContext(), SIGHUP);
+    asio::signal_set reload(dispatch.interactiveContext(), SIGHUP);
     std::function<void()> waitForReload = [&] {
         reload.async_wait([&](const std::error_code& cancelled, int) {
             if (cancelled)
                 return;
-            // Off the connection thread: a collector no longer listed may take a
-            // while to stop.
+            // Off the server queue's thread: a collector no longer listed may take
+            // a while to stop.
             dispatch.globalQueue(QueuePriority::Utility).dispatch([&] {
                 reconfigure(*tally, *joule, *uplink);
                 notifications.deliver(kMxReportingDefaultsNotification);
@@ -219,7 +221,7 @@ int run(int argc, char** argv)
         });
     };
     waitForReload();
-    asio::signal_set termination(listener->ioContext(), SIGTERM, SIGINT);
+    asio::signal_set termination(dispatch.interactiveContext(), SIGTERM, SIGINT);
     termination.async_wait([&](const std::error_code& cancelled, int signal) {
         if (!cancelled)
             terminated.set_value(signal);
@@ -231,11 +233,11 @@ int run(int argc, char** argv)
     status.addStore("uplink", [&] { return uplink->store().status(); });
     status.setExporters([&] { return uplink->exportersStatus(); });
     root->setStatusView([&status] { return status.snapshot(); });
-    DaemonHeartbeat heartbeat(listener->ioContext(), root->serverQueue(), status);
+    DaemonHeartbeat heartbeat(dispatch.interactiveContext(), root->serverQueue(), status);
 
     listener->setDelegate(root);
     listener->resume();
-    heartbeat.beat();
+    heartbeat.start();
     sd_notify(0, "READY=1");
     MXLOG(nullptr, Default, "mxreportingd {} (pid {}) listening on {}; talk to it: MXREPORTING_ROOT={} mxreport demo",
           MXREPORTING_VERSION, getpid(), listener->endpointDescription(), MxReportingRoot().string());
@@ -247,7 +249,7 @@ int run(int argc, char** argv)
     // Every request already taken runs to its end, and so does the work it queued
     // (deliveries, single messages, delayed ones at once), before the stores commit.
     listener->stopReading();
-    asio::post(listener->ioContext(), [&heartbeat] { heartbeat.stop(); });
+    heartbeat.stop();
     if (!dispatch.drain(kDrainBound))
         MXLOG(nullptr, Error, "queues still busy after {} s: committing what they handed over",
               kDrainBound.count() / 1000);

@@ -25,6 +25,10 @@ public:
     void beginBlocking() override;
     void endBlocking() override;
 
+    // The user-interactive pool's context, for I/O whose handlers should run on the
+    // thread that runs the server queue: a request then crosses no thread.
+    asio::io_context& interactiveContext() { return interactivePool_.context(); }
+
     // Runs delayed work at once and waits, at most `bound`, until no queue has work
     // left; work dispatched meanwhile is waited for too. False when work remains.
     bool drain(std::chrono::milliseconds bound) { return outstanding_.drain(bound); }

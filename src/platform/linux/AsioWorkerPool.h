@@ -25,6 +25,7 @@ public:
     AsioWorkerPool& operator=(const AsioWorkerPool&) = delete;
 
     asio::io_context::executor_type executor() { return io_.get_executor(); }
+    asio::io_context& context() { return io_; }
     bool runsCurrentThread() const { return current() == this; }
 
     void beginBlocking();

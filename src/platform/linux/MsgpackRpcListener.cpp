@@ -1,7 +1,7 @@
 #include "platform/linux/MsgpackRpcListener.h"
 
 #include <future>
-#include <pthread.h>
+#include <utility>
 
 #include <asio/post.hpp>
 #include <sys/stat.h>
@@ -13,19 +13,15 @@
 
 namespace mx {
 
-MsgpackRpcListener::MsgpackRpcListener() : keepRunning_(io_.get_executor()), acceptor_(io_), retry_(io_) {}
-
-MsgpackRpcListener::~MsgpackRpcListener()
+MsgpackRpcListener::MsgpackRpcListener(asio::io_context& io)
+    : io_(io), strand_(asio::make_strand(io)), acceptor_(strand_), retry_(strand_)
 {
-    keepRunning_.reset();
-    io_.stop();
-    if (thread_.joinable())
-        thread_.join();
 }
 
-std::unique_ptr<MsgpackRpcListener> MsgpackRpcListener::make(const std::filesystem::path& path, std::string& error)
+std::unique_ptr<MsgpackRpcListener> MsgpackRpcListener::make(const std::filesystem::path& path, asio::io_context& io,
+                                                             std::string& error)
 {
-    std::unique_ptr<MsgpackRpcListener> listener(new MsgpackRpcListener);
+    std::unique_ptr<MsgpackRpcListener> listener(new MsgpackRpcListener(io));
     std::error_code failure;
     if (sd_listen_fds(1) >= 1 && sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) > 0) {
         listener->acceptor_.assign(asio::local::stream_protocol(), SD_LISTEN_FDS_START, failure);
@@ -63,19 +59,16 @@ void MsgpackRpcListener::setDelegate(std::shared_ptr<ServiceListenerDelegate> de
 
 void MsgpackRpcListener::resume()
 {
-    if (thread_.joinable())
-        return;
-    acceptNext();
-    thread_ = std::thread([this] {
-        pthread_setname_np(pthread_self(), "mx-connections");
-        io_.run();
+    asio::post(strand_, [this] {
+        if (!std::exchange(accepting_, true))
+            acceptNext();
     });
 }
 
 void MsgpackRpcListener::stopReading()
 {
     std::promise<void> stopped;
-    asio::post(io_, [&] {
+    asio::post(strand_, [&] {
         std::error_code ignored;
         acceptor_.close(ignored);
         retry_.cancel();
@@ -89,29 +82,31 @@ void MsgpackRpcListener::stopReading()
 
 void MsgpackRpcListener::acceptNext()
 {
-    acceptor_.async_accept([this](const std::error_code& error, asio::local::stream_protocol::socket socket) {
-        if (error) {
-            if (error == asio::error::operation_aborted)
+    // Each connection's socket runs its handlers on a strand of its own.
+    acceptor_.async_accept(
+        asio::make_strand(io_), [this](const std::error_code& error, asio::local::stream_protocol::socket socket) {
+            if (error) {
+                if (error == asio::error::operation_aborted)
+                    return;
+                // Out of descriptors and the like: say so, and try again shortly rather
+                // than spin on a failing accept.
+                MXLOG(nullptr, Error, "accept failed: {}", error.message());
+                retry_.expires_after(std::chrono::milliseconds(100));
+                retry_.async_wait([this](const std::error_code& cancelled) {
+                    if (!cancelled)
+                        acceptNext();
+                });
                 return;
-            // Out of descriptors and the like: say so, and try again shortly rather
-            // than spin on a failing accept.
-            MXLOG(nullptr, Error, "accept failed: {}", error.message());
-            retry_.expires_after(std::chrono::milliseconds(100));
-            retry_.async_wait([this](const std::error_code& cancelled) {
-                if (!cancelled)
-                    acceptNext();
-            });
-            return;
-        } else {
-            auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), ++accepted_);
-            if (!delegate_ || !delegate_->shouldAcceptNewConnection(*this, connection))
-                connection.reset();
-            std::erase_if(connections_, [](const auto& known) { return known.expired(); });
-            if (connection)
-                connections_.push_back(connection);
-        }
-        acceptNext();
-    });
+            } else {
+                auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), ++accepted_);
+                if (!delegate_ || !delegate_->shouldAcceptNewConnection(*this, connection))
+                    connection.reset();
+                std::erase_if(connections_, [](const auto& known) { return known.expired(); });
+                if (connection)
+                    connections_.push_back(connection);
+            }
+            acceptNext();
+        });
 }
 
 } // namespace mx

@@ -3,13 +3,16 @@
 #include <chrono>
 #include <ctime>
 #include <pthread.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <fmt/format.h>
 #include <sqlite3.h>
 
 #include "platform/JsonValue.h"
 #include "platform/MxLog.h"
+#include "platform/WorkQueue.h"
 
 namespace mx {
 
@@ -140,6 +143,7 @@ SqliteStore::SqliteStore(std::filesystem::path path, std::vector<std::string> sc
 {
     writer_ = std::thread([this] {
         pthread_setname_np(pthread_self(), "mx-store");
+        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
         run();
     });
 }
@@ -158,7 +162,17 @@ SqliteStore::~SqliteStore()
 void SqliteStore::submit(SqliteWrite write)
 {
     std::unique_lock lock(mutex_);
-    changed_.wait(lock, [&] { return queue_.size() < kQueueBound || stopping_; });
+    if (queue_.size() >= kQueueBound && !stopping_) {
+        if (failing_ && !std::exchange(holdingCallersLogged_, true))
+            MXLOG(nullptr, Error, "{}: {} rows wait to be written: callers wait until it can write again",
+                  path_.string(), queue_.size());
+        // The wait may be long (a full disk): the caller's pool lends a thread
+        // meanwhile, so the connections it serves are still read and written.
+        std::optional<ScopedBlockingCall> blocking;
+        if (ProcessWide<Dispatch>::installed())
+            blocking.emplace();
+        changed_.wait(lock, [&] { return queue_.size() < kQueueBound || stopping_; });
+    }
     queue_.push_back(std::move(write));
     ++submitted_;
     if (writerWaiting_)
@@ -309,13 +323,18 @@ void SqliteStore::write(std::deque<SqliteWrite>& batch)
     for (;;) {
         std::string error;
         if (stillOnDisk(error) && commit(batch, error)) {
-            if (attempts > 0)
-                MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts,
-                      describe(std::chrono::steady_clock::now() - began));
+            if (attempts == 0)
+                return;
+            MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts,
+                  describe(std::chrono::steady_clock::now() - began));
+            std::lock_guard lock(mutex_);
+            failing_ = false;
+            holdingCallersLogged_ = false;
             return;
         }
         std::unique_lock lock(mutex_);
         ++failures_;
+        failing_ = true;
         if (attempts++ == 0)
             MXLOG(nullptr, Error,
                   "{}: cannot write ({}); holding {} rows and retrying, callers wait while {} more queue",

@@ -67,10 +67,17 @@ struct SqliteWrite {
 class SqliteStore {
 public:
     static constexpr std::size_t kQueueBound = 65536;
-    static constexpr std::size_t kBatchLimit = 4096;
+    // A batch stays short enough that a caller waiting on a full queue gets room back
+    // within a millisecond or two, not after a commit of thousands of rows.
+    static constexpr std::size_t kBatchLimit = 512;
     // How long the writer lets a batch gather once the first row of it arrived: a
     // thousand rows a millisecond cost one transaction and one wake-up, not a thousand.
     static constexpr std::chrono::milliseconds kBatchWindow{2};
+    // Writers yield the processor to request handling: a commit that takes the CPU
+    // a client's request wakes on delays its reply by the length of the commit.
+    // Under sustained load they still get their share, and the bounded queue
+    // slows requests down to the rate they commit at.
+    static constexpr int kWriterNiceness = 10;
     // Retries of a failing batch start this soon and slow down to the longest.
     static constexpr std::chrono::milliseconds kFirstRetry{100};
     static constexpr std::chrono::milliseconds kLongestRetry{5000};
@@ -145,6 +152,8 @@ private:
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
     std::uint64_t failures_ = 0;
+    bool failing_ = false;              // from a failed write until one succeeds
+    bool holdingCallersLogged_ = false; // once per failing spell
     bool stopping_ = false;
     bool writerWaiting_ = false;
     std::thread writer_;
