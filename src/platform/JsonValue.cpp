@@ -80,22 +80,27 @@ void appendJsonScalar(std::string& out, const Value& value)
     case Value::Kind::Bool:
         out += *value.asBool() ? "true" : "false";
         break;
-    case Value::Kind::Int:
-        fmt::format_to(std::back_inserter(out), "{}", *value.asInt());
+    case Value::Kind::Int: {
+        fmt::format_int text(*value.asInt());
+        out.append(text.data(), text.size());
         break;
-    case Value::Kind::UInt:
-        fmt::format_to(std::back_inserter(out), "{}", *value.asUInt());
+    }
+    case Value::Kind::UInt: {
+        fmt::format_int text(*value.asUInt());
+        out.append(text.data(), text.size());
         break;
+    }
     case Value::Kind::Double: {
         double number = *value.asDouble();
         if (!std::isfinite(number)) {
             out += "null";
             break;
         }
-        std::size_t start = out.size();
-        fmt::format_to(std::back_inserter(out), "{}", number);
+        char text[32];
+        std::string_view written(text, static_cast<std::size_t>(fmt::format_to(text, "{}", number) - text));
+        out += written;
         // A whole number stays recognisably a float, as JSON writers print it.
-        if (out.find_first_of(".eE", start) == std::string::npos)
+        if (written.find_first_of(".eE") == std::string_view::npos)
             out += ".0";
         break;
     }
@@ -154,9 +159,11 @@ Value fromAnyJson(const Json& json)
 std::string toJsonText(const Value& value)
 {
     std::string out;
-    appendNested(out, value, appendJsonScalar);
+    appendJsonText(out, value);
     return out;
 }
+
+void appendJsonText(std::string& out, const Value& value) { appendNested(out, value, appendJsonScalar); }
 
 Value fromJson(const nlohmann::ordered_json& json) { return fromAnyJson(json); }
 Value fromJson(const nlohmann::json& json) { return fromAnyJson(json); }

@@ -20,5 +20,7 @@ std::string base64Encode(const Data& data);
 // without building the tree first: the stores write one of these per row. Invalid
 // UTF-8 in strings becomes U+FFFD so the text always parses.
 std::string toJsonText(const Value& value);
+// The same, appended to `out`: a writer reuses one buffer for every row.
+void appendJsonText(std::string& out, const Value& value);
 
 } // namespace mx

@@ -52,6 +52,11 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
                                                const std::vector<std::string>& statements, SqliteRetention retention,
                                                std::string& error)
 {
+    // SQLite counts every allocation under a process-wide mutex unless told not
+    // to, and three writers allocating for every row contend on it. Too late once
+    // another part of the process set SQLite up, which only costs the counting.
+    static const bool configured = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0) == SQLITE_OK;
+    (void)configured;
     Connection connection;
     int code = SQLITE_OK;
     if (!connect(path, schema, statements, connection, error, code)) {
@@ -392,6 +397,8 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
         return failed("begin");
     for (auto& write : batch) {
         sqlite3_stmt* statement = connection_.statements[write.statement];
+        if (texts_.size() < write.parameters.size())
+            texts_.resize(write.parameters.size());
         for (std::size_t i = 0; i < write.parameters.size(); ++i) {
             int index = static_cast<int>(i) + 1;
             std::visit(
@@ -406,14 +413,15 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
                     else if constexpr (std::is_same_v<T, std::string>)
                         sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()),
                                           SQLITE_STATIC);
-                    else if constexpr (std::is_same_v<T, Dictionary>) {
-                        std::string text = toJsonText(value);
-                        sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()),
-                                          SQLITE_TRANSIENT);
-                    } else {
-                        std::string text = toJsonText((*value)());
-                        sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()),
-                                          SQLITE_TRANSIENT);
+                    else {
+                        // The text stays in its buffer until the row is stepped.
+                        std::string& text = texts_[i];
+                        text.clear();
+                        if constexpr (std::is_same_v<T, Dictionary>)
+                            appendJsonText(text, value);
+                        else
+                            appendJsonText(text, (*value)());
+                        sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
                     }
                 },
                 write.parameters[i]);

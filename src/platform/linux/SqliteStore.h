@@ -144,6 +144,7 @@ private:
     SqliteRetention retention_; // writer thread only
     std::optional<SqliteRetention> newRetention_;
     Connection connection_;
+    std::vector<std::string> texts_; // writer thread only: each parameter's JSON text for the row at hand
     std::chrono::steady_clock::time_point lastPrune_{};
 
     std::mutex mutex_;
