@@ -16,6 +16,18 @@ msgpack::sbuffer& scratch()
     return buffer;
 }
 
+// A buffer that grew for one large value (a summary event holds a whole period) is
+// given back, not kept for the thread's life.
+constexpr std::size_t kScratchKeptBytes = std::size_t{64} << 10;
+
+MxReportingEncodedArena::Range storeScratch(MxReportingEncodedArena& arena, msgpack::sbuffer& buffer)
+{
+    auto stored = arena.store(std::string_view(buffer.data(), buffer.size()));
+    if (buffer.size() > kScratchKeptBytes)
+        buffer = msgpack::sbuffer();
+    return stored;
+}
+
 } // namespace
 
 MxReportingAggregationArray::MxReportingAggregationArray(std::shared_ptr<MxReportingEncodedArena> arena)
@@ -29,7 +41,7 @@ MxReportingAggregationArray::Range MxReportingAggregationArray::store(MxReportin
     auto& buffer = scratch();
     msgpack::packer<msgpack::sbuffer> packer(buffer);
     encodeMsgpack(packer, value);
-    return arena.store(std::string_view(buffer.data(), buffer.size()));
+    return storeScratch(arena, buffer);
 }
 
 void MxReportingAggregationArray::append(const Value& value) { appendStored(store(*arena_, value)); }
@@ -48,7 +60,7 @@ void MxReportingAggregationArray::appendStoredUnder(const std::string& key, Rang
     msgpack::packer<msgpack::sbuffer> packer(buffer);
     packer.pack_map(1);
     packer.pack(key);
-    entries_.push_back({arena_->store(std::string_view(buffer.data(), buffer.size())), stored});
+    entries_.push_back({storeScratch(*arena_, buffer), stored});
 }
 
 void MxReportingAggregationArray::forEach(const std::function<void(const Value&)>& visit) const

@@ -91,7 +91,7 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
     // The last step proves that the store can be written, not just read.
     // A new store gives pruned pages back to the file system; an older one reuses them.
     std::vector<std::string> setup = {"PRAGMA auto_vacuum=INCREMENTAL", "PRAGMA journal_mode=WAL",
-                                      "PRAGMA synchronous=NORMAL"};
+                                      "PRAGMA synchronous=NORMAL", "PRAGMA cache_size=-512"};
     setup.insert(setup.end(), schema.begin(), schema.end());
     setup.insert(setup.end(), {"BEGIN IMMEDIATE", "COMMIT"});
     for (const auto& sql : setup) {
@@ -432,6 +432,10 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
         if (stepped != SQLITE_DONE)
             return failed("insert");
     }
+    // A buffer that grew for one large row (a summary event) is given back.
+    for (auto& text : texts_)
+        if (text.capacity() > kTextKeptBytes)
+            std::string().swap(text);
     if (sqlite3_exec(database, "COMMIT", nullptr, nullptr, nullptr) != SQLITE_OK)
         return failed("commit");
     return true;

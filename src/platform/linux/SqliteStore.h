@@ -78,6 +78,9 @@ public:
     // Under sustained load they still get their share, and the bounded queue
     // slows requests down to the rate they commit at.
     static constexpr int kWriterNiceness = 10;
+    // A row's JSON text is built in a buffer kept from row to row, unless it grew
+    // past this.
+    static constexpr std::size_t kTextKeptBytes = std::size_t{64} << 10;
     // Retries of a failing batch start this soon and slow down to the longest.
     static constexpr std::chrono::milliseconds kFirstRetry{100};
     static constexpr std::chrono::milliseconds kLongestRetry{5000};
