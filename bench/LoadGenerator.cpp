@@ -2,7 +2,8 @@
 // and k report requests in flight, against the real daemon (full path through
 // sinks, session and stores), and in the same run against a bare msgpack-rpc echo
 // server on the same socket type as the ceiling. Prints reports/s, p50/p99 reply
-// latency, the daemon's peak memory and the ratios to the echo.
+// latency, each server's CPU time per report (the daemon's until its stores have
+// written everything), the daemon's peak memory and the ratios to the echo.
 //
 //   mxreporting_load [--connections N] [--in-flight K] [--seconds S] [--memory-reports N]
 // Then one session is sent N reports (200 000; 0 skips it) and keeps them: the
@@ -17,8 +18,10 @@
 #include <cstdio>
 #include <cstring>
 #include <fstream>
+#include <iterator>
 #include <mutex>
 #include <random>
+#include <sstream>
 #include <string>
 #include <sys/wait.h>
 #include <thread>
@@ -47,6 +50,8 @@ struct Figures {
     double p50Microseconds = 0;
     double p99Microseconds = 0;
     std::uint64_t errors = 0;
+    std::uint64_t answered = 0;
+    double cpuMicrosecondsPerReport = 0;
 };
 
 Dictionary realisticPayload(std::mt19937& random, int seq)
@@ -151,6 +156,7 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
     Figures figures;
     figures.reportsPerSecond = static_cast<double>(done) / elapsed;
     figures.errors = errors;
+    figures.answered = completed;
     std::lock_guard lock(latencyMutex);
     std::sort(latencies.begin(), latencies.end());
     if (!latencies.empty()) {
@@ -169,6 +175,22 @@ long memoryKiB(pid_t pid, const std::string& field)
         if (line.rfind(field + ":", 0) == 0)
             return std::stol(line.substr(field.size() + 1));
     return -1;
+}
+
+// User and system time of a process so far, from /proc/PID/stat.
+double cpuSeconds(pid_t pid)
+{
+    std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+    std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
+    // Fields after the command name, which may hold spaces: state is the 3rd field,
+    // utime the 14th and stime the 15th.
+    std::istringstream fields(text.substr(text.rfind(')') + 2));
+    std::string field;
+    double ticks = 0;
+    for (int number = 3; number <= 15 && fields >> field; ++number)
+        if (number >= 14)
+            ticks += std::stod(field);
+    return ticks / static_cast<double>(sysconf(_SC_CLK_TCK));
 }
 
 std::size_t wireSize(const Dictionary& payload)
@@ -243,8 +265,9 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
 
 void print(const char* name, const Figures& figures)
 {
-    std::printf("%-8s %12.0f reports/s   p50 %8.1f us   p99 %8.1f us   errors %llu\n", name, figures.reportsPerSecond,
-                figures.p50Microseconds, figures.p99Microseconds, static_cast<unsigned long long>(figures.errors));
+    std::printf("%-8s %12.0f reports/s   p50 %8.1f us   p99 %8.1f us   CPU %5.2f us/report   errors %llu\n", name,
+                figures.reportsPerSecond, figures.p50Microseconds, figures.p99Microseconds,
+                figures.cpuMicrosecondsPerReport, static_cast<unsigned long long>(figures.errors));
 }
 
 } // namespace
@@ -301,13 +324,25 @@ int main(int argc, char** argv)
         measureMemory(daemonSocket, daemon, options.memoryReports);
     std::printf("%d connections x %d in flight, %.0f s each, 7-key reports (sendMessage to one started session)\n",
                 options.connections, options.inFlight, options.seconds);
+    double cpuBefore = cpuSeconds(echo);
     Figures ceiling = drive(echoSocket, options, false);
+    ceiling.cpuMicrosecondsPerReport = (cpuSeconds(echo) - cpuBefore) * 1e6 / static_cast<double>(ceiling.answered);
     print("echo", ceiling);
+    cpuBefore = cpuSeconds(daemon);
     Figures daemonFigures = drive(daemonSocket, options, true);
+    {
+        std::string error;
+        auto client = MxReportingClient::connect(daemonSocket, error);
+        while (client && !storesIdle(*client))
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    daemonFigures.cpuMicrosecondsPerReport =
+        (cpuSeconds(daemon) - cpuBefore) * 1e6 / static_cast<double>(daemonFigures.answered);
     print("daemon", daemonFigures);
-    std::printf("daemon/echo: throughput %.2f, p99 %.2f; daemon peak memory %ld KiB\n",
+    std::printf("daemon/echo: throughput %.2f, p99 %.2f, CPU per report %.2f; daemon peak memory %ld KiB\n",
                 daemonFigures.reportsPerSecond / ceiling.reportsPerSecond,
-                daemonFigures.p99Microseconds / ceiling.p99Microseconds, memoryKiB(daemon, "VmHWM"));
+                daemonFigures.p99Microseconds / ceiling.p99Microseconds,
+                daemonFigures.cpuMicrosecondsPerReport / ceiling.cpuMicrosecondsPerReport, memoryKiB(daemon, "VmHWM"));
 
     ::kill(echo, SIGKILL);
     ::kill(daemon, SIGTERM);

@@ -133,8 +133,15 @@ Dictionary::Storage& Dictionary::mutableStorage()
 {
     if (!storage_)
         storage_ = std::make_shared<const Storage>();
-    else if (storage_.use_count() > 1)
-        storage_ = std::make_shared<const Storage>(*storage_);
+    else if (storage_.use_count() > 1) {
+        // A shared dictionary is most often copied to take one more entry: room for
+        // it spares moving every entry again at once.
+        auto copy = std::make_shared<Storage>();
+        copy->entries.reserve(storage_->entries.size() + 1);
+        copy->entries.insert(copy->entries.end(), storage_->entries.begin(), storage_->entries.end());
+        copy->index = storage_->index;
+        storage_ = std::move(copy);
+    }
     // The storage is only ever shared as const; being its sole owner makes writing safe.
     return const_cast<Storage&>(*storage_);
 }

@@ -167,16 +167,20 @@ SqliteStore::~SqliteStore()
 void SqliteStore::submit(SqliteWrite write)
 {
     std::unique_lock lock(mutex_);
-    if (queue_.size() >= kQueueBound && !stopping_) {
+    auto hasRoom = [&] {
+        return queue_.size() < kQueueBound || stopping_;
+    };
+    // A writer that keeps up makes room within a batch; one that cannot write (a
+    // full disk) may not for long, and then the caller's pool lends a thread
+    // meanwhile, so that the connections it serves are still read and written.
+    if (!hasRoom() && !changed_.wait_for(lock, kShortWait, hasRoom)) {
         if (failing_ && !std::exchange(holdingCallersLogged_, true))
             MXLOG(nullptr, Error, "{}: {} rows wait to be written: callers wait until it can write again",
                   path_.string(), queue_.size());
-        // The wait may be long (a full disk): the caller's pool lends a thread
-        // meanwhile, so the connections it serves are still read and written.
         std::optional<ScopedBlockingCall> blocking;
         if (ProcessWide<Dispatch>::installed())
             blocking.emplace();
-        changed_.wait(lock, [&] { return queue_.size() < kQueueBound || stopping_; });
+        changed_.wait(lock, hasRoom);
     }
     queue_.push_back(std::move(write));
     ++submitted_;

@@ -70,6 +70,8 @@ public:
     // A batch stays short enough that a caller waiting on a full queue gets room back
     // within a millisecond or two, not after a commit of thousands of rows.
     static constexpr std::size_t kBatchLimit = 512;
+    // How long a caller waits for room before its wait counts as a blocking one.
+    static constexpr std::chrono::milliseconds kShortWait{100};
     // How long the writer lets a batch gather once the first row of it arrived: a
     // thousand rows a millisecond cost one transaction and one wake-up, not a thousand.
     static constexpr std::chrono::milliseconds kBatchWindow{2};
