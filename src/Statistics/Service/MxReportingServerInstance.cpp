@@ -58,7 +58,7 @@ std::string MxReportingServerInstance::description() const
     return fmt::format("<MxReportingServerInstance pid={}>", processIdentifier_);
 }
 
-// Work posted from the connection thread holds the endpoint weakly: an endpoint that
+// Work posted from a connection holds the endpoint weakly: an endpoint that
 // is gone before its request runs leaves nothing to do, and nobody to answer.
 template <class Work>
 void MxReportingServerInstance::enqueue(Work work)

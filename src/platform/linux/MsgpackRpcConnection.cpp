@@ -1,5 +1,7 @@
 #include "platform/linux/MsgpackRpcConnection.h"
 
+#include <future>
+
 #include <poll.h>
 #include <sys/socket.h>
 
@@ -103,7 +105,15 @@ void MsgpackRpcConnection::resume()
     readMore();
 }
 
-void MsgpackRpcConnection::stopReading() { stoppedReading_ = true; }
+void MsgpackRpcConnection::stopReading()
+{
+    std::promise<void> stopped;
+    asio::post(socket_.get_executor(), [&] {
+        stoppedReading_ = true;
+        stopped.set_value();
+    });
+    stopped.get_future().wait();
+}
 
 void MsgpackRpcConnection::readMore()
 {
@@ -233,7 +243,7 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
 {
     if (closed_)
         return;
-    // Encoded on the replying thread, so the I/O thread only writes.
+    // Encoded on the replying thread, so the strand only writes.
     std::lock_guard lock(repliesMutex_);
     if (!replies_)
         replies_ = std::make_shared<msgpack::sbuffer>(kReplyBufferBytes);

@@ -3,7 +3,8 @@
 // stream socket, hands each (method name and parameters, whatever the method) to the
 // exported object, and writes the replies back in whatever order they come. Bad input closes only this connection, with
 // one log line. A client that stops reading its replies is back-pressured: its requests are not read while its unsent
-// replies exceed a bound. Lives on the connection layer's I/O thread; replies may be sent from any thread.
+// replies exceed a bound. Its socket's handlers run on a strand of its own (the socket's executor); replies may be
+// sent from any thread.
 
 #include <atomic>
 #include <chrono>
@@ -49,7 +50,7 @@ public:
     void resume() override;
 
     // Reads no further request, for good: the daemon is shutting down. What is in
-    // flight is still answered. I/O thread only.
+    // flight is still answered. Returns once that holds. Any thread but the strand's.
     void stopReading();
 
     // Any thread. Dropped when the connection is gone.
@@ -76,7 +77,7 @@ private:
     pid_t pid_ = 0;
     uid_t uid_ = 0;
 
-    // I/O thread only.
+    // The strand's only.
     MsgpackRpcDecoder decoder_;
     std::shared_ptr<ServiceExportedObject> exported_;
     std::function<void()> interruptionHandler_;
@@ -89,18 +90,18 @@ private:
     bool resumed_ = false;
     bool stoppedReading_ = false;
 
-    // Set by the I/O thread before it checks the bounds once more, read by replying
+    // Set on the strand before it checks the bounds once more, read by replying
     // threads after they lower them: one of the two always sees the other.
     std::atomic<bool> paused_{false};
-    std::shared_ptr<MsgpackRpcConnection> holdWhilePaused_; // I/O thread only
-    std::optional<asio::steady_timer> hangUpWatch_;         // I/O thread only
+    std::shared_ptr<MsgpackRpcConnection> holdWhilePaused_; // the strand's only
+    std::optional<asio::steady_timer> hangUpWatch_;         // the strand's only
     std::atomic<bool> resumePosted_{false};
     std::atomic<std::size_t> requestsInFlight_{0};
     std::atomic<std::size_t> bytesInFlight_{0};
 
     std::atomic<bool> closed_{false};
 
-    // Replies encoded on other threads gather here; one hand-over to the I/O thread
+    // Replies encoded on other threads gather here; one hand-over to the strand
     // carries all that arrived meanwhile, so a busy connection costs one wake-up
     // per batch rather than per reply.
     std::mutex repliesMutex_;

@@ -2,6 +2,7 @@
 
 #include <future>
 #include <utility>
+#include <vector>
 
 #include <asio/post.hpp>
 #include <sys/stat.h>
@@ -67,17 +68,20 @@ void MsgpackRpcListener::resume()
 
 void MsgpackRpcListener::stopReading()
 {
-    std::promise<void> stopped;
+    std::promise<std::vector<std::shared_ptr<MsgpackRpcConnection>>> accepted;
     asio::post(strand_, [&] {
         std::error_code ignored;
         acceptor_.close(ignored);
         retry_.cancel();
+        std::vector<std::shared_ptr<MsgpackRpcConnection>> live;
         for (const auto& known : connections_)
             if (auto connection = known.lock())
-                connection->stopReading();
-        stopped.set_value();
+                live.push_back(std::move(connection));
+        accepted.set_value(std::move(live));
     });
-    stopped.get_future().wait();
+    // Each on its own strand, from here: the listener's strand must not wait on another.
+    for (const auto& connection : accepted.get_future().get())
+        connection->stopReading();
 }
 
 void MsgpackRpcListener::acceptNext()
