@@ -1,6 +1,6 @@
 #pragma once
 // The ceiling for the load benchmark: a bare msgpack-rpc server on the same kind of
-// socket, with one I/O thread like the daemon's connection layer, that answers every
+// socket, with one thread like the daemon's request thread, that answers every
 // request at once with a nil result and does nothing else.
 
 #include <filesystem>
