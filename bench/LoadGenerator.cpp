@@ -216,6 +216,12 @@ bool storesIdle(MxReportingClient& client)
     return true;
 }
 
+void waitUntilStoresIdle(MxReportingClient& client)
+{
+    while (!storesIdle(client))
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+}
+
 // One started session is sent `reports` reports and keeps them all until its stop:
 // the daemon's growth per report against the report's size on the wire, and how far
 // its memory comes back once the session is gone.
@@ -226,8 +232,7 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
     client->createReportingSession(100);
     client->setServiceType(7, 100);
     client->startReportingSessionForID(100, nullptr);
-    while (!storesIdle(*client))
-        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    waitUntilStoresIdle(*client);
     long before = memoryKiB(daemon, "VmRSS");
 
     std::mt19937 random(7);
@@ -241,8 +246,9 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
         while (seq - answered.load() > 256)
             std::this_thread::yield();
     }
-    while (answered.load() < reports || !storesIdle(*client))
+    while (answered.load() < reports)
         std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    waitUntilStoresIdle(*client);
     // What the requests' handling freed goes back to the system within the
     // allocator's decay time; what is left is what the session keeps.
     std::this_thread::sleep_for(std::chrono::seconds(6));
@@ -332,9 +338,8 @@ int main(int argc, char** argv)
     Figures daemonFigures = drive(daemonSocket, options, true);
     {
         std::string error;
-        auto client = MxReportingClient::connect(daemonSocket, error);
-        while (client && !storesIdle(*client))
-            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+        if (auto client = MxReportingClient::connect(daemonSocket, error))
+            waitUntilStoresIdle(*client);
     }
     daemonFigures.cpuMicrosecondsPerReport =
         (cpuSeconds(daemon) - cpuBefore) * 1e6 / static_cast<double>(daemonFigures.answered);

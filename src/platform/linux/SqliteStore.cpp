@@ -55,8 +55,7 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
     // SQLite counts every allocation under a process-wide mutex unless told not
     // to, and three writers allocating for every row contend on it. Too late once
     // another part of the process set SQLite up, which only costs the counting.
-    static const bool configured = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0) == SQLITE_OK;
-    (void)configured;
+    [[maybe_unused]] static const int configured = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0);
     Connection connection;
     int code = SQLITE_OK;
     if (!connect(path, schema, statements, connection, error, code)) {
