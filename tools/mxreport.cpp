@@ -13,6 +13,8 @@
 #include <fstream>
 #include <future>
 #include <iostream>
+#include <map>
+#include <mutex>
 #include <random>
 #include <sstream>
 #include <string>
@@ -549,6 +551,9 @@ int stream(MxReportingClient& client, const std::vector<std::string>& words)
         }
     };
     auto throttle = throttled ? MxReportingBlockThrottle::make() : nullptr;
+    // The line each held key's latest message came from, until its delivery ends.
+    std::mutex heldMutex;
+    std::map<std::string, int> held;
     std::string line;
     for (int number = 1; std::getline(std::cin, line); ++number) {
         if (line.empty())
@@ -560,8 +565,19 @@ int stream(MxReportingClient& client, const std::vector<std::string>& words)
                 continue;
             }
             ReporterID reporter = ids && !ids->empty() ? ids->front() : 0;
-            throttle->addMessageBlock([send, message] { send(message); }, reporter, message.payload, message.category,
-                                      message.type);
+            std::string key =
+                MxReportingBlockThrottle::buildMessageKey(message.payload, reporter, message.category, message.type);
+            {
+                std::lock_guard lock(heldMutex);
+                held[key] = number;
+            }
+            throttle->addMessageBlock(
+                [send, message, key, &heldMutex, &held] {
+                    send(message);
+                    std::lock_guard lock(heldMutex);
+                    held.erase(key);
+                },
+                reporter, message.payload, message.category, message.type);
         } catch (const UsageError& usage) {
             std::fprintf(stderr, "mxreport: line %d: %s\n", number, usage.message.c_str());
             ++failures;
@@ -569,12 +585,17 @@ int stream(MxReportingClient& client, const std::vector<std::string>& words)
     }
     if (throttle) {
         throttle->waitForCompletion();
-        // The worker lets go of the throttle after its next pass.
-        throttle->setShouldKeepRunning(false);
-        std::weak_ptr<MxReportingBlockThrottle> ending = throttle;
+        // A delivery still running (a daemon slow to answer) ends before the client
+        // goes; what is still held is dropped, and said.
+        auto dropped = throttle->invalidate();
         throttle.reset();
-        for (int i = 0; i < 100 && !ending.expired(); ++i)
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        std::lock_guard lock(heldMutex);
+        for (const auto& key : dropped)
+            if (auto found = held.find(key); found != held.end()) {
+                std::fprintf(stderr, "mxreport: line %d: not delivered: still held when the wait ended\n",
+                             found->second);
+                ++failures;
+            }
     }
     return failures > 0 ? kExitRefused : 0;
 }

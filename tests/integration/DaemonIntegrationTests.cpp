@@ -688,6 +688,25 @@ TEST_F(DaemonIntegrationTest, AStreamThroughTheThrottleDeliversTheLastOfEachBurs
     EXPECT_EQ(output, "a|x|b|2|systemuptime_sec|^|reporterID|42|Undefined|Generic\n0.5\n");
 }
 
+// A daemon that does not answer keeps a delivery running past the completion wait:
+// the stream waits it out, drops what is still held, and says so.
+TEST_F(DaemonIntegrationTest, AStreamWhoseDaemonStopsAnsweringEndsWithWhatWasNotDelivered)
+{
+    std::string input = R"({"payload": {"first": 1, "_throttle_seconds": 0}, "category": 1, "type": 0})"
+                        "\n"
+                        R"({"payload": {"second": 1, "_throttle_seconds": 4}, "category": 1, "type": 0})"
+                        "\n";
+    daemon.signal(SIGSTOP);
+    std::string output;
+    int status = daemon.runToEnd({MXREPORT_PATH, "--timeout", "7", "stream", "--throttle"}, output, input);
+    daemon.signal(SIGCONT);
+    EXPECT_EQ(status, 1) << output;
+    EXPECT_THAT(output, ::testing::HasSubstr("Giving up on waiting for completion after 5 seconds"));
+    EXPECT_THAT(output, ::testing::HasSubstr("mxreport: send: no reply in time"));
+    EXPECT_THAT(output, ::testing::HasSubstr("mxreport: line 2: not delivered"));
+    EXPECT_THAT(output, ::testing::Not(::testing::HasSubstr("line 1: not delivered")));
+}
+
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();

@@ -53,14 +53,27 @@ std::shared_ptr<MxReportingBlockThrottle> MxReportingBlockThrottle::make()
 {
     std::shared_ptr<MxReportingBlockThrottle> throttle(new MxReportingBlockThrottle);
     throttle->unscheduledTimerKeys_.reserve(6);
-    // The worker holds the throttle for as long as it runs; the last one to let go
-    // may be the worker itself, so it is not joined.
-    throttle->queueThread_ = std::thread([self = throttle] { self->run(); });
-    throttle->queueThread_.detach();
+    // The worker holds the throttle for as long as it runs, and says when it has let
+    // go: the last holder may then be the worker itself or whoever invalidated it.
+    throttle->queueThread_ = std::thread([self = throttle, exit = throttle->workerExit_]() mutable {
+        self->run();
+        self.reset();
+        std::lock_guard lock(exit->mutex);
+        exit->done = true;
+        exit->changed.notify_all();
+    });
     return throttle;
 }
 
-MxReportingBlockThrottle::~MxReportingBlockThrottle() = default;
+MxReportingBlockThrottle::~MxReportingBlockThrottle()
+{
+    // Run by the worker when it held the last reference; otherwise the worker has
+    // already let go and is ending.
+    if (queueThread_.get_id() == std::this_thread::get_id())
+        queueThread_.detach();
+    else if (queueThread_.joinable())
+        queueThread_.join();
+}
 
 std::string MxReportingBlockThrottle::buildMessageKey(const Dictionary& message, ReporterID reporterID,
                                                       MessageCategory category, MessageType type)
@@ -124,6 +137,8 @@ std::shared_ptr<MxReportingBlockThrottle::TimerWrapper> MxReportingBlockThrottle
 void MxReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporterID, const Dictionary& message,
                                                MessageCategory category, MessageType type)
 {
+    if (invalidated_.load())
+        return;
     std::string key = buildMessageKey(message, reporterID, category, type);
     double delay = determineSleepTime(message);
     // The lookup and the re-arm race a firing timer: the duplicate then either
@@ -134,7 +149,7 @@ void MxReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporterI
         wrapper->block.set(std::move(block));
         // A timer already on the loop learns its new date there.
         asio::post(loop_, [self = shared_from_this(), wrapper, key] {
-            if (wrapper->placed && self->inFlight(key) == wrapper)
+            if (wrapper->placed && !self->invalidated_.load() && self->inFlight(key) == wrapper)
                 self->wait(wrapper, key);
         });
         return;
@@ -167,19 +182,81 @@ void MxReportingBlockThrottle::run()
                         place(wrapper, key);
                 unscheduledTimerKeys_.clear();
             }
-            // Returns once every timer placed has fired, moved ones at their new date.
-            loop_.restart();
-            try {
-                loop_.run();
-            } catch (const std::exception& error) {
-                MXLOG(nullptr, Error, "a held delivery failed: {}", error.what());
-            }
+            runTimerLoop();
         }
+        if (invalidated_.load())
+            break;
         MXLOG(nullptr, Debug, "sleeping in thread");
-        std::this_thread::sleep_for(kIdlePass);
+        idle();
         if (!shouldKeepRunning())
-            return;
+            break;
     }
+    if (invalidated_.load())
+        dropHeldDeliveries();
+}
+
+// Returns once every timer placed has fired, moved ones at their new date. A
+// delivery that throws ends its own firing, not the others': the loop goes on.
+void MxReportingBlockThrottle::runTimerLoop()
+{
+    loop_.restart();
+    // Checked after the restart: an invalidation's stop either came before it, and
+    // is seen here, or comes after it and ends the run.
+    if (invalidated_.load())
+        return;
+    for (;;) {
+        try {
+            loop_.run();
+            return;
+        } catch (const std::exception& error) {
+            MXLOG(nullptr, Error, "a held delivery failed: {}", error.what());
+        } catch (...) {
+            MXLOG(nullptr, Error, "a held delivery failed");
+        }
+    }
+}
+
+void MxReportingBlockThrottle::idle()
+{
+    std::unique_lock lock(idleMutex_);
+    idleWake_.wait_for(lock, kIdlePass, [&] { return invalidated_.load(); });
+}
+
+// The worker's last act after an invalidation: its timers are cancelled and their
+// waits run out on its own loop (none fires a delivery), and what was held is gone.
+void MxReportingBlockThrottle::dropHeldDeliveries()
+{
+    std::map<std::string, std::shared_ptr<TimerWrapper>> held;
+    {
+        std::lock_guard lock(timersInFlightMonitor_);
+        held.swap(timersInFlight_);
+    }
+    {
+        std::lock_guard lock(unscheduledTimerKeysMonitor_);
+        unscheduledTimerKeys_.clear();
+    }
+    for (const auto& [key, wrapper] : held) {
+        wrapper->timer->cancel();
+        dropped_.push_back(key);
+    }
+    loop_.restart();
+    loop_.run();
+}
+
+std::vector<std::string> MxReportingBlockThrottle::invalidate()
+{
+    {
+        std::lock_guard lock(idleMutex_);
+        invalidated_.store(true);
+        shouldKeepRunning_.store(false);
+    }
+    idleWake_.notify_all();
+    loop_.stop();
+    if (queueThread_.get_id() == std::this_thread::get_id())
+        return {};
+    std::unique_lock lock(workerExit_->mutex);
+    workerExit_->changed.wait(lock, [&] { return workerExit_->done; });
+    return dropped_;
 }
 
 void MxReportingBlockThrottle::place(const std::shared_ptr<TimerWrapper>& wrapper, const std::string& key)
@@ -192,8 +269,8 @@ void MxReportingBlockThrottle::wait(const std::shared_ptr<TimerWrapper>& wrapper
 {
     wrapper->timer->expires_at(wrapper->fireDate.load());
     wrapper->timer->async_wait([self = shared_from_this(), wrapper, key](const std::error_code& error) {
-        if (error)
-            return; // re-armed for a later date
+        if (error || self->invalidated_.load())
+            return; // re-armed for a later date, or dropped
         if (Clock::now() < wrapper->fireDate.load()) {
             self->wait(wrapper, key);
             return;

@@ -2,12 +2,14 @@
 // A per-key debounce for deliveries: a message's delivery is held for the message's
 // throttle time and then run on the throttle's own worker thread; a later message
 // with the same key replaces the held delivery and starts its wait again, so a burst
-// delivers its last message once. Shared: the worker thread holds it while it runs.
+// delivers its last message once. Shared: the worker thread holds it while it runs,
+// and its owner ends it with invalidate() before letting go.
 // Callers add from any thread; deliveries run one at a time on the worker, in the
 // order they fall due.
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <map>
 #include <memory>
@@ -46,6 +48,11 @@ public:
                          MessageType type);
     // Waits, at most 5 seconds, until every held delivery has run.
     void waitForCompletion();
+    // Ends the throttle: the worker stops, held deliveries are dropped unrun, and the
+    // call returns once the worker has let go of the throttle, so that nothing a
+    // delivery uses is still touched (from inside a delivery it returns at once).
+    // Later messages are dropped too. The keys whose deliveries were dropped.
+    std::vector<std::string> invalidate();
 
     bool shouldKeepRunning() const { return shouldKeepRunning_.load(); }
     void setShouldKeepRunning(bool keepRunning) { shouldKeepRunning_.store(keepRunning); }
@@ -62,20 +69,37 @@ private:
         void sleepFor(double seconds);
     };
 
+    // Set by the worker once it has let go of the throttle.
+    struct WorkerExit {
+        std::mutex mutex;
+        std::condition_variable changed;
+        bool done = false;
+    };
+
     MxReportingBlockThrottle() = default;
     void run();
+    void runTimerLoop();
+    void idle();
+    void dropHeldDeliveries();
     void place(const std::shared_ptr<TimerWrapper>& wrapper, const std::string& key);
     void wait(const std::shared_ptr<TimerWrapper>& wrapper, const std::string& key);
     void fire(const std::shared_ptr<TimerWrapper>& wrapper, const std::string& key);
     std::shared_ptr<TimerWrapper> inFlight(const std::string& key) const;
     std::size_t counts(std::size_t& unscheduled) const;
 
+    // First, so it goes last: every held delivery's timer belongs to it.
+    asio::io_context loop_; // the worker thread's timer loop
     std::atomic<bool> shouldKeepRunning_{true};
+    std::atomic<bool> invalidated_{false};
     mutable std::recursive_mutex timersInFlightMonitor_;
     std::map<std::string, std::shared_ptr<TimerWrapper>> timersInFlight_;
     mutable std::recursive_mutex unscheduledTimerKeysMonitor_;
     std::vector<std::string> unscheduledTimerKeys_;
-    asio::io_context loop_; // the worker thread's timer loop
+    // The worker's idle pass waits here, so that invalidate() need not wait it out.
+    std::mutex idleMutex_;
+    std::condition_variable idleWake_;
+    std::vector<std::string> dropped_; // written by the worker as it ends, read after
+    std::shared_ptr<WorkerExit> workerExit_ = std::make_shared<WorkerExit>();
     std::thread queueThread_;
 };
 

@@ -55,18 +55,11 @@ TEST(MxReportingBlockThrottleKeyTest, ThrottleTimesAreTheMessagesOwnWithinTheirL
 
 class MxReportingBlockThrottleTest : public ::testing::Test {
 protected:
-    // The worker lets go of the throttle after its next pass; it must be gone before
-    // the log it writes to.
+    // The throttle goes before the log its worker writes to.
     void TearDown() override
     {
-        throttle->setShouldKeepRunning(false);
-        std::weak_ptr<Throttle> ending = throttle;
+        throttle->invalidate();
         throttle.reset();
-        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-        while (!ending.expired() && std::chrono::steady_clock::now() < deadline)
-            std::this_thread::yield();
-        ASSERT_TRUE(ending.expired());
-        // Through the log's lock: its last line is then seen before the log goes.
         platform.log.clear();
     }
 
@@ -106,15 +99,17 @@ TEST_F(MxReportingBlockThrottleTest, ABurstDeliversItsLastMessageOnceAndKeysInFi
     }));
 }
 
-TEST_F(MxReportingBlockThrottleTest, ADeliveryThatThrowsStillLeavesAndLaterOnesRun)
+TEST_F(MxReportingBlockThrottleTest, ADeliveryThatThrowsLeavesAndTheOthersStillRun)
 {
     add({{"a", 1}, {"_throttle_seconds", 0}}, [] { throw std::runtime_error("delivery broke"); });
+    add({{"b", 1}, {"_throttle_seconds", 0.3}}, deliver("held beside it"));
     throttle->waitForCompletion();
     EXPECT_TRUE(platform.log.contains("a held delivery failed: delivery broke"));
+    EXPECT_FALSE(platform.log.contains("Giving up on waiting for completion after 5 seconds. timersInFlight=1"));
     add({{"a", 1}, {"_throttle_seconds", -1}}, deliver("again"));
     throttle->waitForCompletion();
     std::lock_guard lock(mutex);
-    EXPECT_THAT(delivered, ElementsAre("again"));
+    EXPECT_THAT(delivered, ElementsAre("held beside it", "again"));
 }
 
 TEST_F(MxReportingBlockThrottleTest, WaitingGivesUpAfterFiveSecondsAndTheDeliveryStillRuns)
@@ -127,6 +122,43 @@ TEST_F(MxReportingBlockThrottleTest, WaitingGivesUpAfterFiveSecondsAndTheDeliver
     throttle->waitForCompletion();
     EXPECT_EQ(platform.log.count("Giving up on waiting for completion after 5 seconds. timersInFlight=1"), 1u)
         << "the second wait saw it run";
+}
+
+TEST_F(MxReportingBlockThrottleTest, InvalidatingWaitsForTheRunningDeliveryAndDropsTheHeldOnes)
+{
+    std::promise<void> running;
+    std::promise<void> released;
+    add({{"slow", 1}, {"_throttle_seconds", 0}}, [&running, future = released.get_future().share()] {
+        running.set_value();
+        future.wait();
+    });
+    add({{"later", 1}, {"_throttle_seconds", 4}}, deliver("later"));
+    running.get_future().wait();
+    auto ended = std::async(std::launch::async, [&] { return throttle->invalidate(); });
+    EXPECT_EQ(ended.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout)
+        << "a running delivery is waited for";
+    released.set_value();
+    EXPECT_THAT(ended.get(), ElementsAre(Throttle::buildMessageKey({{"later", 1}, {"_throttle_seconds", 4}}, 7, 3, 1)));
+    add({{"after", 1}, {"_throttle_seconds", 0}}, deliver("after"));
+    EXPECT_EQ(throttle.use_count(), 1) << "the worker has let go";
+    std::lock_guard lock(mutex);
+    EXPECT_TRUE(delivered.empty());
+}
+
+// A message accepted while the worker is ending is never placed on its loop; its
+// timer still belongs to that loop and must go before it.
+TEST(MxReportingBlockThrottleLifetimeTest, AMessageNeverPlacedGoesCleanlyWithTheThrottle)
+{
+    FakePlatform platform;
+    auto throttle = Throttle::make();
+    throttle->setShouldKeepRunning(false);
+    throttle->addMessageBlock([] {}, 7, {{"never placed", 1}, {"_throttle_seconds", 4}}, 3, 1);
+    std::weak_ptr<Throttle> ending = throttle;
+    throttle.reset();
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+    while (!ending.expired() && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::yield();
+    EXPECT_TRUE(ending.expired());
 }
 
 } // namespace
