@@ -4,13 +4,40 @@
 #include <cerrno>
 #include <charconv>
 #include <fcntl.h>
+#include <random>
+#include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
+#include <unordered_map>
+
+#include "platform/MxLog.h"
 
 namespace mx {
 
 namespace {
 
 namespace fs = std::filesystem;
+
+// A channel's text is one 64-bit integer and a line end, with room for white space.
+constexpr std::size_t kLongestText = 63;
+// A rewrite in place leaves the file empty for microseconds: the first reads again
+// come at once, the later ones after growing pauses with a random part, so that a
+// reader and a writer woken by the same timer tick do not meet at the same moment
+// again (at most about 10 ms in all).
+constexpr int kReadAttempts = 8;
+constexpr int kImmediateAttempts = 2;
+constexpr auto kFirstPause = std::chrono::microseconds(25);
+
+void pauseBeforeAttempt(int attempt)
+{
+    if (attempt < kImmediateAttempts) {
+        std::this_thread::yield();
+        return;
+    }
+    thread_local std::minstd_rand random(static_cast<unsigned>(std::random_device{}()));
+    auto base = kFirstPause * (1 << (2 * (attempt - kImmediateAttempts)));
+    std::this_thread::sleep_for(base + base * (random() % 200) / 100);
+}
 
 // The regular files directly in `directory`, added to `channels`. False, with the
 // errno in `error`, when the directory cannot be read.
@@ -46,21 +73,35 @@ bool isDirectory(const fs::path& path)
     return fs::symlink_status(path, failure).type() == fs::file_type::directory;
 }
 
-// The value of one channel file, or the errno of what went wrong.
-std::optional<std::int64_t> readValue(const std::string& path, int& error)
+// A channel file's text, read through a descriptor that nothing on the other end can
+// block: opened without waiting (a FIFO put in a file's place opens at once) and
+// taken only when it is a regular file.
+bool readText(const std::string& path, std::string& text, int& error)
 {
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (fd < 0) {
         error = errno;
-        return std::nullopt;
+        return false;
     }
-    char text[64];
-    ssize_t length = ::read(fd, text, sizeof(text));
+    struct stat status {};
+    if (::fstat(fd, &status) != 0 || !S_ISREG(status.st_mode)) {
+        error = EINVAL;
+        ::close(fd);
+        return false;
+    }
+    char buffer[kLongestText + 1];
+    ssize_t length = ::read(fd, buffer, sizeof(buffer));
     error = length < 0 ? errno : 0;
     ::close(fd);
     if (length < 0)
-        return std::nullopt;
-    std::string_view number(text, std::size_t(length));
+        return false;
+    text.assign(buffer, std::size_t(length));
+    return true;
+}
+
+// One signed decimal 64-bit integer, surrounding white space ignored.
+std::optional<std::int64_t> parseValue(std::string_view number)
+{
     auto space = [](char c) {
         return c == ' ' || c == '\t' || c == '\n' || c == '\r';
     };
@@ -70,12 +111,31 @@ std::optional<std::int64_t> readValue(const std::string& path, int& error)
         number.remove_suffix(1);
     std::int64_t value = 0;
     auto [end, failure] = std::from_chars(number.data(), number.data() + number.size(), value);
-    if (number.empty() || failure != std::errc() || end != number.data() + number.size() ||
-        length == ssize_t(sizeof(text))) {
-        error = EINVAL;
+    if (number.empty() || failure != std::errc() || end != number.data() + number.size())
         return std::nullopt;
-    }
     return value;
+}
+
+// The value of one channel file, or the errno of what went wrong. A writer that
+// rewrites the file in place (`echo N > file`) empties it before it writes, so a read
+// may find nothing, or the first part of a number: such a read is tried again, and a
+// value without its line end is taken once two reads agree on it.
+std::optional<std::int64_t> readValue(const std::string& path, int& error)
+{
+    std::optional<std::int64_t> previous;
+    for (int attempt = 0; attempt < kReadAttempts; ++attempt) {
+        std::string text;
+        if (!readText(path, text, error))
+            return std::nullopt;
+        auto value = text.size() <= kLongestText ? parseValue(text) : std::nullopt;
+        if (value && (text.ends_with('\n') || value == previous))
+            return value;
+        previous = value;
+        if (!value)
+            pauseBeforeAttempt(attempt);
+    }
+    error = EINVAL;
+    return std::nullopt;
 }
 
 } // namespace
@@ -127,23 +187,37 @@ ChanstatSubscription FileChanstat::createSubscription(const ChanstatChannels& ch
     return ++subscriptions_;
 }
 
+// A channel that cannot be read is left out of the sample (and said so), not its
+// driver's others; only a driver none of whose channels can be read fails.
 std::optional<ChanstatChannels> FileChanstat::createSamples(ChanstatSubscription,
                                                             const ChanstatChannels& subscribedChannels,
                                                             std::optional<ChanstatError>& error)
 {
-    ChanstatChannels samples = subscribedChannels;
-    for (auto& channel : samples) {
+    ChanstatChannels samples;
+    samples.reserve(subscribedChannels.size());
+    int firstFailure = 0;
+    for (const auto& channel : subscribedChannels) {
         int failure = 0;
         auto value = readValue(channel.path, failure);
         if (!value) {
-            error = ChanstatError{failure};
-            return std::nullopt;
+            firstFailure = firstFailure != 0 ? firstFailure : failure;
+            MXLOG(nullptr, Error, "channel {} left out of this sample: {}", channel.path,
+                  failure == EINVAL ? std::string("not a regular file holding one integer")
+                                    : std::generic_category().message(failure));
+            continue;
         }
-        channel.value = *value;
+        samples.push_back(channel);
+        samples.back().value = *value;
+    }
+    if (samples.empty() && firstFailure != 0) {
+        error = ChanstatError{firstFailure};
+        return std::nullopt;
     }
     return samples;
 }
 
+// Channels are matched by path: a channel the earlier sample lacks (it could not be
+// read then) has no growth to give and is left out.
 std::optional<ChanstatChannels> FileChanstat::createSamplesDelta(const ChanstatChannels* earlier,
                                                                  const ChanstatChannels& later,
                                                                  std::optional<ChanstatError>& error)
@@ -152,17 +226,20 @@ std::optional<ChanstatChannels> FileChanstat::createSamplesDelta(const ChanstatC
         error = ChanstatError{ENOENT};
         return std::nullopt;
     }
-    ChanstatChannels delta = later;
-    for (auto& channel : delta) {
-        auto before = std::find_if(earlier->begin(), earlier->end(),
-                                   [&](const ChanstatChannel& candidate) { return candidate.path == channel.path; });
-        if (before == earlier->end()) {
-            error = ChanstatError{ENOENT};
-            return std::nullopt;
-        }
+    std::unordered_map<std::string_view, std::int64_t> before;
+    before.reserve(earlier->size());
+    for (const auto& channel : *earlier)
+        before.emplace(channel.path, channel.value);
+    ChanstatChannels delta;
+    delta.reserve(later.size());
+    for (const auto& channel : later) {
+        auto found = before.find(channel.path);
+        if (found == before.end())
+            continue;
+        delta.push_back(channel);
         // A counter that wrapped around still gives its growth, without overflow.
-        channel.value = static_cast<std::int64_t>(static_cast<std::uint64_t>(channel.value) -
-                                                  static_cast<std::uint64_t>(before->value));
+        delta.back().value = static_cast<std::int64_t>(static_cast<std::uint64_t>(channel.value) -
+                                                       static_cast<std::uint64_t>(found->second));
     }
     return delta;
 }

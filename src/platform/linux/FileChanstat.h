@@ -3,7 +3,9 @@
 // (or chanstat/GROUP/NAME for a group without subgroups) holding one signed decimal
 // 64-bit integer, kept current by whoever drives the hardware. A query walks the
 // directories once; a subscription is the files found then, and sampling reads just
-// those files. Thread-safe: it holds no state but its directory.
+// those files, through descriptors nothing can block on. A channel that cannot be
+// read is left out of its sample rather than failing its driver's other channels.
+// Thread-safe: it holds no state but its directory.
 
 #include <atomic>
 #include <filesystem>

@@ -1,6 +1,11 @@
 #include "platform/linux/FileChanstat.h"
 
+#include <atomic>
+#include <fcntl.h>
 #include <fstream>
+#include <sys/stat.h>
+#include <thread>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
@@ -77,13 +82,74 @@ TEST_F(FileChanstatTest, SamplesAndDeltasReadTheSubscribedFilesAndFailWithTheirE
     EXPECT_FALSE(files.createSamplesDelta(nullptr, *after, error));
     EXPECT_EQ(error->code, ENOENT);
     write("Speaker/underruns", "twelve");
+    write("Speaker/Amp/clips", "");
     error.reset();
     EXPECT_FALSE(files.createSamples(1, subscribed, error));
     EXPECT_EQ(error->code, EINVAL);
     std::filesystem::remove(directory / "Speaker/underruns");
+    std::filesystem::remove(directory / "Speaker/Amp/clips");
     error.reset();
     EXPECT_FALSE(files.createSamples(1, subscribed, error));
     EXPECT_EQ(error->code, ENOENT);
+}
+
+// A channel that cannot be read now (gone, garbled, a FIFO put in its place) is left
+// out of its sample, and so of the growth, while its driver's other channels count.
+TEST_F(FileChanstatTest, OneBadChannelLeavesTheOthersAndAFifoNeverBlocks)
+{
+    FileChanstat files(directory);
+    std::optional<ChanstatError> error;
+    ChanstatChannels subscribed;
+    write("Speaker/Amp/fifo", "0");
+    files.createSubscription(*files.copyChannelsInGroup("Speaker", std::nullopt, error), subscribed);
+    auto before = files.createSamples(1, subscribed, error);
+    std::filesystem::remove(directory / "Speaker/Amp/fifo");
+    ASSERT_EQ(mkfifo((directory / "Speaker/Amp/fifo").c_str(), 0644), 0);
+    write("Speaker/underruns", "not a number");
+    write("Speaker/Amp/clips", "5");
+    auto after = files.createSamples(1, subscribed, error);
+    EXPECT_FALSE(error);
+    EXPECT_EQ(names(after), std::vector<std::string>{"clips"});
+    write("Speaker/underruns", "20");
+    auto partial = files.createSamples(1, subscribed, error);
+    auto delta = files.createSamplesDelta(&*after, *partial, error);
+    EXPECT_EQ(names(delta), std::vector<std::string>{"clips"}) << "no growth for a channel missing before";
+    delta = files.createSamplesDelta(&*before, *partial, error);
+    ASSERT_EQ(names(delta), (std::vector<std::string>{"clips", "underruns"}));
+    EXPECT_EQ((*delta)[0].value, 8);
+    EXPECT_EQ((*delta)[1].value, 8);
+    EXPECT_FALSE(error);
+}
+
+// A writer that rewrites its file in place empties it first: a read between the two
+// steps is read again, never taken as a value or a failure.
+TEST_F(FileChanstatTest, ARewriteInPlaceIsNeverReadAsAMissingOrPartialValue)
+{
+    FileChanstat files(directory);
+    std::optional<ChanstatError> error;
+    ChanstatChannels subscribed;
+    files.createSubscription(*files.copyChannelsInGroup("Haptics", "Stats", error), subscribed);
+    write("Haptics/Stats/pulses", "1000457\n");
+    std::atomic<bool> writing{true};
+    std::thread writer([&] {
+        std::string path = (directory / "Haptics/Stats/pulses").string();
+        while (writing.load()) {
+            int fd = ::open(path.c_str(), O_WRONLY | O_TRUNC);
+            ASSERT_GE(fd, 0);
+            ASSERT_EQ(::write(fd, "1000457\n", 8), 8);
+            ::close(fd);
+            std::this_thread::sleep_for(std::chrono::microseconds(100));
+        }
+    });
+    int misread = 0;
+    for (int i = 0; i < 3000; ++i) {
+        auto samples = files.createSamples(1, subscribed, error);
+        misread += !samples || samples->size() != 1 || (*samples)[0].value != 1000457;
+    }
+    writing.store(false);
+    writer.join();
+    EXPECT_EQ(misread, 0);
+    EXPECT_FALSE(error);
 }
 
 } // namespace
