@@ -29,6 +29,7 @@
 #include "Statistics/Service/MxReportingBlockThrottle.h"
 #include "client/MxReportingClient.h"
 #include "platform/JsonValue.h"
+#include "platform/ValueText.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/DatagramOrientation.h"
 #include "platform/linux/FileChanstat.h"
@@ -619,6 +620,17 @@ std::string humanDuration(double seconds)
     return fmt::format("{}h {}m", whole / 3600, whole % 3600 / 60);
 }
 
+// A text of the status as one line of itself: process names, collectors' errors and
+// the like come from elsewhere and may hold anything.
+std::string printable(const std::string& text)
+{
+    std::string out;
+    appendPrintableText(out, text);
+    return out;
+}
+
+std::string printable(const Value& value) { return printable(value.description()); }
+
 void printStatus(const Dictionary& status)
 {
     static const Value nothing;
@@ -626,14 +638,14 @@ void printStatus(const Dictionary& status)
         const Value* value = from.find(key);
         return value ? *value : nothing;
     };
-    std::printf("mxreportingd %s, up %s\n", get(status, "version").description().c_str(),
+    std::printf("mxreportingd %s, up %s\n", printable(get(status, "version")).c_str(),
                 humanDuration(get(status, "uptime_seconds").doubleValue()).c_str());
     const Array* clients = get(status, "clients").asArray();
     std::printf("clients: %zu\n", clients ? clients->size() : 0);
     for (const auto& client : clients ? *clients : Array()) {
         const Dictionary& entry = client.asDictionary() ? *client.asDictionary() : Dictionary();
         std::printf("  pid %lld %s (%lld sessions)\n", static_cast<long long>(get(entry, "pid").int64Value()),
-                    get(entry, "process").description().c_str(),
+                    printable(get(entry, "process")).c_str(),
                     static_cast<long long>(get(entry, "sessions").int64Value()));
     }
     std::printf("sessions started: %lld\nreports received: %lld (%.1f/s)\n",
@@ -644,8 +656,8 @@ void printStatus(const Dictionary& status)
     if (const Dictionary* stores = get(status, "stores").asDictionary())
         for (const auto& [name, value] : *stores) {
             const Dictionary& store = value.asDictionary() ? *value.asDictionary() : Dictionary();
-            std::printf("  %-7s %lld rows written, %lld queued, %s on disk, %lld failed writes\n", name.c_str(),
-                        static_cast<long long>(get(store, "rows_written").int64Value()),
+            std::printf("  %-7s %lld rows written, %lld queued, %s on disk, %lld failed writes\n",
+                        printable(name).c_str(), static_cast<long long>(get(store, "rows_written").int64Value()),
                         static_cast<long long>(get(store, "queue_depth").int64Value()),
                         humanBytes(get(store, "bytes").doubleValue()).c_str(),
                         static_cast<long long>(get(store, "failures").int64Value()));
@@ -654,8 +666,8 @@ void printStatus(const Dictionary& status)
     std::printf("exporters:%s\n", exporters && !exporters->empty() ? "" : " none (the spool alone)");
     for (const auto& [name, value] : exporters ? *exporters : Dictionary()) {
         const Dictionary& exporter = value.asDictionary() ? *value.asDictionary() : Dictionary();
-        std::string error = get(exporter, "last_error").description();
-        std::printf("  %s: %lld unacknowledged, oldest %s%s%s\n", name.c_str(),
+        std::string error = printable(get(exporter, "last_error"));
+        std::printf("  %s: %lld unacknowledged, oldest %s%s%s\n", printable(name).c_str(),
                     static_cast<long long>(get(exporter, "unacknowledged").int64Value()),
                     humanDuration(get(exporter, "oldest_seconds").doubleValue()).c_str(),
                     error.empty() ? "" : ", failing: ", error.c_str());

@@ -1,4 +1,5 @@
 #include "platform/MxLog.h"
+#include "platform/ValueText.h"
 
 #include <chrono>
 #include <cstdio>
@@ -34,35 +35,49 @@ int verboseLevelFromEnvironment(const std::string& verboseSwitch)
     return end != value ? static_cast<int>(level) : 0;
 }
 
-// Identical error lines: within a window the first few pass and the rest are
-// counted; the count rides on the first identical line let through after it. Lines
-// that differ (another reporter, another file) are never held back by each other.
-class ErrorBursts {
+// Bursts of lines, so that nothing a client sends can fill the log: within a window
+// a text repeated word for word passes a few times, and one place in the code writes
+// a bounded number of lines whatever their texts (one per datagram of a flood, each
+// quoting a different one). What is held back is counted, and the count rides on the
+// next line that place writes. Different texts under the bound never hold each other
+// back, so one reporter's errors cannot hide another's.
+class LogBursts {
 public:
-    // Nothing: suppress the line. Else the number suppressed since the last one shown.
+    // Nothing: suppress the line. Else the number suppressed at its place since the
+    // last line shown from there.
+    void reset()
+    {
+        std::lock_guard lock(mutex_);
+        texts_.clear();
+        places_.clear();
+    }
+
     std::optional<std::uint64_t> admit(const MxLogRecord& record)
     {
         auto now = std::chrono::steady_clock::now();
         std::string key = record.message();
         std::lock_guard lock(mutex_);
-        if (bursts_.size() >= kMostRemembered)
-            forgetQuiet(now);
-        auto& burst = bursts_[key];
-        if (now - burst.windowStart >= kWindow) {
-            burst.windowStart = now;
-            burst.shown = 0;
-        }
-        if (burst.shown >= kLinesPerWindow) {
-            ++burst.suppressed;
+        if (texts_.size() >= kMostRemembered)
+            forgetQuiet(texts_, now);
+        if (places_.size() >= kMostRemembered)
+            forgetQuiet(places_, now);
+        auto& place = places_[Place{record.file, record.line}];
+        auto& text = texts_[key];
+        restartIfOver(place, now);
+        restartIfOver(text, now);
+        if (place.shown >= kLinesPerPlace || text.shown >= kLinesPerText) {
+            ++place.suppressed;
             return std::nullopt;
         }
-        ++burst.shown;
-        return std::exchange(burst.suppressed, 0);
+        ++place.shown;
+        ++text.shown;
+        return std::exchange(place.suppressed, 0);
     }
 
 private:
     static constexpr std::chrono::seconds kWindow{10};
-    static constexpr int kLinesPerWindow = 10;
+    static constexpr int kLinesPerText = 10;
+    static constexpr int kLinesPerPlace = 100;
     static constexpr std::size_t kMostRemembered = 4096;
 
     struct Burst {
@@ -70,26 +85,39 @@ private:
         int shown = 0;
         std::uint64_t suppressed = 0;
     };
+    using Place = std::pair<std::string, int>;
 
-    // Lines whose window is over hold nothing worth keeping but an uncounted tail.
-    void forgetQuiet(std::chrono::steady_clock::time_point now)
+    static void restartIfOver(Burst& burst, std::chrono::steady_clock::time_point now)
     {
-        std::erase_if(bursts_, [&](const auto& entry) { return now - entry.second.windowStart >= kWindow; });
-        if (bursts_.size() >= kMostRemembered)
-            bursts_.clear();
+        if (now - burst.windowStart >= kWindow) {
+            burst.windowStart = now;
+            burst.shown = 0;
+        }
+    }
+
+    // Bursts whose window is over hold nothing worth keeping but an uncounted tail.
+    template <class Map>
+    static void forgetQuiet(Map& bursts, std::chrono::steady_clock::time_point now)
+    {
+        std::erase_if(bursts, [&](const auto& entry) { return now - entry.second.windowStart >= kWindow; });
+        if (bursts.size() >= kMostRemembered)
+            bursts.clear();
     }
 
     std::mutex mutex_;
-    std::map<std::string, Burst> bursts_;
+    std::map<std::string, Burst> texts_;
+    std::map<Place, Burst> places_;
 };
 
-ErrorBursts& errorBursts()
+LogBursts& logBursts()
 {
-    static auto* bursts = new ErrorBursts; // outlives every logging thread
+    static auto* bursts = new LogBursts; // outlives every logging thread
     return *bursts;
 }
 
 } // namespace
+
+void MxLogResetBurstsForTesting() { logBursts().reset(); }
 
 const MxLogScope* MxLogRegisterScope(int /*kind*/, std::uint32_t /*fourCharCode*/, const std::string& code,
                                      const std::string& subsystem, const std::string& verboseSwitch, int /*settings*/)
@@ -137,9 +165,15 @@ std::string_view MxLogFunctionName(std::string_view signature)
 void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, std::string_view signature,
                 std::string_view text)
 {
-    MxLogRecord record{scope, level, file, line, std::string(MxLogFunctionName(signature)), std::string(text)};
-    if (level == MxLogLevel::Error) {
-        auto suppressed = errorBursts().admit(record);
+    MxLogRecord record{scope, level, file, line, std::string(MxLogFunctionName(signature)), {}};
+    // Lines quote what clients send and call themselves: one line, nothing a terminal obeys.
+    if (isPrintableText(text))
+        record.text = text;
+    else
+        appendPrintableText(record.text, text);
+    // Verbose lines are asked for, and cut by nothing.
+    if (level != MxLogLevel::Debug) {
+        auto suppressed = logBursts().admit(record);
         if (!suppressed)
             return;
         if (*suppressed > 0)

@@ -3,8 +3,10 @@
 // registered scope (or the default log) to the one installed MxLogSink: journald
 // under systemd, stderr otherwise, a capturing sink in tests. A line is the service's
 // text led by the "file:line:function: " of the code that wrote it; the journal keeps
-// the location in fields of its own. An error line repeated word for word in a burst
-// is let through a few times, then counted until the burst is over.
+// the location in fields of its own. A line repeated word for word in a burst is let
+// through a few times, and one place in the code writes a bounded number of lines a
+// window, whatever their texts; the rest is counted. Texts are made printable: what
+// a client sends or calls itself never breaks a line or reaches a terminal raw.
 
 #include <cstdint>
 #include <string>
@@ -61,6 +63,9 @@ bool MxLogEnabled(const MxLogScope* scope, int verboseLevel);
 // function it declares, or for a lambda the function the lambda is written in.
 void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, std::string_view signature,
                 std::string_view text);
+
+// Forgets every burst counted so far: each test starts with a log nothing held back.
+void MxLogResetBurstsForTesting();
 
 // "start" of "void mx::MxReportingSession::start()", "configure" of the signature of a
 // lambda inside configure.

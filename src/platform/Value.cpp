@@ -295,6 +295,62 @@ bool plainAscii(unsigned char c) { return c >= 0x20 && c < 0x80 && c != '"' && c
 
 } // namespace
 
+namespace {
+
+// The length of the character at the start of `text` that appendPrintableText keeps
+// as it is, or 0 when it must be escaped.
+std::size_t printableCharacter(const unsigned char* text, std::size_t left)
+{
+    if (text[0] < 0x80)
+        return text[0] >= 0x20 && text[0] != 0x7F ? 1 : 0;
+    std::size_t length = utf8Sequence(text, left);
+    // U+0080..U+009F, the C1 controls, are two bytes C2 80..C2 9F.
+    if (length == 2 && text[0] == 0xC2 && text[1] < 0xA0)
+        return 0;
+    return length;
+}
+
+} // namespace
+
+bool isPrintableText(std::string_view text)
+{
+    auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
+    for (std::size_t i = 0; i < text.size();) {
+        std::size_t length = printableCharacter(bytes + i, text.size() - i);
+        if (length == 0)
+            return false;
+        i += length;
+    }
+    return true;
+}
+
+void appendPrintableText(std::string& out, std::string_view text)
+{
+    auto* bytes = reinterpret_cast<const unsigned char*>(text.data());
+    for (std::size_t i = 0; i < text.size();) {
+        if (std::size_t length = printableCharacter(bytes + i, text.size() - i)) {
+            out.append(text, i, length);
+            i += length;
+            continue;
+        }
+        unsigned char c = bytes[i];
+        if (c == '\n') {
+            out += "\\n";
+        } else if (c == '\t') {
+            out += "\\t";
+        } else if (c == '\r') {
+            out += "\\r";
+        } else if (c == 0xC2 && utf8Sequence(bytes + i, text.size() - i) == 2) {
+            out += fmt::format("\\u{:04x}", bytes[i + 1]);
+            i += 2;
+            continue;
+        } else {
+            out += fmt::format("\\x{:02x}", c);
+        }
+        ++i;
+    }
+}
+
 void appendQuotedText(std::string& out, std::string_view text)
 {
     out += '"';

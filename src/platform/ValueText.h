@@ -13,6 +13,13 @@ namespace mx {
 // `text` as a JSON string literal; invalid UTF-8 becomes U+FFFD, so it always parses.
 void appendQuotedText(std::string& out, std::string_view text);
 
+// `text` as one line a terminal shows as it is: control characters (C0, DEL, C1) are
+// written as \n, \t, \r, \xNN or \uNNNN, and bytes that are not UTF-8 as \xNN. What
+// a client names itself or sends reaches a log line or a status view only this way.
+void appendPrintableText(std::string& out, std::string_view text);
+// True when appendPrintableText would write `text` unchanged.
+bool isPrintableText(std::string_view text);
+
 // Arrays as [a,b] and dictionaries as {"k":v}, recursively; every other value goes
 // to `scalar(out, value)`.
 template <class Scalar>

@@ -19,6 +19,7 @@ struct CapturedLine {
 
 class CapturingLogSink final : public MxLogSink {
 public:
+    CapturingLogSink() { MxLogResetBurstsForTesting(); }
     void write(const MxLogRecord& record) override;
 
     std::vector<CapturedLine> lines() const;

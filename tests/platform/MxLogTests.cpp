@@ -54,20 +54,39 @@ TEST(MxLogTest, VerboseLinesNeedTheScopesSwitchAtLevelFive)
     EXPECT_EQ(formatted, 1) << "a silent verbose line is not even formatted";
 }
 
-TEST(MxLogTest, AnIdenticalErrorBurstIsCutToAFewLinesOthersPass)
+TEST(MxLogTest, BurstsAreCutByTextAndByPlaceAndCountedOnTheNextLineShown)
 {
     CapturingLogSink sink;
     ScopedInstall<MxLogSink> install(sink);
     for (int row = 0; row < 1000; ++row) {
         MXLOG(nullptr, Error, "write failed");
-        MXLOG(nullptr, Error, "failed to find reporting session {}", row % 20);
-        MXLOG(nullptr, Info, "row {} held", row);
+        MXLOG(nullptr, Error, "failed to find reporting session {}", row % 5);
+        MXLOG(nullptr, Default, "datagram {} ignored", row);
+        MXLOG_VERBOSE(nullptr, "never cut {}", row);
     }
     auto errors = sink.texts(MxLogLevel::Error);
     EXPECT_EQ(std::count(errors.begin(), errors.end(), "write failed"), 10);
-    EXPECT_EQ(std::count(errors.begin(), errors.end(), "failed to find reporting session 7"), 10)
+    EXPECT_EQ(std::count(errors.begin(), errors.end(), "failed to find reporting session 3"), 10)
         << "each text has its own count";
-    EXPECT_EQ(sink.texts(MxLogLevel::Info).size(), 1000u) << "only error lines are cut";
+    auto flood = sink.texts(MxLogLevel::Default);
+    ASSERT_EQ(flood.size(), 100u) << "one place, texts all different";
+    EXPECT_EQ(flood.back(), "datagram 99 ignored");
+
+    // What a place held back is counted on its next line shown.
+    sink.clear();
+    for (int i = 0; i < 12; ++i)
+        MxLogWrite(nullptr, MxLogLevel::Error, "place.cpp", 7, "void f()", "same");
+    MxLogWrite(nullptr, MxLogLevel::Error, "place.cpp", 7, "void f()", "other");
+    EXPECT_EQ(sink.texts().back(), "other (2 more like it suppressed)");
+}
+
+TEST(MxLogTest, TextsAreOnePrintableLine)
+{
+    CapturingLogSink sink;
+    ScopedInstall<MxLogSink> install(sink);
+    MXLOG(nullptr, Default, "client {} left", "ev\x1b]0;owned\x07il\nINFO fake line\t\xc2\x9b\xff é");
+    EXPECT_EQ(sink.texts(),
+              std::vector<std::string>{"client ev\\x1b]0;owned\\x07il\\nINFO fake line\\t\\u009b\\xff é left"});
 }
 
 } // namespace

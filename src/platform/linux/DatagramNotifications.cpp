@@ -45,8 +45,16 @@ void DatagramNotifications::deliver(const std::string& name)
         if (found != registrations_.end())
             targets = found->second;
     }
-    for (auto& registration : targets)
-        registration.queue->dispatch([handler = registration.handler, token = registration.token] { handler(token); });
+    for (auto& registration : targets) {
+        if (registration.waiting->exchange(true))
+            continue;
+        // Cleared before the handler runs: a post during it is looked at again.
+        registration.queue->dispatch(
+            [handler = registration.handler, token = registration.token, waiting = registration.waiting] {
+                waiting->store(false);
+                handler(token);
+            });
+    }
 }
 
 std::uint32_t DatagramNotifications::post(const std::string& name) { return sendUnixDatagram(endpoint_, name); }

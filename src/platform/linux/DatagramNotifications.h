@@ -1,10 +1,13 @@
 #pragma once
 // Named notifications over a Unix datagram socket: a post is the name sent as one
 // datagram to the notification endpoint; the daemon, bound there, tells every
-// registration for that name on the queue it chose. The daemon posts to itself
+// registration for that name on the queue it chose. Posts that arrive while one is
+// still waiting on that queue are folded into it: a notification says "look again",
+// and one look after the last post sees all of them. The daemon posts to itself
 // without the socket (deliver), which is how SIGHUP re-reads the preferences.
 
 #include <array>
+#include <atomic>
 #include <filesystem>
 #include <map>
 #include <mutex>
@@ -36,6 +39,8 @@ private:
         int token;
         std::shared_ptr<WorkQueue> queue;
         std::function<void(int)> handler;
+        // Set from a post until its handler starts.
+        std::shared_ptr<std::atomic<bool>> waiting = std::make_shared<std::atomic<bool>>(false);
     };
 
     void receiveNext();
