@@ -35,6 +35,10 @@ public:
     virtual ~ServiceReply() = default;
     virtual void respond(const Value& result) = 0;
     virtual void fail(const ServiceError& error) = 0;
+    // The request's work is done and its reply is held for later (a start reply kept
+    // until the session stops): it no longer counts among the connection's requests
+    // waiting for work.
+    virtual void hold() = 0;
 };
 
 // What a connection exports: it is handed every request of the connection, in the

@@ -23,7 +23,7 @@ public:
             reply(65535);
     }
     void setConfiguration(std::optional<Dictionary>, ReporterID, MxBoolReply reply) override { reply(true); }
-    void startReportingSessionForID(ReporterID, MxBoolReply reply) override
+    void startReportingSessionForID(ReporterID, MxHeldReply reply) override
     {
         if (!likeTheService_)
             reply(true);

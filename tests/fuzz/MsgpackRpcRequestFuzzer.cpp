@@ -19,6 +19,7 @@ class CountingReply final : public ServiceReply {
 public:
     void respond(const Value&) override { ++answers; }
     void fail(const ServiceError&) override { ++answers; }
+    void hold() override {}
     int answers = 0;
 };
 

@@ -138,7 +138,13 @@ const std::map<std::string, Operation, std::less<>>& operations()
                   service.setConfiguration(std::move(configuration), id, boolReply(responder));
           }}},
         {std::string(method::kStartReportingSessionForID),
-         reporterOperation(&MxReportingServiceProtocol::startReportingSessionForID)},
+         {1,
+          [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.startReportingSessionForID(
+                      id, MxHeldReply(boolReply(responder), [responder] { responder->hold(); }));
+          }}},
         {std::string(method::kSendMessage),
          {4,
           [](auto& service, auto& args, const Responder& responder) {

@@ -118,7 +118,7 @@ void MxReportingServerInstance::setConfiguration(std::optional<Dictionary> confi
                 MxReportingServerInstance& self) { self.handleSetConfiguration(configuration, reporterID, reply); });
 }
 
-void MxReportingServerInstance::startReportingSessionForID(ReporterID reporterID, MxBoolReply reply)
+void MxReportingServerInstance::startReportingSessionForID(ReporterID reporterID, MxHeldReply reply)
 {
     MXLOG_VERBOSE(logScope(), "starting session for reporter {}", reporterID);
     enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
@@ -182,6 +182,13 @@ void MxReportingServerInstance::handleConnectionError()
 void MxReportingServerInstance::handleCreate(ReporterID reporterID, const MxBoolReply& reply)
 {
     MxTrace(kTraceCreate);
+    if (clientReportingSessionMap_.size() >= kMaximumSessions && !clientReportingSessionMap_.contains(reporterID)) {
+        MXLOG(logScope(), Error,
+              "session limit reached: client pid {} holds {} sessions, none made for reporter {} (destroy one first)",
+              processIdentifier_, clientReportingSessionMap_.size(), reporterID);
+        reply(true);
+        return;
+    }
     clientReportingSessionMap_[reporterID] =
         std::make_shared<MxReportingSession>(reporterID, std::vector<std::int32_t>{processIdentifier_});
     MXLOG(logScope(), Default, "session created for reporter {}", reporterID);
@@ -219,7 +226,7 @@ void MxReportingServerInstance::handleSetConfiguration(const std::optional<Dicti
     reply(true);
 }
 
-void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxBoolReply& reply)
+void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxHeldReply& reply)
 {
     MxTrace(kTraceStart);
     if (reporterID == 0) {
@@ -236,6 +243,7 @@ void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxBoolR
         root->noteSessionStarted();
         session->setDriverSnapShot(root->getSnapShot());
     }
+    reply.hold();
     session->parkTransactionCompleteBlock(reply);
 }
 

@@ -26,6 +26,11 @@ class MxReportingServerInstance final : public MxReportingServiceProtocol,
 public:
     using SessionMap = std::map<ReporterID, std::shared_ptr<MxReportingSession>>;
 
+    // Sessions one client may hold at once: each costs memory (and, started, a held
+    // reply) until it is destroyed or its client leaves. A create beyond it makes
+    // nothing, answers true like any create that makes nothing, and says so in the log.
+    static constexpr std::size_t kMaximumSessions = 1024;
+
     // initWithPID:delegate:
     MxReportingServerInstance(std::int32_t processIdentifier,
                               std::weak_ptr<MxReportingServiceDelegateProtocol> delegate,
@@ -51,7 +56,7 @@ public:
     void setServiceType(ServiceType serviceType, ReporterID reporterID, MxBoolReply reply) override;
     void getServiceNameForReporterID(ReporterID reporterID, MxServiceTypeReply reply) override;
     void setConfiguration(std::optional<Dictionary> configuration, ReporterID reporterID, MxBoolReply reply) override;
-    void startReportingSessionForID(ReporterID reporterID, MxBoolReply reply) override;
+    void startReportingSessionForID(ReporterID reporterID, MxHeldReply reply) override;
     void sendMessage(Dictionary payload, MessageCategory category, MessageType type, std::optional<Array> reportingIDs,
                      MxErrorReply reply) override;
     void stopReportingSessionForID(ReporterID reporterID, MxBoolReply reply) override;
@@ -76,7 +81,7 @@ private:
     void handleGetServiceName(ReporterID reporterID, const MxServiceTypeReply& reply);
     void handleSetConfiguration(const std::optional<Dictionary>& configuration, ReporterID reporterID,
                                 const MxBoolReply& reply);
-    void handleStart(ReporterID reporterID, const MxBoolReply& reply);
+    void handleStart(ReporterID reporterID, const MxHeldReply& reply);
     void handleSendMessage(const Dictionary& payload, MessageCategory category, MessageType type,
                            const std::optional<Array>& reportingIDs, const MxErrorReply& reply);
     void sendToStartedSessions(const Dictionary& payload, MessageCategory category, MessageType type,

@@ -10,6 +10,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <type_traits>
 #include <vector>
 
 #include "Statistics/MxReportingVocabulary.h"
@@ -33,6 +34,37 @@ using MxErrorReply = std::function<void(std::optional<MxReportingError>)>;
 using MxDictionaryReply = std::function<void(Dictionary)>;
 using MxReportersReply = std::function<void(std::vector<ReporterID>)>;
 
+// The reply of a start request, which the session may keep until it is stopped.
+// hold() says it is kept: the request's work is done, and the connection no longer
+// counts it among the requests waiting for work.
+class MxHeldReply {
+public:
+    MxHeldReply() = default;
+    // A reply whose holding nobody needs to hear of.
+    template <class F>
+    requires(!std::is_same_v<std::decay_t<F>, MxHeldReply> && std::is_invocable_v<F&, bool>)
+        MxHeldReply(F reply) // NOLINT(bugprone-forwarding-reference-overload)
+        : reply_(std::move(reply))
+    {
+    }
+    MxHeldReply(MxBoolReply reply, std::function<void()> held) : reply_(std::move(reply)), held_(std::move(held)) {}
+
+    void operator()(bool value) const
+    {
+        if (reply_)
+            reply_(value);
+    }
+    void hold() const
+    {
+        if (held_)
+            held_();
+    }
+
+private:
+    MxBoolReply reply_;
+    std::function<void()> held_;
+};
+
 class MxReportingServiceProtocol {
 public:
     virtual ~MxReportingServiceProtocol() = default;
@@ -42,7 +74,7 @@ public:
     virtual void getServiceNameForReporterID(ReporterID reporterID, MxServiceTypeReply reply) = 0;
     virtual void setConfiguration(std::optional<Dictionary> configuration, ReporterID reporterID,
                                   MxBoolReply reply) = 0;
-    virtual void startReportingSessionForID(ReporterID reporterID, MxBoolReply reply) = 0;
+    virtual void startReportingSessionForID(ReporterID reporterID, MxHeldReply reply) = 0;
     // `reportingIDs` absent: every started session of every client.
     virtual void sendMessage(Dictionary payload, MessageCategory category, MessageType type,
                              std::optional<Array> reportingIDs, MxErrorReply reply) = 0;

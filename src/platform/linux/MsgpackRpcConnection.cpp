@@ -31,8 +31,7 @@ public:
     ~ConnectionReply() override
     {
         if (!replied_.load())
-            if (auto connection = connection_.lock())
-                connection->requestEnded(bytes_);
+            leaveBounds();
     }
 
     void respond(const Value& result) override
@@ -40,7 +39,7 @@ public:
         if (claim())
             if (auto connection = connection_.lock()) {
                 connection->sendResponse(msgid_, Value(), result);
-                connection->requestEnded(bytes_);
+                leaveBounds();
             }
     }
 
@@ -49,17 +48,32 @@ public:
         if (claim())
             if (auto connection = connection_.lock()) {
                 connection->sendError(msgid_, error);
-                connection->requestEnded(bytes_);
+                leaveBounds();
             }
+    }
+
+    void hold() override
+    {
+        if (!replied_.load())
+            leaveBounds();
     }
 
 private:
     bool claim() { return !replied_.exchange(true); }
 
+    // Once, whether by its reply, its hold or its end.
+    void leaveBounds()
+    {
+        if (counted_.exchange(false))
+            if (auto connection = connection_.lock())
+                connection->requestEnded(bytes_);
+    }
+
     std::weak_ptr<MsgpackRpcConnection> connection_;
     std::uint32_t msgid_;
     std::size_t bytes_;
     std::atomic<bool> replied_{false};
+    std::atomic<bool> counted_{true};
 };
 
 } // namespace

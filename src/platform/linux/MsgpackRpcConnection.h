@@ -29,9 +29,9 @@ class MsgpackRpcConnection final : public ServiceConnection, public std::enable_
 public:
     // Unsent reply bytes above which the client's requests are no longer read.
     static constexpr std::size_t kBackPressureBytes = std::size_t{4} << 20;
-    // Requests handed on and not yet answered, in number and in wire bytes. Every one
-    // waits on the one server queue: 256 keep another client's turn a millisecond or
-    // two away, and leave room for a client's held start replies.
+    // Requests handed on and waiting for work, in number and in wire bytes (a held
+    // reply no longer counts): 256 keep a client's pipeline full without letting it
+    // pile up more than its share of the daemon's queues.
     static constexpr std::size_t kMaximumRequestsInFlight = 256;
     static constexpr std::size_t kMaximumBytesInFlight = std::size_t{4} << 20;
     // How often a paused connection looks whether its client is still there.

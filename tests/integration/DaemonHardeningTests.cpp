@@ -1,0 +1,88 @@
+// What no client can do to the daemon or to the other clients, and what no file
+// under its root can do to it: bounds, fairness and odd files, against the real
+// daemon in a private root.
+
+#include <atomic>
+#include <future>
+#include <map>
+#include <mutex>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "integration/IntegrationHelpers.h"
+
+namespace mx::testing {
+namespace {
+
+class DaemonHardeningTest : public ::testing::Test {
+protected:
+    void SetUp() override { daemon.start(); }
+    std::unique_ptr<MxReportingClient> connect() { return connectTo(daemon); }
+
+    DaemonProcess daemon;
+};
+
+// A held start reply is no request waiting for work: a client holding hundreds is read
+// on, and stops them all. What bounds it instead is the number of its sessions.
+TEST_F(DaemonHardeningTest, HeldStartRepliesNeverStopAClientWhoseSessionsAreBounded)
+{
+    auto client = connect();
+    constexpr int kStarted = 600;
+    std::atomic<int> startsAnswered{0};
+    for (ReporterID id = 1; id <= kStarted; ++id) {
+        client->createReportingSession(id, nullptr);
+        client->startReportingSessionForID(
+            id, [&](MxClientResult<bool> result) { startsAnswered += result.value.value_or(false); });
+    }
+    for (ReporterID id = 1; id <= kStarted; ++id)
+        ASSERT_TRUE(client->stopReportingSessionForID(id).value.value_or(false)) << "stop " << id;
+    EXPECT_TRUE(waitUntil([&] { return startsAnswered.load() == kStarted; }));
+
+    for (ReporterID id = kStarted + 1; id <= 1100; ++id)
+        client->createReportingSession(id, nullptr);
+    auto reporters = client->getAllReporters();
+    ASSERT_TRUE(reporters);
+    EXPECT_EQ(reporters.value->size(), 1024u) << "a client holds at most 1024 sessions";
+    EXPECT_TRUE(daemon.waitForLog(fmt::format(
+        "session limit reached: client pid {} holds 1024 sessions, none made for reporter 1025", getpid())));
+    EXPECT_TRUE(*client->createReportingSession(1).value) << "one it holds may be made anew";
+    EXPECT_TRUE(*client->destroyReportingSession(2).value);
+    EXPECT_TRUE(*client->createReportingSession(5000).value);
+    EXPECT_EQ(client->reporterID(5000).value, (Dictionary{{"reporterID", 5000}, {"serviceType", 65535}}));
+
+    auto other = connect();
+    EXPECT_TRUE(*other->createReportingSession(7000).value);
+    EXPECT_EQ(other->reporterID(7000).value, (Dictionary{{"reporterID", 7000}, {"serviceType", 65535}}))
+        << "the bound is each client's own";
+}
+
+// A client names itself (its process name) and fills its payloads: neither reaches a
+// terminal or the log as anything but one printable line.
+TEST_F(DaemonHardeningTest, ControlCharactersFromClientsAreEscapedInTheLogAndTheStatus)
+{
+    pid_t child = fork();
+    if (child == 0) {
+        prctl(PR_SET_NAME, "ev\x1b[2Jil\tX");
+        RawConnection connection(daemon.socketPath());
+        connection.send(packed([](auto& p) {
+            p.pack_array(4), p.pack(0), p.pack(1), p.pack(std::string("createReportingSession:reply:"));
+            p.pack_array(1), p.pack(77);
+        }));
+        pause();
+        _exit(0);
+    }
+    ASSERT_TRUE(daemon.waitForLog("session created for reporter 77"));
+    std::string output;
+    ASSERT_EQ(daemon.runToEnd({MXREPORT_PATH, "status"}, output), 0) << output;
+    EXPECT_THAT(output, ::testing::HasSubstr(fmt::format("pid {} ev\\x1b[2Jil\\tX (1 sessions)", child)));
+    kill(child, SIGKILL);
+    waitpid(child, nullptr, 0);
+    EXPECT_TRUE(daemon.waitForLog("InvalidationHandler: connection exited process=ev\\x1b[2Jil\\tX uptime_sec="));
+    EXPECT_THAT(daemon.log(), ::testing::Not(::testing::HasSubstr("\x1b")));
+}
+
+} // namespace
+} // namespace mx::testing

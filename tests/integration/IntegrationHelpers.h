@@ -1,0 +1,118 @@
+#pragma once
+// What the integration tests share beyond the daemon itself: a connection that speaks
+// raw bytes, a client of the real library, a small tmpfs to fill, and the memory a
+// daemon may take however a client behaves.
+
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <string>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+#include <utility>
+
+#include <fmt/format.h>
+#include <gtest/gtest.h>
+#include <msgpack.hpp>
+
+#include "client/MxReportingClient.h"
+#include "integration/DaemonProcess.h"
+
+namespace mx::testing {
+
+// What the daemon may take in all, however a client behaves. Under a sanitizer its
+// own shadow memory and quarantine come on top.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+inline constexpr std::size_t kMemoryBound = std::size_t{512} << 20;
+#else
+inline constexpr std::size_t kMemoryBound = std::size_t{64} << 20;
+#endif
+
+// A connection that speaks bytes, for what no well-behaved client would send.
+class RawConnection {
+public:
+    explicit RawConnection(const std::filesystem::path& socketPath)
+    {
+        fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        std::strncpy(address.sun_path, socketPath.c_str(), sizeof(address.sun_path) - 1);
+        connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
+    }
+    ~RawConnection() { close(); }
+    void close()
+    {
+        if (fd_ >= 0)
+            ::close(std::exchange(fd_, -1));
+    }
+
+    bool connected() const { return connected_; }
+    bool send(const std::string& bytes)
+    {
+        return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == ssize_t(bytes.size());
+    }
+
+    // True once the daemon has closed its end.
+    bool waitForClose()
+    {
+        return waitUntil([&] {
+            char byte;
+            ssize_t got = ::recv(fd_, &byte, 1, MSG_DONTWAIT);
+            return got == 0 || (got < 0 && errno != EAGAIN && errno != EWOULDBLOCK);
+        });
+    }
+
+    int fd() const { return fd_; }
+
+private:
+    int fd_ = -1;
+    bool connected_ = false;
+};
+
+inline std::string packed(const std::function<void(msgpack::packer<msgpack::sbuffer>&)>& write)
+{
+    msgpack::sbuffer buffer;
+    msgpack::packer<msgpack::sbuffer> packer(buffer);
+    write(packer);
+    return std::string(buffer.data(), buffer.size());
+}
+
+inline std::unique_ptr<MxReportingClient> connectTo(const DaemonProcess& daemon)
+{
+    std::string error;
+    auto client = MxReportingClient::connect(daemon.socketPath(), error);
+    EXPECT_TRUE(client) << error;
+    return client;
+}
+
+// A small tmpfs over `path` for as long as it lives, where this machine lets a test
+// mount one (as root).
+class Tmpfs {
+public:
+    Tmpfs(std::filesystem::path path, const std::string& options) : path_(std::move(path))
+    {
+        std::filesystem::create_directories(path_);
+        mounted_ =
+            ::system(fmt::format("mount -t tmpfs -o {} tmpfs '{}' 2>/dev/null", options, path_.string()).c_str()) == 0;
+    }
+    ~Tmpfs() { unmount(); }
+    bool mounted() const { return mounted_; }
+    bool remount(const std::string& options)
+    {
+        return ::system(fmt::format("mount -o remount,{} '{}'", options, path_.string()).c_str()) == 0;
+    }
+    void unmount()
+    {
+        if (std::exchange(mounted_, false))
+            (void)::system(fmt::format("umount -l '{}'", path_.string()).c_str());
+    }
+
+private:
+    std::filesystem::path path_;
+    bool mounted_ = false;
+};
+
+} // namespace mx::testing
