@@ -21,13 +21,19 @@ constexpr std::uint32_t kTraceMessage = 0x21042824;
 
 constexpr int kKillServiceExitStatus = 2;
 
+// A broadcast's log lines name the sessions it reaches: the first few of them, so that
+// a line stays a line however many sessions there are.
+constexpr std::size_t kSessionsListed = 16;
+
 std::string describeSessions(const std::vector<std::shared_ptr<MxReportingSession>>& sessions)
 {
     std::string text = "(";
-    for (std::size_t i = 0; i < sessions.size(); ++i) {
+    for (std::size_t i = 0; i < sessions.size() && i < kSessionsListed; ++i) {
         text += i == 0 ? "" : ", ";
         text += sessions[i]->description();
     }
+    if (sessions.size() > kSessionsListed)
+        text += fmt::format(", and {} more", sessions.size() - kSessionsListed);
     return text + ")";
 }
 

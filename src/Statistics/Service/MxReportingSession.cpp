@@ -209,6 +209,13 @@ void MxReportingSession::unregisterOrientation()
 
 void MxReportingSession::recordOrientation(std::string_view mode, int orientation)
 {
+    // Callbacks come one at a time: the count needs no more than its own atomicity.
+    if (orientationRecords_.load() >= kMaximumOrientationRecords) {
+        if (!orientationBoundLogged_.exchange(true))
+            MXLOG(logScope(), Error, "reporter {} recorded {} orientation changes this period: later ones are not",
+                  reporterID_, kMaximumOrientationRecords);
+        return;
+    }
     std::string text = ProcessWide<Orientation>::get().orientationName(orientation);
     auto now = std::chrono::system_clock::now();
     auto backToStart = std::chrono::duration<double>(startDate_.get().value_or(now) - now).count();
@@ -222,7 +229,8 @@ void MxReportingSession::recordOrientation(std::string_view mode, int orientatio
     Dictionary record;
     record.set(fmt::format("{}_orientation", mode), std::move(text));
     record.set(fmt::format("{}_orientation_time", mode), seconds);
-    appendAggregated(aggregatedPayloadData_, [&](MxReportingAggregationArray& array) { array.append(record); });
+    if (appendAggregated(aggregatedPayloadData_, [&](MxReportingAggregationArray& array) { array.append(record); }))
+        orientationRecords_.fetch_add(1);
 }
 
 std::optional<Dictionary> MxReportingSession::createSummaryEventForSession()
@@ -244,6 +252,8 @@ std::string MxReportingSession::summaryFileName(std::time_t now) const
 
 void MxReportingSession::makePeriodStores()
 {
+    orientationRecords_.store(0);
+    orientationBoundLogged_.store(false);
     auto arena = std::make_shared<MxReportingEncodedArena>();
     aggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>(arena));
     nestedAggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>(arena));
@@ -262,7 +272,7 @@ void MxReportingSession::aggregate(const std::string& identifier, const Dictiona
                      [&](MxReportingAggregationArray& array) { array.appendStoredUnder(identifier, payload); });
 }
 
-void MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArray>& field,
+bool MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArray>& field,
                                           const std::function<void(MxReportingAggregationArray&)>& append)
 {
     // The field is read again under the array's monitor: an append races a stop (or a
@@ -270,12 +280,12 @@ void MxReportingSession::appendAggregated(const MxAtomicProperty<AggregationArra
     for (;;) {
         auto array = field.get();
         if (!array)
-            return;
+            return false;
         std::lock_guard lock(array->monitor());
         auto current = field.get();
         if (current == array) {
             append(*array);
-            return;
+            return true;
         }
     }
 }

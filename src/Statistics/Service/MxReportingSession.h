@@ -40,6 +40,10 @@ public:
     using SendReply = MxReportingSessionUplink::SendReply;
     using AggregationArray = std::shared_ptr<MxReportingAggregationArray>;
 
+    // Orientation changes a period records: a feed flooded with changes costs each
+    // tracked session this many records at most, and one log line.
+    static constexpr int kMaximumOrientationRecords = 1000;
+
     // initWithID:processIdentifiers:
     MxReportingSession(ReporterID reporterID, std::vector<std::int32_t> processIdentifiers);
     ~MxReportingSession();
@@ -118,7 +122,8 @@ private:
     void makePeriodStores();
     // Keeps a message in both stores: as it is, and under its identifier.
     void aggregate(const std::string& identifier, const Dictionary& cleaned);
-    static void appendAggregated(const MxAtomicProperty<AggregationArray>& field,
+    // False when the store is gone (the session stopped).
+    static bool appendAggregated(const MxAtomicProperty<AggregationArray>& field,
                                  const std::function<void(MxReportingAggregationArray&)>& append);
     static void dropAggregated(MxAtomicProperty<AggregationArray>& field);
 
@@ -135,6 +140,8 @@ private:
     MxAtomicProperty<std::string> serviceName_{std::string("unknown")};
     MxAtomicProperty<std::optional<std::string>> orientationCallbackID_;
     MxAtomicProperty<std::optional<Date>> startDate_;
+    std::atomic<int> orientationRecords_{0}; // this period's
+    std::atomic<bool> orientationBoundLogged_{false};
     MxReportingSessionUplink uplink_;
 };
 

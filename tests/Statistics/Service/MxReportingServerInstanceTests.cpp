@@ -309,6 +309,19 @@ TEST_F(MxReportingServerInstanceTest, MessageWithoutIdListReachesEveryStartedSes
     EXPECT_TRUE(platform.uplink.oneShots().empty());
 }
 
+TEST_F(MxReportingServerInstanceTest, ABroadcastsLogLinesNameTheFirstSessionsAndCountTheRest)
+{
+    auto client = connect(1);
+    for (ReporterID id = 1; id <= 40; ++id)
+        create(*client, id);
+    send(*client, Dictionary{{"k", "v"}}, std::nullopt);
+    std::string listed;
+    for (ReporterID id = 1; id <= 16; ++id)
+        listed +=
+            fmt::format("{}<MxReportingSession reporterID={} serviceType=65535 started=NO>", id > 1 ? ", " : "", id);
+    EXPECT_TRUE(platform.log.contains(fmt::format("sessions for client 1 : ({}, and 24 more)", listed)));
+}
+
 TEST_F(MxReportingServerInstanceTest, MessageWithoutIdListAndNoStartedSessionGoesOutOnceAlone)
 {
     auto client = connect(1);

@@ -374,6 +374,20 @@ TEST_F(MxReportingSessionOrientationTest, ASessionRetypedWhileStartedStaysRegist
     EXPECT_EQ(records(*session).size(), 1u);
 }
 
+TEST_F(MxReportingSessionOrientationTest, APeriodRecordsABoundedNumberOfChangesAndSaysSoOnce)
+{
+    auto session = makeSession(5, 7);
+    session->start();
+    for (int i = 0; i < MxReportingSession::kMaximumOrientationRecords + 500; ++i)
+        platform.orientation.change(i % 2 ? "device" : "ui", i % 7);
+    EXPECT_EQ(records(*session).size(), std::size_t(MxReportingSession::kMaximumOrientationRecords));
+    EXPECT_EQ(platform.log.count("reporter 5 recorded 1000 orientation changes this period: later ones are not"), 1u);
+    session->stop();
+    session->start();
+    platform.orientation.change("device", 1);
+    EXPECT_EQ(records(*session).size(), 1u) << "a new period records anew";
+}
+
 TEST_F(MxReportingSessionOrientationTest, ChangesRacingStopsNeverReachADroppedStoreAndNoneWhileStartedIsLost)
 {
     auto session = makeSession(5, 7);
