@@ -644,9 +644,13 @@ void printStatus(const Dictionary& status)
     std::printf("clients: %zu\n", clients ? clients->size() : 0);
     for (const auto& client : clients ? *clients : Array()) {
         const Dictionary& entry = client.asDictionary() ? *client.asDictionary() : Dictionary();
-        std::printf("  pid %lld %s (%lld sessions)\n", static_cast<long long>(get(entry, "pid").int64Value()),
+        double backlog = get(entry, "backlog_bytes").doubleValue();
+        std::string unwritten = backlog > 0 ? ", " + humanBytes(backlog) + " not yet written" : "";
+        if (get(entry, "held_back").boolValue())
+            unwritten += ", held back until it is";
+        std::printf("  pid %lld %s (%lld sessions%s)\n", static_cast<long long>(get(entry, "pid").int64Value()),
                     printable(get(entry, "process")).c_str(),
-                    static_cast<long long>(get(entry, "sessions").int64Value()));
+                    static_cast<long long>(get(entry, "sessions").int64Value()), unwritten.c_str());
     }
     std::printf("sessions started: %lld\nreports received: %lld (%.1f/s)\n",
                 static_cast<long long>(get(status, "sessions_started").int64Value()),

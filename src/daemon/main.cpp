@@ -20,6 +20,7 @@
 #include "Statistics/Service/MxReportingStatus.h"
 #include "daemon/DaemonConfiguration.h"
 #include "daemon/DaemonHeartbeat.h"
+#include "platform/BacklogAccount.h"
 #include "platform/linux/AsioDispatch.h"
 #include "platform/linux/DatagramNotifications.h"
 #include "platform/linux/DatagramOrientation.h"
@@ -250,6 +251,8 @@ int run(int argc, char** argv)
     // (deliveries, single messages, delayed ones at once), before the stores commit.
     listener->stopReading();
     heartbeat.stop();
+    // Clients held back by what they owe run what they sent, too: no more comes.
+    BacklogAccount::forgiveAll();
     if (!dispatch.drain(kDrainBound))
         MXLOG(nullptr, Error, "queues still busy after {} s: committing what they handed over",
               kDrainBound.count() / 1000);

@@ -455,4 +455,29 @@ std::string Value::description() const
     return out;
 }
 
+namespace {
+
+// What std::string holds inside itself before it allocates.
+constexpr std::size_t kInlineText = 15;
+
+std::size_t heapText(const std::string& text) { return text.size() > kInlineText ? text.size() + 1 : 0; }
+
+} // namespace
+
+std::size_t approximateBytes(const Value& value)
+{
+    std::size_t bytes = sizeof(Value);
+    if (const std::string* text = value.asString())
+        bytes += heapText(*text);
+    else if (const Data* data = value.asData())
+        bytes += data->size();
+    else if (const Array* array = value.asArray())
+        for (const auto& item : *array)
+            bytes += approximateBytes(item);
+    else if (const Dictionary* dictionary = value.asDictionary())
+        for (const auto& [key, item] : *dictionary)
+            bytes += sizeof(std::string) + heapText(key) + approximateBytes(item);
+    return bytes;
+}
+
 } // namespace mx

@@ -142,4 +142,8 @@ private:
 
 std::string formatDate(Date date);
 
+// Roughly the memory a value takes, its shared storage counted as its own: what a
+// queue that holds it is charged for.
+std::size_t approximateBytes(const Value& value);
+
 } // namespace mx

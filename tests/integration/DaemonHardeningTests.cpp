@@ -59,6 +59,29 @@ TEST_F(DaemonHardeningTest, HeldStartRepliesNeverStopAClientWhoseSessionsAreBoun
         << "the bound is each client's own";
 }
 
+// One message reaches at most 1024 reporters: a list repeating one ID a million times
+// is refused as a bad argument, not turned into a million reports.
+TEST_F(DaemonHardeningTest, AMessageNamesAtMostAThousandAndTwentyFourReporters)
+{
+    auto client = connect();
+    ASSERT_TRUE(*client->createReportingSession(5).value);
+    auto idsOf = [](std::size_t count) {
+        return Value(Array(std::vector<Value>(count, Value(5))));
+    };
+    auto method = std::string("sendMessage:withCategory:andType:forReportingIDs:reply:");
+    auto refused = client->call(method, Array{Dictionary{{"k", 1}}, 3, 1, idsOf(1'000'000)});
+    ASSERT_TRUE(refused.error);
+    EXPECT_EQ(refused.error->code, 2);
+    EXPECT_EQ(refused.error->message,
+              "argument 4 of " + method + " must be an array of at most 1024 reporter IDs or nil");
+    auto taken = client->call(method, Array{Dictionary{{"k", 1}}, 3, 1, idsOf(1024)});
+    ASSERT_TRUE(taken.value) << (taken.error ? taken.error->message : "");
+    EXPECT_TRUE(taken.value->isNil());
+    EXPECT_TRUE(waitUntil([&] {
+        return daemon.query("tally", "SELECT count(*) FROM events WHERE name LIKE '%Playback.Start'")[0][0] == "1024";
+    }));
+}
+
 // A client names itself (its process name) and fills its payloads: neither reaches a
 // terminal or the log as anything but one printable line.
 TEST_F(DaemonHardeningTest, ControlCharactersFromClientsAreEscapedInTheLogAndTheStatus)

@@ -13,6 +13,11 @@ namespace mx {
 
 namespace {
 
+// The reporters one message may name: each costs the message its sinks' events and a
+// delivery, so a list repeating one ID a million times is no message but a flood.
+constexpr std::size_t kMaximumReporterIDs = 1024;
+constexpr const char* kReporterIDsBound = "an array of at most 1024 reporter IDs or nil";
+
 // Reads the arguments of one request, remembering the first that does not fit.
 class Arguments {
 public:
@@ -59,13 +64,14 @@ public:
         return dictionary(index);
     }
 
-    std::optional<Array> optionalArray(std::size_t index)
+    std::optional<Array> reporterIDs(std::size_t index)
     {
         if (params_[index].isNil())
             return std::nullopt;
-        if (const Array* array = params_[index].asArray())
+        const Array* array = params_[index].asArray();
+        if (array && array->size() <= kMaximumReporterIDs)
             return *array;
-        refuse(index, "an array or nil");
+        refuse(index, array ? kReporterIDsBound : "an array of reporter IDs or nil");
         return std::nullopt;
     }
 
@@ -152,7 +158,7 @@ const std::map<std::string, Operation, std::less<>>& operations()
               auto category =
                   static_cast<MessageCategory>(args.unsignedInteger(1, 0xFFFFFFFF, "an unsigned 32-bit category"));
               auto type = static_cast<MessageType>(args.unsignedInteger(2, 0xFFFF, "an unsigned 16-bit message type"));
-              auto ids = args.optionalArray(3);
+              auto ids = args.reporterIDs(3);
               if (!args.error())
                   service.sendMessage(
                       std::move(payload), category, type, std::move(ids),

@@ -64,15 +64,115 @@ std::string MxReportingServerInstance::description() const
     return fmt::format("<MxReportingServerInstance pid={}>", processIdentifier_);
 }
 
-// Work posted from a connection holds the endpoint weakly: an endpoint that
-// is gone before its request runs leaves nothing to do, and nobody to answer.
-template <class Work>
-void MxReportingServerInstance::enqueue(Work work)
+// A message on its way to its sessions, a step at a time.
+struct MxReportingServerInstance::FanOut {
+    Dictionary payload;
+    MessageCategory category;
+    MessageType type;
+    std::optional<Array> reportingIDs;
+    MxErrorReply reply;
+    bool begun = false;
+    // Without an ID list: the sessions started when the message came.
+    std::vector<std::shared_ptr<MxReportingSession>> sessions;
+    std::size_t next = 0; // the next ID, or the next session
+};
+
+// A start or a stop, which reads the drivers' channels on the way.
+struct MxReportingServerInstance::Sampling {
+    ReporterID reporterID;
+    std::shared_ptr<MxReportingSession> session; // once found
+    std::shared_ptr<MxReportingDriverSnapShot> snapShot;
+    std::optional<Dictionary> statistics;
+};
+
+void MxReportingServerInstance::enqueue(Work work, std::size_t weight)
 {
-    serverQueue_->dispatch([weakSelf = weak_from_this(), work = std::move(work)]() mutable {
-        if (auto self = weakSelf.lock())
-            work(*self);
+    {
+        std::lock_guard lock(pendingMutex_);
+        pending_.push_back({std::move(work), weight});
+        if (std::exchange(scheduled_, true))
+            return;
+    }
+    scheduleTurn();
+}
+
+template <class Handler>
+void MxReportingServerInstance::enqueueOnce(Handler handler)
+{
+    enqueue([handler = std::move(handler)](MxReportingServerInstance& self) mutable {
+        handler(self);
+        return Step::Done;
     });
+}
+
+// A turn holds the endpoint weakly: one that is gone before its turn leaves nothing
+// to do, and nobody to answer.
+void MxReportingServerInstance::scheduleTurn()
+{
+    serverQueue_->dispatch([weakSelf = weak_from_this()] {
+        if (auto self = weakSelf.lock())
+            self->runTurn();
+    });
+}
+
+void MxReportingServerInstance::resume() { scheduleTurn(); }
+
+void MxReportingServerInstance::runTurn()
+{
+    assert(serverQueue_->isCurrent());
+    for (int steps = 0; steps < kStepsPerTurn; ++steps) {
+        if (backlog_->overdrawn()) {
+            // Its next turn comes once what it owes is written; the line stays
+            // scheduled meanwhile, so nothing else starts one.
+            heldBack_.store(true);
+            backlog_->whenSettled([weakSelf = weak_from_this()] {
+                if (auto self = weakSelf.lock()) {
+                    self->heldBack_.store(false);
+                    self->scheduleTurn();
+                }
+            });
+            return;
+        }
+        Pending* next = nullptr;
+        {
+            std::lock_guard lock(pendingMutex_);
+            if (pending_.empty()) {
+                scheduled_ = false;
+                return;
+            }
+            next = &pending_.front();
+        }
+        Step step = Step::Done;
+        {
+            ScopedBacklogAccount charging(backlog_, next->weight);
+            step = next->work(*this);
+        }
+        if (step == Step::Wait)
+            return;
+        if (step == Step::Done) {
+            Pending done;
+            std::lock_guard lock(pendingMutex_);
+            done = std::move(pending_.front());
+            pending_.pop_front();
+        }
+    }
+    scheduleTurn();
+}
+
+bool MxReportingServerInstance::sampleElsewhere(UniqueFunction<void()> sample)
+{
+    auto root = delegate_.lock();
+    auto queue = root ? root->driverSamplingQueue() : nullptr;
+    if (!queue) {
+        sample();
+        return false;
+    }
+    queue->dispatch([weakSelf = weak_from_this(), sample = std::move(sample)]() mutable {
+        sample();
+        if (auto self = weakSelf.lock())
+            self->resume();
+    });
+    return true;
 }
 
 std::shared_ptr<MxReportingSession> MxReportingServerInstance::findReportingSessionForID(ReporterID reporterID,
@@ -93,7 +193,7 @@ std::shared_ptr<MxReportingSession> MxReportingServerInstance::findReportingSess
 void MxReportingServerInstance::createReportingSession(ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "creating session for reporter {}", reporterID);
-    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueueOnce([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleCreate(reporterID, reply);
     });
 }
@@ -101,7 +201,7 @@ void MxReportingServerInstance::createReportingSession(ReporterID reporterID, Mx
 void MxReportingServerInstance::setServiceType(ServiceType serviceType, ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "setting service type {} for reporter {}", serviceType, reporterID);
-    enqueue([serviceType, reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueueOnce([serviceType, reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleSetServiceType(serviceType, reporterID, reply);
     });
 }
@@ -111,7 +211,7 @@ void MxReportingServerInstance::getServiceNameForReporterID(ReporterID reporterI
     // Intended: the log texts of this endpoint keep their spelling ("seviceType",
     // "returnning", the doubled space), which log searches rely on.
     MXLOG_VERBOSE(logScope(), "fetching seviceType");
-    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueueOnce([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleGetServiceName(reporterID, reply);
     });
 }
@@ -120,16 +220,17 @@ void MxReportingServerInstance::setConfiguration(std::optional<Dictionary> confi
                                                  MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "setting configuration");
-    enqueue([configuration = std::move(configuration), reporterID, reply = std::move(reply)](
-                MxReportingServerInstance& self) { self.handleSetConfiguration(configuration, reporterID, reply); });
+    enqueueOnce([configuration = std::move(configuration), reporterID,
+                 reply = std::move(reply)](MxReportingServerInstance& self) {
+        self.handleSetConfiguration(configuration, reporterID, reply);
+    });
 }
 
 void MxReportingServerInstance::startReportingSessionForID(ReporterID reporterID, MxHeldReply reply)
 {
     MXLOG_VERBOSE(logScope(), "starting session for reporter {}", reporterID);
-    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
-        self.handleStart(reporterID, reply);
-    });
+    enqueue([start = std::make_shared<Sampling>(Sampling{reporterID, nullptr, nullptr, std::nullopt}),
+             reply = std::move(reply)](MxReportingServerInstance& self) { return self.handleStart(start, reply); });
 }
 
 void MxReportingServerInstance::sendMessage(Dictionary payload, MessageCategory category, MessageType type,
@@ -137,24 +238,24 @@ void MxReportingServerInstance::sendMessage(Dictionary payload, MessageCategory 
 {
     MXLOG_VERBOSE(logScope(), "sending message for reporter {}",
                   reportingIDs ? Value(*reportingIDs).description() : std::string("(null)"));
-    enqueue([payload = std::move(payload), category, type, reportingIDs = std::move(reportingIDs),
-             reply = std::move(reply)](MxReportingServerInstance& self) {
-        self.handleSendMessage(payload, category, type, reportingIDs, reply);
-    });
+    // What each row and delivery it leaves behind is charged: the payload they share.
+    std::size_t weight = approximateBytes(Value(payload));
+    enqueue([message = FanOut{std::move(payload), category, type, std::move(reportingIDs), std::move(reply)}](
+                MxReportingServerInstance& self) mutable { return self.handleSendMessage(message); },
+            weight);
 }
 
 void MxReportingServerInstance::stopReportingSessionForID(ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "stopping session for reporter {}", reporterID);
-    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
-        self.handleStop(reporterID, reply);
-    });
+    enqueue([stop = std::make_shared<Sampling>(Sampling{reporterID, nullptr, nullptr, std::nullopt}),
+             reply = std::move(reply)](MxReportingServerInstance& self) { return self.handleStop(stop, reply); });
 }
 
 void MxReportingServerInstance::destroyReportingSession(ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "destroying session for reporter {}", reporterID);
-    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueueOnce([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleDestroy(reporterID, reply);
     });
 }
@@ -162,14 +263,14 @@ void MxReportingServerInstance::destroyReportingSession(ReporterID reporterID, M
 void MxReportingServerInstance::reporterID(ReporterID reporterID, MxDictionaryReply valid)
 {
     MXLOG_VERBOSE(logScope(), "validating reporter {}", reporterID);
-    enqueue([reporterID, valid = std::move(valid)](MxReportingServerInstance& self) {
+    enqueueOnce([reporterID, valid = std::move(valid)](MxReportingServerInstance& self) {
         self.handleValid(reporterID, valid);
     });
 }
 
 void MxReportingServerInstance::getAllReporters(MxReportersReply reply)
 {
-    enqueue([reply = std::move(reply)](MxReportingServerInstance& self) { self.handleGetAllReporters(reply); });
+    enqueueOnce([reply = std::move(reply)](MxReportingServerInstance& self) { self.handleGetAllReporters(reply); });
 }
 
 void MxReportingServerInstance::killService(MxBoolReply)
@@ -180,7 +281,7 @@ void MxReportingServerInstance::killService(MxBoolReply)
 
 void MxReportingServerInstance::handleConnectionError()
 {
-    enqueue([](MxReportingServerInstance& self) { self.handleDisconnection(); });
+    enqueueOnce([](MxReportingServerInstance& self) { self.handleDisconnection(); });
 }
 
 // ---- Work: server queue.
@@ -232,62 +333,90 @@ void MxReportingServerInstance::handleSetConfiguration(const std::optional<Dicti
     reply(true);
 }
 
-void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxHeldReply& reply)
+MxReportingServerInstance::Step MxReportingServerInstance::handleStart(const std::shared_ptr<Sampling>& start,
+                                                                       const MxHeldReply& reply)
 {
-    MxTrace(kTraceStart);
-    if (reporterID == 0) {
-        reply(true);
-        return;
+    if (!start->session) {
+        MxTrace(kTraceStart);
+        if (start->reporterID == 0) {
+            reply(true);
+            return Step::Done;
+        }
+        auto session = findReportingSessionForID(start->reporterID, true);
+        if (!session || session->started()) {
+            reply(true);
+            return Step::Done;
+        }
+        session->start();
+        start->session = session;
+        reply.hold();
+        // The snapshot is taken where reading the channels holds up no other client;
+        // this client's later requests wait for it, as they would have in place.
+        if (auto root = delegate_.lock()) {
+            root->noteSessionStarted();
+            if (sampleElsewhere([start, root] { start->snapShot = root->getSnapShot(); }))
+                return Step::Wait;
+        }
     }
-    auto session = findReportingSessionForID(reporterID, true);
-    if (!session || session->started()) {
-        reply(true);
-        return;
-    }
-    session->start();
-    if (auto root = delegate_.lock()) {
-        root->noteSessionStarted();
-        session->setDriverSnapShot(root->getSnapShot());
-    }
-    reply.hold();
-    session->parkTransactionCompleteBlock(reply);
+    start->session->setDriverSnapShot(start->snapShot);
+    start->session->parkTransactionCompleteBlock(reply);
+    return Step::Done;
 }
 
-void MxReportingServerInstance::handleSendMessage(const Dictionary& payload, MessageCategory category, MessageType type,
-                                                  const std::optional<Array>& reportingIDs, const MxErrorReply& reply)
+MxReportingServerInstance::Step MxReportingServerInstance::handleSendMessage(FanOut& message)
 {
+    if (!message.begun && !beginSendMessage(message))
+        return Step::Done;
+    if (message.reportingIDs) {
+        const Array& ids = *message.reportingIDs;
+        for (std::size_t end = std::min(message.next + kSessionsPerStep, ids.size()); message.next < end;
+             ++message.next) {
+            ReporterID reporterID = ids[message.next].int64Value();
+            if (reporterID == 0)
+                continue;
+            auto session = findReportingSessionForID(reporterID, true);
+            if (!session)
+                continue;
+            Dictionary userInfo = session->userInfo()->snapshot();
+            MxReportingTallyBridge::handleEvent(message.payload, message.category, message.type, userInfo);
+            MxReportingJouleUtility::handleEvent(message.payload, message.category, message.type, userInfo);
+            session->sendMessage(message.payload, message.category, message.type, nullptr);
+        }
+        if (message.next < ids.size())
+            return Step::Again;
+    } else {
+        const auto& sessions = message.sessions;
+        for (std::size_t end = std::min(message.next + kSessionsPerStep, sessions.size()); message.next < end;
+             ++message.next) {
+            const auto& session = sessions[message.next];
+            // Stopped since the message came: it is as if the stop came first.
+            if (!session->started())
+                continue;
+            session->sendMessage(message.payload, message.category, message.type, nullptr);
+            Dictionary userInfo = session->userInfo()->snapshot();
+            MxReportingTallyBridge::handleEvent(message.payload, message.category, message.type, userInfo);
+            MxReportingJouleUtility::handleEvent(message.payload, message.category, message.type, userInfo);
+        }
+        if (message.next < sessions.size())
+            return Step::Again;
+    }
+    message.reply(std::nullopt);
+    return Step::Done;
+}
+
+bool MxReportingServerInstance::beginSendMessage(FanOut& message)
+{
+    message.begun = true;
     MxTrace(kTraceMessage);
     auto root = delegate_.lock();
     if (!root || !root->isReportingEnabled()) {
-        reply(MxReportingError{kMxReportingErrorDomain, kMxReportingDisabledErrorCode});
-        return;
+        message.reply(MxReportingError{kMxReportingErrorDomain, kMxReportingDisabledErrorCode});
+        return false;
     }
     root->noteReportReceived();
-    if (!reportingIDs) {
-        sendToStartedSessions(payload, category, type, *root);
-        reply(std::nullopt);
-        return;
-    }
-    for (const Value& element : *reportingIDs) {
-        ReporterID reporterID = element.int64Value();
-        if (reporterID == 0)
-            continue;
-        auto session = findReportingSessionForID(reporterID, true);
-        if (!session)
-            continue;
-        Dictionary userInfo = session->userInfo()->snapshot();
-        MxReportingTallyBridge::handleEvent(payload, category, type, userInfo);
-        MxReportingJouleUtility::handleEvent(payload, category, type, userInfo);
-        session->sendMessage(payload, category, type, nullptr);
-    }
-    reply(std::nullopt);
-}
-
-void MxReportingServerInstance::sendToStartedSessions(const Dictionary& payload, MessageCategory category,
-                                                      MessageType type, MxReportingServiceDelegateProtocol& root)
-{
-    std::vector<std::shared_ptr<MxReportingSession>> active;
-    for (const auto& client : root.getAllClients()) {
+    if (message.reportingIDs)
+        return true;
+    for (const auto& client : root->getAllClients()) {
         std::vector<std::shared_ptr<MxReportingSession>> sessions;
         for (const auto& [id, session] : client->clientReportingSessionMap())
             sessions.push_back(session);
@@ -295,48 +424,56 @@ void MxReportingServerInstance::sendToStartedSessions(const Dictionary& payload,
               describeSessions(sessions));
         for (auto& session : sessions)
             if (session->started())
-                active.push_back(std::move(session));
+                message.sessions.push_back(std::move(session));
     }
-    MXLOG(logScope(), Default, "active reporting sessions {} : {}", active.size(), describeSessions(active));
-
-    if (active.empty()) {
-        MXLOG(logScope(), Default, "no active reporting sessions found, sending as standalone");
-        auto defaults = root.getDefaults();
-        MxReportingSession::sendSingleMessage(payload, category, type, service_type::kStandalone,
-                                              defaults ? &*defaults : nullptr, nullptr);
-        return;
-    }
-    for (const auto& session : active) {
-        session->sendMessage(payload, category, type, nullptr);
-        Dictionary userInfo = session->userInfo()->snapshot();
-        MxReportingTallyBridge::handleEvent(payload, category, type, userInfo);
-        MxReportingJouleUtility::handleEvent(payload, category, type, userInfo);
-    }
+    MXLOG(logScope(), Default, "active reporting sessions {} : {}", message.sessions.size(),
+          describeSessions(message.sessions));
+    if (!message.sessions.empty())
+        return true;
+    MXLOG(logScope(), Default, "no active reporting sessions found, sending as standalone");
+    auto defaults = root->getDefaults();
+    MxReportingSession::sendSingleMessage(message.payload, message.category, message.type, service_type::kStandalone,
+                                          defaults ? &*defaults : nullptr, nullptr);
+    message.reply(std::nullopt);
+    return false;
 }
 
-void MxReportingServerInstance::handleStop(ReporterID reporterID, const MxBoolReply& reply)
+MxReportingServerInstance::Step MxReportingServerInstance::handleStop(const std::shared_ptr<Sampling>& stop,
+                                                                      const MxBoolReply& reply)
 {
-    MxTrace(kTraceStop);
-    if (reporterID == 0) {
-        reply(true);
-        return;
+    if (!stop->session) {
+        MxTrace(kTraceStop);
+        if (stop->reporterID == 0) {
+            reply(true);
+            return Step::Done;
+        }
+        stop->session = findReportingSessionForID(stop->reporterID, false);
+        if (!stop->session) {
+            MXLOG(logScope(), Default, "stopping {}", stop->reporterID);
+            reply(true);
+            return Step::Done;
+        }
+        auto root = delegate_.lock();
+        if (root && sampleElsewhere([stop, root] {
+                stop->statistics = root->getDriverStatisticsRelativeToSnapShot(stop->session->driverSnapShot());
+            }))
+            return Step::Wait;
     }
-    if (auto session = findReportingSessionForID(reporterID, false)) {
-        sendDriverStatistics(*session);
-        session->setDriverSnapShot(nullptr);
-        session->stop();
-        session->completeTransaction();
-    }
-    MXLOG(logScope(), Default, "stopping {}", reporterID);
+    auto& session = *stop->session;
+    sendDriverStatistics(session, stop->statistics);
+    session.setDriverSnapShot(nullptr);
+    session.stop();
+    session.completeTransaction();
+    MXLOG(logScope(), Default, "stopping {}", stop->reporterID);
     reply(true);
+    return Step::Done;
 }
 
 // The drivers' growth goes to the session and to analytics, deliberately not to the
 // power log.
-void MxReportingServerInstance::sendDriverStatistics(MxReportingSession& session)
+void MxReportingServerInstance::sendDriverStatistics(MxReportingSession& session,
+                                                     const std::optional<Dictionary>& statistics)
 {
-    auto root = delegate_.lock();
-    auto statistics = root ? root->getDriverStatisticsRelativeToSnapShot(session.driverSnapShot()) : std::nullopt;
     if (!statistics) {
         MXLOG(logScope(), Default, "nothing interesting to fetch from the drivers");
         return;

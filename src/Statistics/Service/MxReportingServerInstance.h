@@ -3,12 +3,19 @@
 // sessions its client creates, and reaches other clients' sessions, the reporting
 // switch and the driver statistics through the service root (held weakly).
 // Requests enter on the connection layer's threads, where they are only logged and
-// queued; everything else, the session map included, lives on the one serial server
-// queue.
+// queued on the endpoint's own line; everything else, the session map included, lives
+// on the one serial server queue, where each client's requests run in turns, in the
+// order they came: a few at a time, then the other clients' turns. A client whose
+// reports wait unwritten past its backlog bound gets no turn until they are written,
+// and a request whose work is long (a message to many sessions, reading the drivers'
+// channels) takes several, so no client keeps the others waiting.
 
+#include <atomic>
 #include <cstdint>
+#include <deque>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 
@@ -16,7 +23,9 @@
 #include "Statistics/Service/MxReportingServiceDelegateProtocol.h"
 #include "Statistics/Service/MxReportingServiceProtocol.h"
 #include "Statistics/Service/MxReportingSession.h"
+#include "platform/BacklogAccount.h"
 #include "platform/MxLog.h"
+#include "platform/UniqueFunction.h"
 #include "platform/WorkQueue.h"
 
 namespace mx {
@@ -30,6 +39,14 @@ public:
     // reply) until it is destroyed or its client leaves. A create beyond it makes
     // nothing, answers true like any create that makes nothing, and says so in the log.
     static constexpr std::size_t kMaximumSessions = 1024;
+    // What a client may owe the stores and their queues before its requests wait
+    // (BacklogAccount): a few milliseconds of the stores' work, enough to keep them
+    // busy while it is the only client.
+    static constexpr std::size_t kBacklogBound = std::size_t{2} << 20;
+    // Steps of one client's requests run in a turn before the others' turns come.
+    static constexpr int kStepsPerTurn = 16;
+    // Sessions a message reaches in one step.
+    static constexpr std::size_t kSessionsPerStep = 64;
 
     // initWithPID:delegate:
     MxReportingServerInstance(std::int32_t processIdentifier,
@@ -71,23 +88,47 @@ public:
     void handleConnectionError();
 
     std::string description() const;
+    // Bytes its client owes the stores and their queues now, and whether its requests
+    // wait for them to be written.
+    std::size_t backlogBytes() const { return backlog_->owed(); }
+    bool heldBack() const { return heldBack_.load(); }
 
 private:
-    template <class Work>
-    void enqueue(Work work);
+    // Where a request's work stands after a step: done; more steps to come, after the
+    // other clients' turns; or waiting until something else resumes the endpoint.
+    enum class Step { Done, Again, Wait };
+    using Work = UniqueFunction<Step(MxReportingServerInstance&)>;
+    struct Pending {
+        Work work;
+        std::size_t weight; // what each item it queues for the stores is charged
+    };
+    struct FanOut;
+    struct Sampling;
+
+    // Queues `work` on this endpoint's line; any thread.
+    void enqueue(Work work, std::size_t weight = 0);
+    template <class Handler>
+    void enqueueOnce(Handler handler);
+    void scheduleTurn();
+    void runTurn();
+    // Gives a waiting request its next step.
+    void resume();
+    // Runs `sample` where the drivers' channels are read and resumes the endpoint after
+    // it: true, and the request waits. False when there is nowhere else (no driver has
+    // channels): then it has run in place.
+    bool sampleElsewhere(UniqueFunction<void()> sample);
 
     void handleCreate(ReporterID reporterID, const MxBoolReply& reply);
     void handleSetServiceType(ServiceType serviceType, ReporterID reporterID, const MxBoolReply& reply);
     void handleGetServiceName(ReporterID reporterID, const MxServiceTypeReply& reply);
     void handleSetConfiguration(const std::optional<Dictionary>& configuration, ReporterID reporterID,
                                 const MxBoolReply& reply);
-    void handleStart(ReporterID reporterID, const MxHeldReply& reply);
-    void handleSendMessage(const Dictionary& payload, MessageCategory category, MessageType type,
-                           const std::optional<Array>& reportingIDs, const MxErrorReply& reply);
-    void sendToStartedSessions(const Dictionary& payload, MessageCategory category, MessageType type,
-                               MxReportingServiceDelegateProtocol& root);
-    void handleStop(ReporterID reporterID, const MxBoolReply& reply);
-    void sendDriverStatistics(MxReportingSession& session);
+    Step handleStart(const std::shared_ptr<Sampling>& start, const MxHeldReply& reply);
+    Step handleSendMessage(FanOut& message);
+    // The first step of a message: false when that is all there is to it.
+    bool beginSendMessage(FanOut& message);
+    Step handleStop(const std::shared_ptr<Sampling>& stop, const MxBoolReply& reply);
+    void sendDriverStatistics(MxReportingSession& session, const std::optional<Dictionary>& statistics);
     void handleDestroy(ReporterID reporterID, const MxBoolReply& reply);
     void handleValid(ReporterID reporterID, const MxDictionaryReply& reply);
     void handleGetAllReporters(const MxReportersReply& reply);
@@ -99,6 +140,14 @@ private:
     SessionMap clientReportingSessionMap_;
     const std::weak_ptr<MxReportingServiceDelegateProtocol> delegate_;
     const std::shared_ptr<WorkQueue> serverQueue_;
+    const std::shared_ptr<BacklogAccount> backlog_ = std::make_shared<BacklogAccount>(kBacklogBound);
+    std::atomic<bool> heldBack_{false};
+
+    std::mutex pendingMutex_;
+    std::deque<Pending> pending_;
+    // From the first request queued until the line is empty again: a turn is on the
+    // server queue, or running, or the line waits (held back, or on a request).
+    bool scheduled_ = false;
 };
 
 } // namespace mx

@@ -24,6 +24,9 @@ std::shared_ptr<MxReportingServiceDelegate> MxReportingServiceDelegate::make(Pre
         new MxReportingServiceDelegate(preferences, notifications, processTable));
     root->listenForDefaultsNotification();
     root->driverUtility_ = std::make_unique<MxReportingDriverUtility>(chanstat);
+    if (!root->driverUtility_->ioChannelSubscriptions().empty())
+        root->driverSamplingQueue_ = ProcessWide<Dispatch>::get().makeSerialQueue(
+            "com.kestrel.harmonia.reporting.drivers", QueuePriority::Utility);
     return root;
 }
 
@@ -164,7 +167,9 @@ Array MxReportingServiceDelegate::clientsStatus() const
     for (const auto& client : clients_)
         clients.emplace_back(Dictionary{{"pid", client->processIdentifier()},
                                         {"process", client->clientProcessName().value_or("")},
-                                        {"sessions", client->clientReportingSessionMap().size()}});
+                                        {"sessions", client->clientReportingSessionMap().size()},
+                                        {"backlog_bytes", client->backlogBytes()},
+                                        {"held_back", client->heldBack()}});
     return Array(std::move(clients));
 }
 

@@ -46,6 +46,7 @@ public:
     bool isReportingEnabled() override { return reportingEnabled_.load(); }
     std::shared_ptr<MxReportingSession> findReportingSessionForID(ReporterID reporterID) override;
     std::shared_ptr<MxReportingDriverSnapShot> getSnapShot() override;
+    std::shared_ptr<WorkQueue> driverSamplingQueue() override { return driverSamplingQueue_; }
     std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
         const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) override;
     void removeClient(const MxReportingServerInstance& client) override;
@@ -56,7 +57,8 @@ public:
     // answered with it. The view is set once, before the first connection.
     std::uint64_t sessionsStarted() const { return sessionsStarted_.load(std::memory_order_relaxed); }
     std::uint64_t reportsReceived() const { return reportsReceived_.load(std::memory_order_relaxed); }
-    // Server queue only: {pid, process, sessions} of each connected client.
+    // Server queue only: {pid, process, sessions, backlog_bytes, held_back} of each
+    // connected client.
     Array clientsStatus() const;
     void setStatusView(std::function<Dictionary()> view) { statusView_ = std::move(view); }
     // Answers `reply` with the status view, built on the server queue.
@@ -81,6 +83,7 @@ private:
     std::shared_ptr<WorkQueue> serverQueue_;
     // Made last at start-up, after the notification registration; read-only after.
     std::unique_ptr<MxReportingDriverUtility> driverUtility_;
+    std::shared_ptr<WorkQueue> driverSamplingQueue_; // made with it, when it has channels
     std::recursive_mutex lock_;
 
     std::atomic<bool> reportingEnabled_{true};

@@ -12,6 +12,7 @@
 #include "Statistics/MxReportingDriverUtility.h"
 #include "Statistics/MxReportingVocabulary.h"
 #include "platform/Value.h"
+#include "platform/WorkQueue.h"
 
 namespace mx {
 
@@ -30,6 +31,10 @@ public:
     // The first session of that ID in any client; nothing for ID 0 or while reporting is off.
     virtual std::shared_ptr<MxReportingSession> findReportingSessionForID(ReporterID reporterID) = 0;
     virtual std::shared_ptr<MxReportingDriverSnapShot> getSnapShot() = 0;
+    // Where the drivers' channel files are read: off the server queue, since reading
+    // takes as long as there are channels. Nothing when no driver has any (sampling
+    // then costs nothing, and is done in place).
+    virtual std::shared_ptr<WorkQueue> driverSamplingQueue() = 0;
     virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
         const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) = 0;
     virtual void removeClient(const MxReportingServerInstance& client) = 0;

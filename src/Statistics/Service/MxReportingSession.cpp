@@ -5,6 +5,7 @@
 #include <fmt/format.h>
 
 #include "Statistics/Service/MxReportingSessionSummary.h"
+#include "platform/BacklogAccount.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Orientation.h"
 #include "platform/TracePoints.h"
@@ -169,9 +170,12 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
 
     // Whether the message goes in-session or alone is decided now, not at delivery.
     bool wasStarted = started();
-    uplinkQueue()->dispatch([self = shared_from_this(), cleaned, message, wasStarted, category, type] {
-        self->uplink_.deliver(self->serviceType(), cleaned, message, wasStarted, category, type, *self->userInfo_);
-    });
+    // Owed by the client that sent it until delivered, and so is what the delivery writes.
+    uplinkQueue()->dispatch(
+        [self = shared_from_this(), cleaned, message, wasStarted, category, type, debt = BacklogDebt::incur()] {
+            ScopedBacklogAccount charging(debt);
+            self->uplink_.deliver(self->serviceType(), cleaned, message, wasStarted, category, type, *self->userInfo_);
+        });
     if (reply)
         reply(std::nullopt);
 }

@@ -5,6 +5,7 @@
 
 #include "Statistics/MxReportingUtilityWait.h"
 #include "Statistics/Service/MxReportingSession.h"
+#include "platform/BacklogAccount.h"
 #include "platform/MxLog.h"
 #include "platform/TracePoints.h"
 
@@ -142,7 +143,10 @@ void MxReportingSessionUplink::sendSingleMessage(const Dictionary& message, Mess
     std::int64_t delta = serviceType == service_type::kAlarms ? randomAlarmDelaySeconds() : 0;
     MXLOG_VERBOSE(logScope(), "sending single message after delta {} for service {}", delta, serviceType);
 
-    auto send = [message, category, type, serviceType, reply = std::move(reply)]() mutable {
+    // Owed by the client that sent it while it waits, up to 59 s for an alarm.
+    auto send = [message, category, type, serviceType, reply = std::move(reply),
+                 debt = BacklogDebt::incur()]() mutable {
+        ScopedBacklogAccount charging(debt);
         MxTrace(kTraceMessageQueued);
         MXLOG_VERBOSE(logScope(), "sending single message");
         Dictionary sessionInfo{

@@ -12,7 +12,6 @@
 
 #include "platform/JsonValue.h"
 #include "platform/MxLog.h"
-#include "platform/WorkQueue.h"
 
 namespace mx {
 
@@ -165,22 +164,8 @@ SqliteStore::~SqliteStore()
 
 void SqliteStore::submit(SqliteWrite write)
 {
-    std::unique_lock lock(mutex_);
-    auto hasRoom = [&] {
-        return queue_.size() < kQueueBound || stopping_;
-    };
-    // A writer that keeps up makes room within a batch; one that cannot write (a
-    // full disk) may not for long, and then the caller's pool lends a thread
-    // meanwhile, so that the connections it serves are still read and written.
-    if (!hasRoom() && !changed_.wait_for(lock, kShortWait, hasRoom)) {
-        if (failing_ && !std::exchange(holdingCallersLogged_, true))
-            MXLOG(nullptr, Error, "{}: {} rows wait to be written: callers wait until it can write again",
-                  path_.string(), queue_.size());
-        std::optional<ScopedBlockingCall> blocking;
-        if (ProcessWide<Dispatch>::installed())
-            blocking.emplace();
-        changed_.wait(lock, hasRoom);
-    }
+    write.debt = BacklogDebt::incur();
+    std::lock_guard lock(mutex_);
     queue_.push_back(std::move(write));
     ++submitted_;
     if (writerWaiting_)
@@ -216,16 +201,19 @@ void SqliteStore::run()
             batch.push_back(std::move(queue_.front()));
             queue_.pop_front();
         }
-        changed_.notify_all(); // room in the queue again
         lock.unlock();
         write(batch);
+        std::size_t written = batch.size();
+        // The rows' debts settle now, outside the lock: a client held back by them is
+        // resumed from here.
+        batch.clear();
         // Age is looked at now and then; size after every batch, which costs three
         // page counts, so that a burst never takes the store far past its bound.
         if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval ||
             (retention_.maxBytes > 0 && connection_.database && dataBytes() > retention_.maxBytes))
             prune();
         lock.lock();
-        committed_ += batch.size();
+        committed_ += written;
         changed_.notify_all();
     }
 }
@@ -335,18 +323,15 @@ void SqliteStore::write(std::deque<SqliteWrite>& batch)
                 return;
             MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts,
                   describe(std::chrono::steady_clock::now() - began));
-            std::lock_guard lock(mutex_);
-            failing_ = false;
-            holdingCallersLogged_ = false;
             return;
         }
         std::unique_lock lock(mutex_);
         ++failures_;
-        failing_ = true;
         if (attempts++ == 0)
             MXLOG(nullptr, Error,
-                  "{}: cannot write ({}); holding {} rows and retrying, callers wait while {} more queue",
-                  path_.string(), error, batch.size(), kQueueBound);
+                  "{}: cannot write ({}); holding {} rows and retrying: the clients that sent them wait until it "
+                  "can write again",
+                  path_.string(), error, batch.size() + queue_.size());
         // Only a store being destroyed gives up, and says what it could not keep.
         if (stopping_ && attempts > 1) {
             MXLOG(nullptr, Error, "{}: closing with {} rows that could not be written: {}", path_.string(),

@@ -1,11 +1,15 @@
 #pragma once
 // An embedded SQLite store written in batches on a writer thread of its own. Callers
-// hand over rows and go on; they wait only while the bounded queue in front of the
-// writer is full, so nothing is ever dropped. WAL journaling keeps every committed
-// batch across a crash; destruction commits everything handed over before.
+// hand over rows and go on, never waiting: each row is a debt on the account of the
+// client whose request made it (BacklogAccount), settled once the row is committed,
+// and a client whose rows wait unwritten past its bound is taken no further request
+// from. So the queue is bounded by what its clients may owe, nothing is ever dropped,
+// and a slow store holds back the clients that fill it and no other.
+// WAL journaling keeps every committed batch across a crash; destruction commits
+// everything handed over before.
 // Failure policy: a batch that cannot be written (full or read-only disk, the file
-// removed) is held and retried with backoff until it commits, while the queue fills
-// and callers wait; the failure is logged when it starts and when it clears. A file
+// removed) is held and retried with backoff until it commits, while its clients'
+// debts stay; the failure is logged when it starts and when it clears. A file
 // removed while open is noticed and made anew; a corrupt file found at open is set
 // aside and a fresh store made.
 // Thread-safe: any thread may submit.
@@ -24,6 +28,7 @@
 #include <variant>
 #include <vector>
 
+#include "platform/BacklogAccount.h"
 #include "platform/UniqueFunction.h"
 #include "platform/Value.h"
 
@@ -62,16 +67,14 @@ struct SqliteRetention {
 struct SqliteWrite {
     std::size_t statement; // index into the statements given at open
     std::vector<SqliteValue> parameters;
+    BacklogDebt debt = {}; // owed by the client whose request made the row, until committed
 };
 
 class SqliteStore {
 public:
-    static constexpr std::size_t kQueueBound = 65536;
-    // A batch stays short enough that a caller waiting on a full queue gets room back
+    // A batch stays short enough that a client held back by its rows gets room back
     // within a millisecond or two, not after a commit of thousands of rows.
     static constexpr std::size_t kBatchLimit = 512;
-    // How long a caller waits for room before its wait counts as a blocking one.
-    static constexpr std::chrono::milliseconds kShortWait{100};
     // How long the writer lets a batch gather once the first row of it arrived: a
     // thousand rows a millisecond cost one transaction and one wake-up, not a thousand.
     static constexpr std::chrono::milliseconds kBatchWindow{2};
@@ -103,6 +106,7 @@ public:
     SqliteStore(const SqliteStore&) = delete;
     SqliteStore& operator=(const SqliteStore&) = delete;
 
+    // Charges the row to the account named on this thread (BacklogAccount).
     void submit(SqliteWrite write);
     // Waits until everything submitted before the call is committed.
     void flush();
@@ -158,8 +162,6 @@ private:
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
     std::uint64_t failures_ = 0;
-    bool failing_ = false;              // from a failed write until one succeeds
-    bool holdingCallersLogged_ = false; // once per failing spell
     bool stopping_ = false;
     bool writerWaiting_ = false;
     std::thread writer_;

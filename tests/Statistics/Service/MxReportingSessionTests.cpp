@@ -392,9 +392,12 @@ TEST_F(MxReportingSessionOrientationTest, ChangesRacingStopsNeverReachADroppedSt
 {
     auto session = makeSession(5, 7);
     std::atomic<bool> done{false};
+    // Paced, so that a period never reaches its bound of records.
     std::thread toolbox([&] {
-        while (!done.load())
+        while (!done.load()) {
             platform.orientation.change("ui", 2);
+            std::this_thread::sleep_for(std::chrono::microseconds(1));
+        }
     });
     for (int period = 0; period < 200 && !HasFailure(); ++period) {
         session->start();

@@ -56,11 +56,16 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
     };
     tally->sendEventLazy("com.kestrel.harmonia.DriverStats.Generic", build);
     tally->sendEventLazy("exact.name", build);
-    // More than the bounded queue holds: the caller waits, nothing is dropped.
-    const int events = SqliteStore::kQueueBound + 1000;
-    for (int i = 0; i < events; ++i)
-        tally->sendEventLazy("com.kestrel.harmonia.Playback.Start", build);
+    // Each row is owed by the client whose request made it, until it is committed.
+    auto account = std::make_shared<BacklogAccount>(std::size_t{1} << 20);
+    const int events = 70000;
+    {
+        ScopedBacklogAccount charging(account, 100);
+        for (int i = 0; i < events; ++i)
+            tally->sendEventLazy("com.kestrel.harmonia.Playback.Start", build);
+    }
     tally->store().flush();
+    EXPECT_EQ(account->owed(), 0u);
     EXPECT_EQ(built, events);
     EXPECT_EQ(count("SELECT count(*) FROM events"), events);
     EXPECT_EQ(count("SELECT count(*) FROM events WHERE payload = '{\"k\":\"v\",\"when\":\"1970-01-01T00:00:00Z\"}'"),
