@@ -7,6 +7,7 @@
 #include <map>
 #include <mutex>
 #include <sys/prctl.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 
 #include <gmock/gmock.h>
@@ -80,6 +81,32 @@ TEST_F(DaemonHardeningTest, AMessageNamesAtMostAThousandAndTwentyFourReporters)
     EXPECT_TRUE(waitUntil([&] {
         return daemon.query("tally", "SELECT count(*) FROM events WHERE name LIKE '%Playback.Start'")[0][0] == "1024";
     }));
+}
+
+// A store's bound is what an operator sees with du: the database, its log and the log's
+// index together, however much was sent.
+TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("etc/harmonia/stores.json", R"({"tally": {"max_bytes": 1048576}})");
+    daemon.start();
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(*client->createReportingSession(5).value);
+    Dictionary report{{"filler", std::string(500, 'f')}};
+    for (int i = 0; i < 10000; ++i)
+        client->sendMessage(report, 3, 1, std::vector<ReporterID>{5}, nullptr);
+    ASSERT_TRUE(client->sendMessage(report, 3, 1, std::vector<ReporterID>{5}));
+    ASSERT_TRUE(daemon.waitForLog("tally.db: pruned"));
+    auto onDisk = [&] {
+        std::uintmax_t bytes = 0;
+        for (const char* suffix : {"", "-wal", "-shm"}) {
+            struct stat file {};
+            if (::stat(daemon.path(std::string("var/lib/harmonia/tally.db") + suffix).c_str(), &file) == 0)
+                bytes += std::uintmax_t(file.st_blocks) * 512;
+        }
+        return bytes;
+    };
+    EXPECT_TRUE(waitUntil([&] { return onDisk() <= 1048576; })) << onDisk() << " bytes";
 }
 
 // A client names itself (its process name) and fills its payloads: neither reaches a

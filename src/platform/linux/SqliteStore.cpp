@@ -1,5 +1,6 @@
 #include "platform/linux/SqliteStore.h"
 
+#include <algorithm>
 #include <chrono>
 #include <ctime>
 #include <pthread.h>
@@ -194,8 +195,10 @@ void SqliteStore::run()
             std::this_thread::sleep_for(kBatchWindow);
             lock.lock();
         }
-        if (newRetention_)
+        if (newRetention_) {
             retention_ = *std::exchange(newRetention_, std::nullopt);
+            logConfigured_ = false;
+        }
         std::deque<SqliteWrite> batch;
         while (!queue_.empty() && batch.size() < kBatchLimit) {
             batch.push_back(std::move(queue_.front()));
@@ -210,12 +213,36 @@ void SqliteStore::run()
         // Age is looked at now and then; size after every batch, which costs three
         // page counts, so that a burst never takes the store far past its bound.
         if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval ||
-            (retention_.maxBytes > 0 && connection_.database && dataBytes() > retention_.maxBytes))
+            (retention_.maxBytes > 0 && connection_.database && dataBytes() > rowsShare()))
             prune();
         lock.lock();
         committed_ += written;
         changed_.notify_all();
     }
+}
+
+std::uint64_t SqliteStore::logShare() const
+{
+    return std::clamp(retention_.maxBytes / 4, kSmallestLogShare, kLargestLogShare);
+}
+
+std::uint64_t SqliteStore::rowsShare() const
+{
+    return retention_.maxBytes > logShare() ? retention_.maxBytes - logShare() : retention_.maxBytes / 2;
+}
+
+// The log is checkpointed into the file once it holds its share, and cut back to it
+// when it starts again; the shared-memory index beside it takes the rest.
+void SqliteStore::configureLog()
+{
+    logConfigured_ = true;
+    if (retention_.maxBytes == 0 || !connection_.database)
+        return;
+    std::uint64_t limit = logShare() - kIndexBytes;
+    auto pages = std::max<std::uint64_t>(1, limit / kPageBytes);
+    sqlite3_exec(connection_.database, fmt::format("PRAGMA journal_size_limit={}", limit).c_str(), nullptr, nullptr,
+                 nullptr);
+    sqlite3_wal_autocheckpoint(connection_.database, static_cast<int>(pages));
 }
 
 std::uint64_t SqliteStore::dataBytes()
@@ -270,7 +297,7 @@ void SqliteStore::prune()
             while (run(step, cutoff) == kAgeChunk) {}
     }
     if (retention_.maxBytes > 0)
-        while (static_cast<double>(dataBytes()) > kSizeLowWater * static_cast<double>(retention_.maxBytes)) {
+        while (static_cast<double>(dataBytes()) > kSizeLowWater * static_cast<double>(rowsShare())) {
             bool removedAny = false;
             for (const auto& step : retention_.oldest)
                 if (run(step, 0) > 0) {
@@ -284,7 +311,10 @@ void SqliteStore::prune()
         return;
     for (const auto& sql : retention_.tidy)
         sqlite3_exec(connection_.database, sql.c_str(), nullptr, nullptr, nullptr);
+    // The pages the rows gave up go back to the file system, and the log that holds the
+    // deletions goes into the file at once, to be cut back when it starts again.
     sqlite3_exec(connection_.database, "PRAGMA incremental_vacuum", nullptr, nullptr, nullptr);
+    sqlite3_wal_checkpoint_v2(connection_.database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
     MXLOG(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(), pruned);
     if (unexported > 0)
         MXLOG(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(), unexported);
@@ -318,7 +348,10 @@ void SqliteStore::write(std::deque<SqliteWrite>& batch)
     auto began = std::chrono::steady_clock::now();
     for (;;) {
         std::string error;
-        if (stillOnDisk(error) && commit(batch, error)) {
+        bool present = stillOnDisk(error);
+        if (present && !logConfigured_)
+            configureLog();
+        if (present && commit(batch, error)) {
             if (attempts == 0)
                 return;
             MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts,
@@ -355,6 +388,7 @@ bool SqliteStore::stillOnDisk(std::string& error)
     if (connection_.database)
         MXLOG(nullptr, Error, "{} was removed: making a new one", path_.string());
     disconnect(connection_);
+    logConfigured_ = false;
     int code = SQLITE_OK;
     if (connect(path_, schema_, statementTexts_, connection_, error, code))
         return true;

@@ -96,6 +96,13 @@ public:
     static constexpr std::int64_t kAgeChunk = 2000;
     static constexpr std::int64_t kSizeChunk = 100;
     static constexpr double kSizeLowWater = 0.9;
+    // A store's byte bound holds its file and its write-ahead log together, as `du`
+    // sees them: the log's share is a quarter of the bound, within these; the rows
+    // get the rest.
+    static constexpr std::uint64_t kSmallestLogShare = 128 << 10;
+    static constexpr std::uint64_t kLargestLogShare = 4 << 20;
+    static constexpr std::uint64_t kIndexBytes = 32 << 10; // the log's shared-memory index
+    static constexpr std::uint64_t kPageBytes = 4096;
 
     // Opens or creates the database, runs `schema`, prepares `statements`, and makes
     // sure it can write. Nothing, with `error`, when any of that fails.
@@ -144,13 +151,17 @@ private:
     bool stillOnDisk(std::string& error);
     bool commit(std::deque<SqliteWrite>& batch, std::string& error);
     void prune();
+    std::uint64_t logShare() const;
+    std::uint64_t rowsShare() const;
+    void configureLog();
     std::int64_t pruneStep(const SqliteRetention::Step& step, std::int64_t cutoff);
     std::uint64_t dataBytes();
 
     const std::filesystem::path path_;
     const std::vector<std::string> schema_;
     const std::vector<std::string> statementTexts_;
-    SqliteRetention retention_; // writer thread only
+    SqliteRetention retention_;  // writer thread only
+    bool logConfigured_ = false; // writer thread only: the log's bounds match retention_
     std::optional<SqliteRetention> newRetention_;
     Connection connection_;
     std::vector<std::string> texts_; // writer thread only: each parameter's JSON text for the row at hand
