@@ -106,7 +106,16 @@ TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)
         }
         return bytes;
     };
-    EXPECT_TRUE(waitUntil([&] { return onDisk() <= 1048576; })) << onDisk() << " bytes";
+    auto files = [&] {
+        std::string sizes;
+        for (const char* suffix : {"", "-wal", "-shm"}) {
+            struct stat file {};
+            ::stat(daemon.path(std::string("var/lib/harmonia/tally.db") + suffix).c_str(), &file);
+            sizes += fmt::format(" tally.db{} {} ({} on disk)", suffix, file.st_size, file.st_blocks * 512);
+        }
+        return sizes;
+    };
+    EXPECT_TRUE(waitUntil([&] { return onDisk() <= 1048576; })) << files();
 }
 
 // A client names itself (its process name) and fills its payloads: neither reaches a

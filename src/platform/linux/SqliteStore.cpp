@@ -86,7 +86,7 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
                         SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK)
         return fail(std::string("cannot open: ") +
                     (connection.database ? sqlite3_errmsg(connection.database) : "out of memory"));
-    sqlite3_busy_timeout(connection.database, 5000);
+    sqlite3_busy_timeout(connection.database, kBusyTimeoutMilliseconds);
     // The last step proves that the store can be written, not just read.
     // A new store gives pruned pages back to the file system; an older one reuses them.
     std::vector<std::string> setup = {"PRAGMA auto_vacuum=INCREMENTAL", "PRAGMA journal_mode=WAL",
@@ -218,7 +218,29 @@ void SqliteStore::run()
         lock.lock();
         committed_ += written;
         changed_.notify_all();
+        if (queue_.empty() && !stopping_) {
+            lock.unlock();
+            cutBackLog();
+            lock.lock();
+        }
     }
+}
+
+// A batch larger than the log's share takes the log past it until the log starts
+// again, which may be long for a store gone quiet: once the queue is empty, the log
+// is moved into the file and cut to nothing.
+void SqliteStore::cutBackLog()
+{
+    if (retention_.maxBytes == 0 || !connection_.database)
+        return;
+    struct stat log {};
+    if (::stat((path_.native() + "-wal").c_str(), &log) != 0 ||
+        static_cast<std::uint64_t>(log.st_size) <= logShare() - kIndexBytes)
+        return;
+    // A reader in the way is not waited for: the next quiet moment tries again.
+    sqlite3_busy_timeout(connection_.database, 0);
+    sqlite3_wal_checkpoint_v2(connection_.database, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
+    sqlite3_busy_timeout(connection_.database, kBusyTimeoutMilliseconds);
 }
 
 std::uint64_t SqliteStore::logShare() const
@@ -231,14 +253,16 @@ std::uint64_t SqliteStore::rowsShare() const
     return retention_.maxBytes > logShare() ? retention_.maxBytes - logShare() : retention_.maxBytes / 2;
 }
 
-// The log is checkpointed into the file once it holds its share, and cut back to it
-// when it starts again; the shared-memory index beside it takes the rest.
+// The log is checkpointed into the file once it holds half of what its share leaves
+// beside the shared-memory index, and cut back to that when it starts again: a batch
+// committed past it, before the checkpoint, still fits in the share.
 void SqliteStore::configureLog()
 {
     logConfigured_ = true;
     if (retention_.maxBytes == 0 || !connection_.database)
         return;
     std::uint64_t limit = logShare() - kIndexBytes;
+    limit /= 2;
     auto pages = std::max<std::uint64_t>(1, limit / kPageBytes);
     sqlite3_exec(connection_.database, fmt::format("PRAGMA journal_size_limit={}", limit).c_str(), nullptr, nullptr,
                  nullptr);

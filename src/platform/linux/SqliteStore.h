@@ -103,6 +103,8 @@ public:
     static constexpr std::uint64_t kLargestLogShare = 4 << 20;
     static constexpr std::uint64_t kIndexBytes = 32 << 10; // the log's shared-memory index
     static constexpr std::uint64_t kPageBytes = 4096;
+    // How long a write waits for a reader (mxreport, the exporter) to let go.
+    static constexpr int kBusyTimeoutMilliseconds = 5000;
 
     // Opens or creates the database, runs `schema`, prepares `statements`, and makes
     // sure it can write. Nothing, with `error`, when any of that fails.
@@ -154,6 +156,7 @@ private:
     std::uint64_t logShare() const;
     std::uint64_t rowsShare() const;
     void configureLog();
+    void cutBackLog();
     std::int64_t pruneStep(const SqliteRetention::Step& step, std::int64_t cutoff);
     std::uint64_t dataBytes();
 
