@@ -201,13 +201,15 @@ private:
 class FakeFileSystem final : public FileSystem {
 public:
     std::filesystem::path resolve(const std::string& path) override { return "/root" + path; }
-    std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode) override
+    std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode,
+                                                 FileModes) override
     {
         std::lock_guard lock(mutex_);
         directories[directory] = mode;
         return directoryFailure;
     }
-    std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents) override
+    std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents,
+                                               mode_t) override
     {
         std::lock_guard lock(mutex_);
         if (directoryFailure)

@@ -118,6 +118,40 @@ TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)
     EXPECT_TRUE(waitUntil([&] { return onDisk() <= 1048576; })) << files();
 }
 
+// Another user must not move the socket aside, plant a file where the daemon writes,
+// or replace the metrics: every directory and file gets its own mode, whatever the
+// umask the daemon was started with.
+TEST(DaemonPermissionsTest, UnderAnOpenUmaskEveryDirectoryAndFileGetsItsOwnMode)
+{
+    DaemonProcess daemon;
+    daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    mode_t previous = umask(0);
+    daemon.start();
+    umask(previous);
+    auto client = connectTo(daemon);
+    ASSERT_TRUE(*client->createReportingSession(3).value);
+    client->startReportingSessionForID(3, nullptr);
+    ASSERT_TRUE(client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<ReporterID>{3}));
+    ASSERT_TRUE(*client->stopReportingSessionForID(3).value);
+    ASSERT_TRUE(
+        waitUntil([&] { return std::filesystem::exists(daemon.path("var/lib/harmonia/metrics/mxreportingd.prom")); }));
+    auto mode = [&](const std::string& relative) {
+        struct stat file {};
+        return ::lstat(daemon.path(relative).c_str(), &file) == 0 ? file.st_mode & 07777 : 01;
+    };
+    EXPECT_EQ(mode("run/harmonia"), 0755u);
+    for (const char* socket : {"reporting.sock", "notify.sock", "orientation.sock"})
+        EXPECT_EQ(mode(std::string("run/harmonia/") + socket), 0660u) << socket;
+    EXPECT_EQ(mode("run/harmonia/mxreportingd.lock"), 0644u);
+    EXPECT_EQ(mode("var/lib/harmonia"), 0755u);
+    for (const char* store : {"tally.db", "tally.db-wal", "joule.db", "uplink.db"})
+        EXPECT_EQ(mode(std::string("var/lib/harmonia/") + store), 0640u) << store;
+    EXPECT_EQ(mode("var/lib/harmonia/metrics"), 0755u);
+    EXPECT_EQ(mode("var/lib/harmonia/metrics/mxreportingd.prom"), 0644u);
+    auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
+    EXPECT_EQ(mode(summary.lexically_relative(daemon.root()).string()), 0640u);
+}
+
 // A client names itself (its process name) and fills its payloads: neither reaches a
 // terminal or the log as anything but one printable line.
 TEST_F(DaemonHardeningTest, ControlCharactersFromClientsAreEscapedInTheLogAndTheStatus)

@@ -109,9 +109,10 @@ void MxReportingMetrics::write(const Dictionary& status)
     static std::atomic<bool> failing{false};
     auto& fileSystem = ProcessWide<FileSystem>::get();
     auto path = fileSystem.resolve(kPath);
-    auto failure = fileSystem.createDirectories(path.parent_path(), 0777);
+    // Readable by anyone, whatever the umask: a node exporter reads it as its own user.
+    auto failure = fileSystem.createDirectories(path.parent_path(), kDirectoryMode, FileModes::Exact);
     if (!failure)
-        failure = fileSystem.writeAtomically(path, prometheusText(status));
+        failure = fileSystem.writeAtomically(path, prometheusText(status), kFileMode);
     if (failure && !failing.exchange(true))
         MXLOG(nullptr, Error, "cannot write the metrics file {}: {}", path.string(), *failure);
     if (!failure && failing.exchange(false))

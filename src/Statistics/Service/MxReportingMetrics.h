@@ -4,6 +4,7 @@
 // exporters as labels. Rewritten whole, by rename, so a reader never sees half.
 
 #include <string>
+#include <sys/types.h>
 
 #include "platform/Value.h"
 
@@ -12,6 +13,8 @@ namespace mx {
 class MxReportingMetrics {
 public:
     static constexpr const char* kPath = "var/lib/harmonia/metrics/mxreportingd.prom";
+    static constexpr mode_t kDirectoryMode = 0755;
+    static constexpr mode_t kFileMode = 0644;
 
     static std::string prometheusText(const Dictionary& status);
     // Writes the text to kPath under the root; an error is logged once per run of

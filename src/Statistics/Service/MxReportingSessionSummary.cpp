@@ -19,6 +19,7 @@ namespace mx {
 namespace {
 
 constexpr const char* kSummaryDirectory = "/var/log/harmonia/reporting";
+constexpr mode_t kSummaryFileMode = 0640;
 constexpr std::size_t kMaximumHostBytes = 128;
 
 std::atomic<std::size_t> gMaximumFiles{std::numeric_limits<std::size_t>::max()};
@@ -141,12 +142,13 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
 
     auto& fileSystem = ProcessWide<FileSystem>::get();
     auto directory = fileSystem.resolve(kSummaryDirectory);
-    if (auto failure = fileSystem.createDirectories(directory, 0777))
+    if (auto failure = fileSystem.createDirectories(directory, 0777, FileModes::UmaskFiltered))
         MXLOG(logScope(), Error, "can't create logging directory at {}: {}", directory.string(), *failure);
     if (text.empty())
         return;
-    if (auto failure =
-            fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text)) {
+    // The file is its owner's and its group's to read, whatever the umask.
+    if (auto failure = fileSystem.writeAtomically(
+            directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text, kSummaryFileMode)) {
         MXLOG(logScope(), Error, "jsonOutput writeToURL: {}", *failure);
         return;
     }

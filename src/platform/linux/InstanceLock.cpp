@@ -8,13 +8,17 @@
 
 #include <fmt/format.h>
 
+#include "platform/linux/PosixFileSystem.h"
+
 namespace mx {
 
 std::unique_ptr<InstanceLock> InstanceLock::acquire(const std::filesystem::path& path, std::string& error)
 {
-    std::error_code ignored;
-    std::filesystem::create_directories(path.parent_path(), ignored);
-    int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    if (auto failure = PosixFileSystem::makeDirectories(path.parent_path(), PosixFileSystem::kDaemonDirectoryMode)) {
+        error = fmt::format("cannot make {}: {}", path.parent_path().string(), *failure);
+        return nullptr;
+    }
+    int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644);
     if (fd < 0) {
         error = fmt::format("cannot open {}: {}", path.string(), std::generic_category().message(errno));
         return nullptr;

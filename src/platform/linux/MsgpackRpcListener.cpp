@@ -11,6 +11,7 @@
 
 #include "platform/MxLog.h"
 #include "platform/linux/MsgpackRpcConnection.h"
+#include "platform/linux/UnixSocketBinding.h"
 
 namespace mx {
 
@@ -34,21 +35,17 @@ std::unique_ptr<MsgpackRpcListener> MsgpackRpcListener::make(const std::filesyst
         return listener;
     }
 
-    std::filesystem::create_directories(path.parent_path(), failure);
-    std::filesystem::remove(path, failure);
-    asio::local::stream_protocol::endpoint endpoint(path.string());
     auto& acceptor = listener->acceptor_;
-    acceptor.open(endpoint.protocol(), failure);
-    if (!failure)
-        acceptor.bind(endpoint, failure);
+    acceptor.open(asio::local::stream_protocol(), failure);
+    // Audio clients run as other users of the audio group.
+    if (!failure && !bindUnixSocketPath(acceptor.native_handle(), path, kSocketMode, error))
+        return nullptr;
     if (!failure)
         acceptor.listen(asio::socket_base::max_listen_connections, failure);
     if (failure) {
         error = "cannot listen on " + path.string() + ": " + failure.message();
         return nullptr;
     }
-    // Audio clients run as other users of the audio group.
-    chmod(path.c_str(), 0660);
     listener->endpoint_ = path.string();
     return listener;
 }

@@ -51,10 +51,12 @@ private:
     int fd_;
 };
 
+// How openDirectory treats a missing component.
+enum class Missing { Fail, Create, CreateExactly };
+
 // The directory `directory`: the host's root opened as it is, every component below
-// it without following a symbolic link, and made with `mode` where missing when
-// `create` says so.
-std::optional<std::string> openDirectory(const std::filesystem::path& directory, bool create, mode_t mode,
+// it without following a symbolic link, and made with `mode` where missing when asked.
+std::optional<std::string> openDirectory(const std::filesystem::path& directory, Missing missing, mode_t mode,
                                          Descriptor& opened)
 {
     std::filesystem::path root = MxReportingRoot();
@@ -71,12 +73,19 @@ std::optional<std::string> openDirectory(const std::filesystem::path& directory,
         if (component == "." || component.empty())
             continue;
         walked /= component;
-        if (create && mkdirat(current.get(), component.c_str(), mode) != 0 && errno != EEXIST)
-            return walked.string() + ": " + errnoText(errno);
+        bool made = false;
+        if (missing != Missing::Fail) {
+            made = mkdirat(current.get(), component.c_str(), mode) == 0;
+            if (!made && errno != EEXIST)
+                return walked.string() + ": " + errnoText(errno);
+        }
         Descriptor next(openat(current.get(), component.c_str(), O_DIRECTORY | O_NOFOLLOW | O_RDONLY | O_CLOEXEC));
         if (next.get() < 0)
             return walked.string() +
                 (errno == ELOOP || errno == ENOTDIR ? " is not a directory" : ": " + errnoText(errno));
+        // Set on what was opened, never on a path another could have swapped meanwhile.
+        if (made && missing == Missing::CreateExactly && fchmod(next.get(), mode) != 0)
+            return walked.string() + ": " + errnoText(errno);
         current = std::move(next);
     }
     opened = std::move(current);
@@ -85,24 +94,36 @@ std::optional<std::string> openDirectory(const std::filesystem::path& directory,
 
 } // namespace
 
-std::optional<std::string> PosixFileSystem::createDirectories(const std::filesystem::path& directory, mode_t mode)
+std::optional<std::string> PosixFileSystem::createDirectories(const std::filesystem::path& directory, mode_t mode,
+                                                              FileModes modes)
 {
     Descriptor opened;
-    return openDirectory(directory, true, mode, opened);
+    return openDirectory(directory, modes == FileModes::Exact ? Missing::CreateExactly : Missing::Create, mode, opened);
+}
+
+std::optional<std::string> PosixFileSystem::makeDirectories(const std::filesystem::path& directory, mode_t mode)
+{
+    Descriptor opened;
+    return openDirectory(directory, Missing::CreateExactly, mode, opened);
 }
 
 std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesystem::path& file,
-                                                            std::string_view contents)
+                                                            std::string_view contents, mode_t mode)
 {
     Descriptor directory;
-    if (auto failure = openDirectory(file.parent_path(), false, 0, directory))
+    if (auto failure = openDirectory(file.parent_path(), Missing::Fail, 0, directory))
         return failure;
     std::string name = file.filename().string();
     std::string temporary = fmt::format(".{}.{}.{}", name, getpid(), ++temporaries_);
     Descriptor out(
-        openat(directory.get(), temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0666));
+        openat(directory.get(), temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
     if (out.get() < 0)
         return errnoText(errno);
+    if (fchmod(out.get(), mode) != 0) {
+        std::string reason = errnoText(errno);
+        unlinkat(directory.get(), temporary.c_str(), 0);
+        return reason;
+    }
     const char* data = contents.data();
     std::size_t left = contents.size();
     while (left > 0) {
@@ -130,7 +151,7 @@ std::size_t PosixFileSystem::trimDirectory(const std::filesystem::path& director
                                            std::uint64_t maxBytes)
 {
     Descriptor opened;
-    if (openDirectory(directory, false, 0, opened))
+    if (openDirectory(directory, Missing::Fail, 0, opened))
         return 0;
     struct File {
         std::string name;

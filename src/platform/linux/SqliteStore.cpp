@@ -3,9 +3,11 @@
 #include <algorithm>
 #include <chrono>
 #include <ctime>
+#include <fcntl.h>
 #include <pthread.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <system_error>
 #include <unistd.h>
 
 #include <fmt/format.h>
@@ -13,6 +15,7 @@
 
 #include "platform/JsonValue.h"
 #include "platform/MxLog.h"
+#include "platform/linux/PosixFileSystem.h"
 
 namespace mx {
 
@@ -22,6 +25,8 @@ double secondsSinceEpoch()
 }
 
 namespace {
+
+std::string errnoText(int error) { return std::generic_category().message(error); }
 
 bool isCorruption(int code) { return code == SQLITE_CORRUPT || code == SQLITE_NOTADB; }
 
@@ -43,6 +48,23 @@ std::filesystem::path setAside(const std::filesystem::path& path)
 std::string describe(std::chrono::steady_clock::duration duration)
 {
     return fmt::format("{:.1f} s", std::chrono::duration<double>(duration).count());
+}
+
+// A new store's file is made here, with its mode set on the descriptor whatever the
+// umask; SQLite gives its log and the log's index the same. An existing one is kept.
+std::optional<std::string> makeFile(const std::filesystem::path& path)
+{
+    if (auto failure = PosixFileSystem::makeDirectories(path.parent_path(), PosixFileSystem::kDaemonDirectoryMode))
+        return "cannot make its directory: " + *failure;
+    int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, SqliteStore::kFileMode);
+    if (fd < 0)
+        return errno == EEXIST ? std::nullopt : std::optional<std::string>("cannot make it: " + errnoText(errno));
+    bool set = ::fchmod(fd, SqliteStore::kFileMode) == 0;
+    int failure = errno;
+    ::close(fd);
+    if (!set)
+        return "cannot set its mode: " + errnoText(failure);
+    return std::nullopt;
 }
 
 } // namespace
@@ -74,14 +96,14 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
                           const std::vector<std::string>& statements, Connection& connection, std::string& error,
                           int& code)
 {
-    std::error_code ignored;
-    std::filesystem::create_directories(path.parent_path(), ignored);
     auto fail = [&](const std::string& what) {
         code = connection.database ? sqlite3_extended_errcode(connection.database) & 0xff : SQLITE_CANTOPEN;
         error = path.string() + ": " + what;
         disconnect(connection);
         return false;
     };
+    if (auto failure = makeFile(path))
+        return fail(*failure);
     if (sqlite3_open_v2(path.c_str(), &connection.database,
                         SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK)
         return fail(std::string("cannot open: ") +

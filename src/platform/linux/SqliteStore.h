@@ -103,6 +103,8 @@ public:
     static constexpr std::uint64_t kLargestLogShare = 4 << 20;
     static constexpr std::uint64_t kIndexBytes = 32 << 10; // the log's shared-memory index
     static constexpr std::uint64_t kPageBytes = 4096;
+    // A store is its owner's to write and its group's (audio) to read.
+    static constexpr mode_t kFileMode = 0640;
     // How long a write waits for a reader (mxreport, the exporter) to let go.
     static constexpr int kBusyTimeoutMilliseconds = 5000;
 

@@ -1,5 +1,7 @@
 #include "platform/linux/UnixDatagram.h"
 
+#include "platform/linux/UnixSocketBinding.h"
+
 #include <algorithm>
 #include <cerrno>
 #include <sys/socket.h>
@@ -14,18 +16,14 @@ std::unique_ptr<asio::local::datagram_protocol::socket> bindUnixDatagram(asio::i
                                                                          std::string& error)
 {
     std::error_code failure;
-    std::filesystem::create_directories(path.parent_path(), failure);
-    std::filesystem::remove(path, failure);
-    asio::local::datagram_protocol::endpoint endpoint(path.string());
     auto socket = std::make_unique<asio::local::datagram_protocol::socket>(io);
-    socket->open(endpoint.protocol(), failure);
-    if (!failure)
-        socket->bind(endpoint, failure);
+    socket->open(asio::local::datagram_protocol(), failure);
     if (failure) {
         error = "cannot bind " + path.string() + ": " + failure.message();
         return nullptr;
     }
-    chmod(path.c_str(), 0660);
+    if (!bindUnixSocketPath(socket->native_handle(), path, kSocketMode, error))
+        return nullptr;
     return socket;
 }
 

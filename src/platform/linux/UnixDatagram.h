@@ -1,7 +1,8 @@
 #pragma once
 // The two ends of a Unix datagram endpoint, as the daemon's feeds use them: the
 // daemon binds the path (replacing a stale socket left by an earlier run, group
-// writable so that the audio group can post), anyone else sends one datagram to it.
+// writable so that the audio group can post; UnixSocketBinding), anyone else sends
+// one datagram to it.
 
 #include <cstdint>
 #include <filesystem>
