@@ -5,6 +5,7 @@
 // (SIGTERM: the stores commit what they were handed first) or when a client calls
 // killService (status 2).
 
+#include <atomic>
 #include <cstdio>
 #include <future>
 #include <sys/resource.h>
@@ -208,16 +209,21 @@ int run(int argc, char** argv)
 
     std::promise<int> terminated;
     asio::signal_set reload(dispatch.interactiveContext(), SIGHUP);
+    // Set from a SIGHUP until its reconfiguration starts: a storm of them is one more
+    // reading of the files after the last, not one each.
+    std::atomic<bool> reloadWaiting{false};
     std::function<void()> waitForReload = [&] {
         reload.async_wait([&](const std::error_code& cancelled, int) {
             if (cancelled)
                 return;
             // Off the server queue's thread: a collector no longer listed may take
             // a while to stop.
-            dispatch.globalQueue(QueuePriority::Utility).dispatch([&] {
-                reconfigure(*tally, *joule, *uplink);
-                notifications.deliver(kMxReportingDefaultsNotification);
-            });
+            if (!reloadWaiting.exchange(true))
+                dispatch.globalQueue(QueuePriority::Utility).dispatch([&] {
+                    reloadWaiting.store(false);
+                    reconfigure(*tally, *joule, *uplink);
+                    notifications.deliver(kMxReportingDefaultsNotification);
+                });
             waitForReload();
         });
     };
