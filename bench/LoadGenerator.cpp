@@ -43,12 +43,15 @@ struct Options {
     int inFlight = 32;
     double seconds = 5;
     int memoryReports = 200'000;
+    bool beside = false;
 };
 
 struct Figures {
     double reportsPerSecond = 0;
     double p50Microseconds = 0;
+    double p95Microseconds = 0;
     double p99Microseconds = 0;
+    double maxMicroseconds = 0;
     std::uint64_t errors = 0;
     std::uint64_t answered = 0;
     double cpuMicrosecondsPerReport = 0;
@@ -166,6 +169,53 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
     return figures;
 }
 
+// One client floods (`inFlight` requests outstanding, as fast as it is answered) while
+// another sends one report every 10 ms and waits for each reply: the other's round
+// trips, which back-pressure on the flooder alone must leave short.
+Figures driveBeside(const std::filesystem::path& socket, const Options& options)
+{
+    std::string error;
+    auto flooder = MxReportingClient::connect(socket, error);
+    auto bystander = MxReportingClient::connect(socket, error);
+    if (!flooder || !bystander) {
+        std::fprintf(stderr, "cannot connect: %s\n", error.c_str());
+        std::_Exit(1);
+    }
+    for (auto& [client, id] : {std::pair{flooder.get(), 1}, std::pair{bystander.get(), 2}}) {
+        client->createReportingSession(id);
+        client->setServiceType(7, id);
+        client->startReportingSessionForID(id, nullptr);
+    }
+    std::atomic<bool> running{true};
+    std::mt19937 random(1);
+    int seq = 0;
+    std::function<void()> flood = [&] {
+        if (running)
+            flooder->sendMessage(realisticPayload(random, seq++), 0x08000003, 1, std::vector<ReporterID>{1},
+                                 [&](const MxClientResult<MxSendOutcome>&) { flood(); });
+    };
+    for (int k = 0; k < options.inFlight; ++k)
+        flood();
+    std::vector<double> latencies;
+    std::mt19937 own(2);
+    auto end = Clock::now() + std::chrono::duration<double>(options.seconds);
+    while (Clock::now() < end) {
+        auto sent = Clock::now();
+        bystander->sendMessage(realisticPayload(own, 0), 0x08000003, 1, std::vector<ReporterID>{2});
+        latencies.push_back(std::chrono::duration<double, std::micro>(Clock::now() - sent).count());
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    running = false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(500));
+    std::sort(latencies.begin(), latencies.end());
+    Figures figures;
+    figures.p50Microseconds = latencies[latencies.size() / 2];
+    figures.p95Microseconds = latencies[latencies.size() * 95 / 100];
+    figures.p99Microseconds = latencies[latencies.size() * 99 / 100];
+    figures.maxMicroseconds = latencies.back();
+    return figures;
+}
+
 // A field of /proc/PID/status in KiB ("VmHWM", "VmRSS").
 long memoryKiB(pid_t pid, const std::string& field)
 {
@@ -276,6 +326,36 @@ void print(const char* name, const Figures& figures)
                 figures.cpuMicrosecondsPerReport, static_cast<unsigned long long>(figures.errors));
 }
 
+// Throughput, latency and CPU per report of both servers under the same closed-loop
+// load, memory per kept report first.
+void runLoad(const Options& options, pid_t echo, const std::filesystem::path& echoSocket, pid_t daemon,
+             const std::filesystem::path& daemonSocket)
+{
+    // First, while the daemon has allocated nothing else.
+    if (options.memoryReports > 0)
+        measureMemory(daemonSocket, daemon, options.memoryReports);
+    std::printf("%d connections x %d in flight, %.0f s each, 7-key reports (sendMessage to one started session)\n",
+                options.connections, options.inFlight, options.seconds);
+    double cpuBefore = cpuSeconds(echo);
+    Figures ceiling = drive(echoSocket, options, false);
+    ceiling.cpuMicrosecondsPerReport = (cpuSeconds(echo) - cpuBefore) * 1e6 / static_cast<double>(ceiling.answered);
+    print("echo", ceiling);
+    cpuBefore = cpuSeconds(daemon);
+    Figures daemonFigures = drive(daemonSocket, options, true);
+    {
+        std::string error;
+        if (auto client = MxReportingClient::connect(daemonSocket, error))
+            waitUntilStoresIdle(*client);
+    }
+    daemonFigures.cpuMicrosecondsPerReport =
+        (cpuSeconds(daemon) - cpuBefore) * 1e6 / static_cast<double>(daemonFigures.answered);
+    print("daemon", daemonFigures);
+    std::printf("daemon/echo: throughput %.2f, p99 %.2f, CPU per report %.2f; daemon peak memory %ld KiB\n",
+                daemonFigures.reportsPerSecond / ceiling.reportsPerSecond,
+                daemonFigures.p99Microseconds / ceiling.p99Microseconds,
+                daemonFigures.cpuMicrosecondsPerReport / ceiling.cpuMicrosecondsPerReport, memoryKiB(daemon, "VmHWM"));
+}
+
 } // namespace
 
 int main(int argc, char** argv)
@@ -291,10 +371,12 @@ int main(int argc, char** argv)
             options.seconds = std::stod(argv[i + 1]);
         else if (option == "--memory-reports")
             options.memoryReports = std::stoi(argv[i + 1]);
+        else if (option == "--beside-a-flood")
+            options.beside = std::string(argv[i + 1]) == "yes";
         else {
             std::fprintf(stderr,
                          "usage: mxreporting_load [--connections N] [--in-flight K] [--seconds S] "
-                         "[--memory-reports N]\n");
+                         "[--memory-reports N] [--beside-a-flood yes]\n");
             return 64;
         }
     }
@@ -325,30 +407,17 @@ int main(int argc, char** argv)
         return 1;
     }
 
-    // First, while the daemon has allocated nothing else.
-    if (options.memoryReports > 0)
-        measureMemory(daemonSocket, daemon, options.memoryReports);
-    std::printf("%d connections x %d in flight, %.0f s each, 7-key reports (sendMessage to one started session)\n",
-                options.connections, options.inFlight, options.seconds);
-    double cpuBefore = cpuSeconds(echo);
-    Figures ceiling = drive(echoSocket, options, false);
-    ceiling.cpuMicrosecondsPerReport = (cpuSeconds(echo) - cpuBefore) * 1e6 / static_cast<double>(ceiling.answered);
-    print("echo", ceiling);
-    cpuBefore = cpuSeconds(daemon);
-    Figures daemonFigures = drive(daemonSocket, options, true);
-    {
-        std::string error;
-        if (auto client = MxReportingClient::connect(daemonSocket, error))
-            waitUntilStoresIdle(*client);
+    if (options.beside) {
+        for (auto [name, socket] : {std::pair{"echo", echoSocket}, std::pair{"daemon", daemonSocket}}) {
+            Figures figures = driveBeside(socket, options);
+            std::printf("%-8s one report every 10 ms beside a client with %d in flight: round trip p50 %.2f ms, "
+                        "p95 %.2f ms, p99 %.2f ms, longest %.2f ms\n",
+                        name, options.inFlight, figures.p50Microseconds / 1000, figures.p95Microseconds / 1000,
+                        figures.p99Microseconds / 1000, figures.maxMicroseconds / 1000);
+        }
+    } else {
+        runLoad(options, echo, echoSocket, daemon, daemonSocket);
     }
-    daemonFigures.cpuMicrosecondsPerReport =
-        (cpuSeconds(daemon) - cpuBefore) * 1e6 / static_cast<double>(daemonFigures.answered);
-    print("daemon", daemonFigures);
-    std::printf("daemon/echo: throughput %.2f, p99 %.2f, CPU per report %.2f; daemon peak memory %ld KiB\n",
-                daemonFigures.reportsPerSecond / ceiling.reportsPerSecond,
-                daemonFigures.p99Microseconds / ceiling.p99Microseconds,
-                daemonFigures.cpuMicrosecondsPerReport / ceiling.cpuMicrosecondsPerReport, memoryKiB(daemon, "VmHWM"));
-
     ::kill(echo, SIGKILL);
     ::kill(daemon, SIGTERM);
     waitpid(echo, nullptr, 0);
