@@ -596,7 +596,12 @@ TEST_F(DaemonIntegrationTest, AStreamThroughTheThrottleDeliversTheLastOfEachBurs
     EXPECT_GE(std::chrono::steady_clock::now() - began, std::chrono::milliseconds(450)) << "held for its throttle time";
     EXPECT_THAT(output, ::testing::HasSubstr("Dropping duplicate message for level|3|mxreporting_timestamp|^|"));
     EXPECT_THAT(output, ::testing::HasSubstr("waitForCompletion. timersInFlight="));
-    auto sent = daemon.query("uplink", "SELECT payload FROM messages WHERE session IS NULL ORDER BY id");
+    // A reply comes before its row is committed: the rows are waited for.
+    std::vector<std::vector<std::string>> sent;
+    waitUntil([&] {
+        sent = daemon.query("uplink", "SELECT payload FROM messages WHERE session IS NULL ORDER BY id");
+        return sent.size() >= 2;
+    });
     ASSERT_EQ(sent.size(), 2u) << "one delivery a key";
     std::vector<std::string> payloads{sent[0][0], sent[1][0]};
     EXPECT_THAT(payloads,
