@@ -11,10 +11,10 @@
 
 #include <sqlite3.h>
 
-#include "platform/JsonValue.h"
 #include "platform/MxLog.h"
 #include "platform/linux/SqliteTally.h"
 #include "platform/linux/StoreLimits.h"
+#include "value/JsonValue.h"
 
 using namespace mx;
 using Clock = std::chrono::steady_clock;

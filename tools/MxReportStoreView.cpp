@@ -8,7 +8,7 @@
 #include <nlohmann/json.hpp>
 #include <sqlite3.h>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -28,14 +28,14 @@
 #include "Statistics/MxReportingVocabulary.h"
 #include "Statistics/Service/MxReportingBlockThrottle.h"
 #include "client/MxReportingClient.h"
-#include "platform/JsonValue.h"
-#include "platform/ValueText.h"
-#include "platform/linux/DatagramNotifications.h"
-#include "platform/linux/DatagramOrientation.h"
 #include "platform/linux/FileChanstat.h"
 #include "platform/linux/JsonDeviceProperties.h"
 #include "platform/linux/JsonPreferences.h"
+#include "value/JsonValue.h"
+#include "value/ValueText.h"
+#include "wire/Datagram.h"
 #include "wire/MxReportingMethods.h"
+#include "wire/OrientationDatagram.h"
 #include "wire/RootPath.h"
 
 using namespace mx;
@@ -354,8 +354,7 @@ int defaults(const std::vector<std::string>& words)
 int notify(const std::vector<std::string>& words)
 {
     std::string name = words.size() > 1 ? words[1] : "com.kestrel.harmonia.reporting";
-    DatagramNotifications notifications(MxReportingPath("run/harmonia/notify.sock"));
-    std::uint32_t status = notifications.post(name);
+    std::uint32_t status = postNotification(name);
     if (status != 0) {
         std::fprintf(stderr, "notify: cannot post %s: %s\n", name.c_str(),
                      std::generic_category().message(static_cast<int>(status)).c_str());
@@ -375,7 +374,7 @@ int orientation(const std::vector<std::string>& words)
                                      "portrait-upside-down, landscape-left, landscape-right, face-up, face-down",
                                      words[2])};
     OrientationChange change{words[1] == "device" ? OrientationKind::Device : OrientationKind::UI, *value};
-    if (std::uint32_t status = DatagramOrientation::post(MxReportingPath("run/harmonia/orientation.sock"), change)) {
+    if (std::uint32_t status = postOrientationChange(change)) {
         std::fprintf(stderr, "orientation: cannot post: %s\n",
                      std::generic_category().message(static_cast<int>(status)).c_str());
         return kExitUnreachable;

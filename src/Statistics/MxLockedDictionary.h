@@ -7,7 +7,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -16,7 +16,7 @@
 #include <vector>
 
 #include "Statistics/MxReportingEncodedArena.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -16,7 +16,7 @@
 #include "Statistics/MxReportingDriver.h"
 #include "platform/Chanstat.h"
 #include "platform/MxLog.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

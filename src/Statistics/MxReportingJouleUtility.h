@@ -4,7 +4,7 @@
 // Stateless; called on the server queue beside every delivery to a session.
 
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

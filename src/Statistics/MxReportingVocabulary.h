@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -5,7 +5,7 @@
 #include <string_view>
 
 #include "platform/ProcessWide.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -1,5 +1,5 @@
 #include "platform/MxLog.h"
-#include "platform/ValueText.h"
+#include "value/ValueText.h"
 
 #include <chrono>
 #include <cstdio>

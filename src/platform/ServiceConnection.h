@@ -11,7 +11,7 @@
 #include <string>
 #include <sys/types.h>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

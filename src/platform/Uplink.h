@@ -13,7 +13,7 @@
 
 #include "platform/ProcessWide.h"
 #include "platform/UniqueFunction.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

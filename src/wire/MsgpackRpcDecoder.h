@@ -11,7 +11,7 @@
 
 #include <msgpack.hpp>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 #include "wire/MsgpackSizeGuard.h"
 
 namespace mx {

@@ -10,7 +10,7 @@
 
 #include <msgpack.hpp>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

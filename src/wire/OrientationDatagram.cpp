@@ -1,5 +1,8 @@
 #include "wire/OrientationDatagram.h"
 
+#include "wire/Datagram.h"
+#include "wire/RootPath.h"
+
 #include <array>
 #include <charconv>
 
@@ -45,6 +48,11 @@ std::optional<OrientationChange> parseOrientationDatagram(std::string_view datag
 std::string formatOrientationDatagram(const OrientationChange& change)
 {
     return (change.kind == OrientationKind::Device ? "device " : "ui ") + std::to_string(change.orientation);
+}
+
+std::uint32_t postOrientationChange(const OrientationChange& change)
+{
+    return sendDatagram(MxReportingPath(kOrientationFeedPath), formatOrientationDatagram(change));
 }
 
 std::string_view orientationText(int orientation)

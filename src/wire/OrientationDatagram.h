@@ -3,6 +3,7 @@
 // tools that post to it: one change per datagram, "device N" or "ui N" (N a decimal
 // integer), and the texts of the orientation values.
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -20,6 +21,8 @@ struct OrientationChange {
 // that a line written by a shell tool is a change too.
 std::optional<OrientationChange> parseOrientationDatagram(std::string_view datagram);
 std::string formatOrientationDatagram(const OrientationChange& change);
+// Posts `change` to the daemon's orientation feed under the root: 0, or the errno.
+std::uint32_t postOrientationChange(const OrientationChange& change);
 
 // 0 "unknown", 1 "portrait" ... 6 "face-down"; any other value is "unknown".
 std::string_view orientationText(int orientation);

@@ -21,7 +21,7 @@
 #include "client/MxReportingClient.h"
 #include "integration/DaemonProcess.h"
 #include "integration/IntegrationHelpers.h"
-#include "platform/linux/UnixDatagram.h"
+#include "wire/Datagram.h"
 
 namespace mx::testing {
 namespace {
@@ -445,7 +445,7 @@ TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnS
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
     auto post = [&](const std::string& datagram) {
-        ASSERT_EQ(sendUnixDatagram(daemon.path("run/harmonia/orientation.sock"), datagram), 0u);
+        ASSERT_EQ(sendDatagram(daemon.path("run/harmonia/orientation.sock"), datagram), 0u);
     };
     // The feed is read in order: once a bad datagram's line is out, all before it were handled.
     int barrier = 0;

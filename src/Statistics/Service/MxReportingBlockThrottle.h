@@ -23,7 +23,7 @@
 
 #include "Statistics/MxAtomicProperty.h"
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -11,8 +11,8 @@
 
 #include "Statistics/MxReportingDriverUtility.h"
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Value.h"
 #include "platform/WorkQueue.h"
+#include "value/Value.h"
 
 namespace mx {
 

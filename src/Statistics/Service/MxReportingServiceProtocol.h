@@ -14,7 +14,7 @@
 #include <vector>
 
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -25,8 +25,8 @@
 #include "platform/MxLog.h"
 #include "platform/UniqueFunction.h"
 #include "platform/Uplink.h"
-#include "platform/Value.h"
 #include "platform/WorkQueue.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -11,8 +11,8 @@
 
 #include "Statistics/Service/MxReportingSession.h"
 #include "platform/FileSystem.h"
-#include "platform/JsonValue.h"
 #include "platform/MxLog.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

@@ -11,7 +11,7 @@
 
 #include "Statistics/MxReportingAggregationArray.h"
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -16,8 +16,8 @@
 #include "Statistics/MxReportingVocabulary.h"
 #include "platform/UniqueFunction.h"
 #include "platform/Uplink.h"
-#include "platform/Value.h"
 #include "platform/WorkQueue.h"
+#include "value/Value.h"
 
 namespace mx {
 

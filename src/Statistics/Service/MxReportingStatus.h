@@ -10,7 +10,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -1,6 +1,7 @@
 #include "platform/linux/DatagramNotifications.h"
 
 #include "platform/linux/UnixDatagram.h"
+#include "wire/Datagram.h"
 
 namespace mx {
 
@@ -57,6 +58,6 @@ void DatagramNotifications::deliver(const std::string& name)
     }
 }
 
-std::uint32_t DatagramNotifications::post(const std::string& name) { return sendUnixDatagram(endpoint_, name); }
+std::uint32_t DatagramNotifications::post(const std::string& name) { return sendDatagram(endpoint_, name); }
 
 } // namespace mx

@@ -3,9 +3,9 @@
 #include <asio/post.hpp>
 
 #include "platform/MxLog.h"
-#include "platform/ValueText.h"
 #include "platform/linux/SensorProxyListener.h"
 #include "platform/linux/UnixDatagram.h"
+#include "value/ValueText.h"
 
 namespace mx {
 
@@ -34,11 +34,6 @@ bool DatagramOrientation::listen(std::string& error)
         sensorProxy_.reset();
     thread_ = std::thread([this] { io_.run(); });
     return true;
-}
-
-std::uint32_t DatagramOrientation::post(const std::filesystem::path& feed, const OrientationChange& change)
-{
-    return sendUnixDatagram(feed, formatOrientationDatagram(change));
 }
 
 void DatagramOrientation::receiveNext()

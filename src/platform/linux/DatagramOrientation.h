@@ -33,8 +33,6 @@ public:
     // Binds the feed, looks for the sensor proxy and starts the service's thread.
     // False, with `error`, when the feed cannot be bound.
     bool listen(std::string& error);
-    // Sends one change to the feed at `feed`: 0, or the errno of the failure.
-    static std::uint32_t post(const std::filesystem::path& feed, const OrientationChange& change);
 
     void registerDeviceOrientation(const std::string& identifier, std::function<void(int)> callback) override;
     void registerUIOrientation(const std::string& identifier, std::function<void(int)> callback) override;

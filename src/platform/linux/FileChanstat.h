@@ -1,9 +1,7 @@
 #pragma once
-// Driver channels as files: each channel is a regular file chanstat/GROUP/SUBGROUP/NAME
-// (or chanstat/GROUP/NAME for a group without subgroups) holding one signed decimal
-// 64-bit integer, kept current by whoever drives the hardware. A query walks the
-// directories once; a subscription is the files found then, and sampling reads just
-// those files, through descriptors nothing can block on. A channel that cannot be
+// The driver channel library over the channel files (wire/ChannelFiles): a query walks
+// the directories once; a subscription is the files found then, and sampling reads
+// just those files, through descriptors nothing can block on. A channel that cannot be
 // read is left out of its sample rather than failing its driver's other channels.
 // Thread-safe: it holds no state but its directory.
 
@@ -11,12 +9,13 @@
 #include <filesystem>
 
 #include "platform/Chanstat.h"
+#include "wire/ChannelFiles.h"
 
 namespace mx {
 
 class FileChanstat final : public Chanstat {
 public:
-    explicit FileChanstat(std::filesystem::path directory) : directory_(std::move(directory)) {}
+    explicit FileChanstat(std::filesystem::path directory) : files_(std::move(directory)) {}
 
     std::optional<ChanstatChannels> copyChannelsInGroup(const std::optional<std::string>& group,
                                                         const std::optional<std::string>& subgroup,
@@ -31,7 +30,7 @@ public:
                                                        std::optional<ChanstatError>& error) override;
 
 private:
-    const std::filesystem::path directory_;
+    const ChannelFiles files_;
     std::atomic<ChanstatSubscription> subscriptions_{0};
 };
 

@@ -2,8 +2,8 @@
 
 #include <fstream>
 
-#include "platform/JsonValue.h"
 #include "platform/MxLog.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

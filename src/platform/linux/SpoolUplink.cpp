@@ -7,10 +7,10 @@
 #include <nlohmann/json.hpp>
 #include <systemd/sd-id128.h>
 
-#include "platform/JsonValue.h"
 #include "platform/linux/ConfigFile.h"
 #include "platform/linux/SpoolUplinkSession.h"
 #include "platform/linux/StoreLimits.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

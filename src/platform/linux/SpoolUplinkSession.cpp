@@ -2,9 +2,9 @@
 
 #include <fmt/format.h>
 
-#include "platform/JsonValue.h"
 #include "platform/WorkQueue.h"
 #include "platform/linux/SpoolUplink.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

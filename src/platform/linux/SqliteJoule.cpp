@@ -1,7 +1,7 @@
 #include "platform/linux/SqliteJoule.h"
 
-#include "platform/JsonValue.h"
 #include "platform/linux/StoreLimits.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

@@ -13,9 +13,9 @@
 #include <fmt/format.h>
 #include <sqlite3.h>
 
-#include "platform/JsonValue.h"
 #include "platform/MxLog.h"
 #include "platform/linux/PosixFileSystem.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

@@ -30,7 +30,7 @@
 
 #include "platform/BacklogAccount.h"
 #include "platform/UniqueFunction.h"
-#include "platform/Value.h"
+#include "value/Value.h"
 
 struct sqlite3;
 struct sqlite3_stmt;

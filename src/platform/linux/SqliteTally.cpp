@@ -3,10 +3,10 @@
 #include <algorithm>
 #include <chrono>
 
-#include "platform/JsonValue.h"
 #include "platform/MxLog.h"
 #include "platform/linux/ConfigFile.h"
 #include "platform/linux/StoreLimits.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 

@@ -5,7 +5,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "platform/Value.h"
+#include "value/Value.h"
 
 namespace mx {
 

@@ -1,5 +1,5 @@
-#include "platform/Value.h"
-#include "platform/ValueText.h"
+#include "value/Value.h"
+#include "value/ValueText.h"
 
 #include <cassert>
 #include <cmath>

@@ -1,4 +1,4 @@
-#include "platform/Value.h"
+#include "value/Value.h"
 
 #include <gtest/gtest.h>
 
@@ -82,7 +82,7 @@ TEST(ValueTest, NumbersReadAsIntegersLikeACastWould)
 
 #include <nlohmann/json.hpp>
 
-#include "platform/JsonValue.h"
+#include "value/JsonValue.h"
 
 namespace mx {
 namespace {

@@ -1,5 +1,5 @@
-#include "platform/JsonValue.h"
-#include "platform/ValueText.h"
+#include "value/JsonValue.h"
+#include "value/ValueText.h"
 
 #include <cmath>
 #include <iterator>
