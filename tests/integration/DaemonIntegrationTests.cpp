@@ -628,7 +628,7 @@ TEST_F(DaemonIntegrationTest, AStreamWhoseDaemonStopsAnsweringEndsWithWhatWasNot
     daemon.signal(SIGCONT);
     EXPECT_EQ(status, 1) << output;
     EXPECT_THAT(output, ::testing::HasSubstr("Giving up on waiting for completion after 5 seconds"));
-    EXPECT_THAT(output, ::testing::HasSubstr("mxreport: send: no reply in time"));
+    EXPECT_THAT(output, ::testing::HasSubstr("mxreport: send: No reply from the daemon in time"));
     EXPECT_THAT(output, ::testing::HasSubstr("mxreport: line 2: not delivered"));
     EXPECT_THAT(output, ::testing::Not(::testing::HasSubstr("line 1: not delivered")));
 }

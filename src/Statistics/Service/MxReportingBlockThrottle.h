@@ -48,6 +48,12 @@ public:
                          MessageType type);
     // Waits, at most 5 seconds, until every held delivery has run.
     void waitForCompletion();
+    // The deliveries held now (a running one among them).
+    std::size_t held() const
+    {
+        std::size_t unscheduled = 0;
+        return counts(unscheduled);
+    }
     // Ends the throttle: the worker stops, held deliveries are dropped unrun, and the
     // call returns once the worker has let go of the throttle, so that nothing a
     // delivery uses is still touched (from inside a delivery it returns at once).
