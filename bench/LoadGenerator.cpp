@@ -29,7 +29,9 @@
 #include <vector>
 
 #include "EchoServer.h"
-#include "client/MxReportingClient.h"
+#include <mxreporting/mxreporting.hpp>
+#include <nlohmann/json.hpp>
+
 #include "wire/MsgpackRpcMessage.h"
 #include "wire/MxReportingMethods.h"
 
@@ -76,12 +78,49 @@ Dictionary realisticPayload(std::mt19937& random, int seq)
     return payload;
 }
 
+// A payload as the library takes it.
+mxr::Payload payloadOf(const Dictionary& dictionary)
+{
+    mxr::Payload payload;
+    for (const auto& [key, value] : dictionary) {
+        if (const std::int64_t* integer = value.asInt())
+            payload.add(key.c_str(), *integer);
+        else if (const double* real = value.asDouble())
+            payload.add(key.c_str(), *real);
+        else if (const std::string* text = value.asString())
+            payload.add(key.c_str(), *text);
+        else if (const bool* flag = value.asBool())
+            payload.add(key.c_str(), *flag);
+    }
+    return payload;
+}
+
+// A client of the library on `socket`, or the end of the benchmark.
+std::unique_ptr<mxr::Client> connectOrExit(const std::filesystem::path& socket)
+{
+    auto client = std::make_unique<mxr::Client>(socket.c_str());
+    if (!client->open()) {
+        std::fprintf(stderr, "cannot connect to %s: %s\n", socket.c_str(), mxr::errorText(client->error()).c_str());
+        std::_Exit(1); // the clients already connected run threads of their own
+    }
+    return client;
+}
+
+void startSession(mxr::Client& client, std::int64_t id)
+{
+    mxr::Payload configuration;
+    configuration.add("HostApplicationDisplayID", "bench");
+    client.createSession(id);
+    client.setServiceType(id, 7);
+    client.setConfiguration(id, configuration);
+    client.startSession(id);
+}
+
 bool waitForSocket(const std::filesystem::path& path)
 {
     auto deadline = Clock::now() + std::chrono::seconds(20);
     while (Clock::now() < deadline) {
-        std::string error;
-        if (MxReportingClient::connect(path, error))
+        if (mxr::Client(path.c_str()).open())
             return true;
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
@@ -91,20 +130,11 @@ bool waitForSocket(const std::filesystem::path& path)
 // Keeps `inFlight` requests outstanding on every connection for `seconds`.
 Figures drive(const std::filesystem::path& socket, const Options& options, bool withSessions)
 {
-    std::vector<std::unique_ptr<MxReportingClient>> clients;
+    std::vector<std::unique_ptr<mxr::Client>> clients;
     for (int c = 0; c < options.connections; ++c) {
-        std::string error;
-        auto client = MxReportingClient::connect(socket, error);
-        if (!client) {
-            std::fprintf(stderr, "cannot connect: %s\n", error.c_str());
-            std::_Exit(1); // the clients already connected run I/O threads
-        }
-        if (withSessions) {
-            client->createReportingSession(c + 1);
-            client->setServiceType(7, c + 1);
-            client->setConfiguration(Dictionary{{"HostApplicationDisplayID", "bench"}}, c + 1);
-            client->startReportingSessionForID(c + 1, nullptr);
-        }
+        auto client = connectOrExit(socket);
+        if (withSessions)
+            startSession(*client, c + 1);
         clients.push_back(std::move(client));
     }
 
@@ -115,8 +145,8 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
     latencies.reserve(4'000'000);
 
     struct Lane {
-        MxReportingClient* client;
-        ReporterID id;
+        mxr::Client* client;
+        std::int64_t id;
         std::mt19937 random;
         int seq = 0;
     };
@@ -128,21 +158,20 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
     std::function<void(Lane&)> issue = [&](Lane& lane) {
         if (!running)
             return;
-        auto payload = realisticPayload(lane.random, lane.seq++);
+        auto payload = payloadOf(realisticPayload(lane.random, lane.seq++));
         auto sent = Clock::now();
-        lane.client->sendMessage(payload, 0x08000003, 1, std::vector<ReporterID>{lane.id},
-                                 [&, sent, lanePointer = &lane](MxClientResult<MxSendOutcome> result) {
-                                     double micros =
-                                         std::chrono::duration<double, std::micro>(Clock::now() - sent).count();
-                                     if (!result || *result.value)
-                                         ++errors;
-                                     ++completed;
-                                     {
-                                         std::lock_guard lock(latencyMutex);
-                                         latencies.push_back(micros);
-                                     }
-                                     issue(*lanePointer);
-                                 });
+        lane.client->sendAsync(
+            payload, 0x08000003, 1, std::vector<std::int64_t>{lane.id}, [&, sent, lanePointer = &lane](int result) {
+                double micros = std::chrono::duration<double, std::micro>(Clock::now() - sent).count();
+                if (result < 0)
+                    ++errors;
+                ++completed;
+                {
+                    std::lock_guard lock(latencyMutex);
+                    latencies.push_back(micros);
+                }
+                issue(*lanePointer);
+            });
     };
 
     auto began = Clock::now();
@@ -174,25 +203,17 @@ Figures drive(const std::filesystem::path& socket, const Options& options, bool 
 // trips, which back-pressure on the flooder alone must leave short.
 Figures driveBeside(const std::filesystem::path& socket, const Options& options)
 {
-    std::string error;
-    auto flooder = MxReportingClient::connect(socket, error);
-    auto bystander = MxReportingClient::connect(socket, error);
-    if (!flooder || !bystander) {
-        std::fprintf(stderr, "cannot connect: %s\n", error.c_str());
-        std::_Exit(1);
-    }
-    for (auto& [client, id] : {std::pair{flooder.get(), 1}, std::pair{bystander.get(), 2}}) {
-        client->createReportingSession(id);
-        client->setServiceType(7, id);
-        client->startReportingSessionForID(id, nullptr);
-    }
+    auto flooder = connectOrExit(socket);
+    auto bystander = connectOrExit(socket);
+    startSession(*flooder, 1);
+    startSession(*bystander, 2);
     std::atomic<bool> running{true};
     std::mt19937 random(1);
     int seq = 0;
     std::function<void()> flood = [&] {
         if (running)
-            flooder->sendMessage(realisticPayload(random, seq++), 0x08000003, 1, std::vector<ReporterID>{1},
-                                 [&](const MxClientResult<MxSendOutcome>&) { flood(); });
+            flooder->sendAsync(payloadOf(realisticPayload(random, seq++)), 0x08000003, 1, std::vector<std::int64_t>{1},
+                               [&](int) { flood(); });
     };
     for (int k = 0; k < options.inFlight; ++k)
         flood();
@@ -201,7 +222,7 @@ Figures driveBeside(const std::filesystem::path& socket, const Options& options)
     auto end = Clock::now() + std::chrono::duration<double>(options.seconds);
     while (Clock::now() < end) {
         auto sent = Clock::now();
-        bystander->sendMessage(realisticPayload(own, 0), 0x08000003, 1, std::vector<ReporterID>{2});
+        bystander->send(payloadOf(realisticPayload(own, 0)), 0x08000003, 1, {2});
         latencies.push_back(std::chrono::duration<double, std::micro>(Clock::now() - sent).count());
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
@@ -252,21 +273,21 @@ std::size_t wireSize(const Dictionary& payload)
 }
 
 // Whether every store has written what it was handed.
-bool storesIdle(MxReportingClient& client)
+bool storesIdle(mxr::Client& client)
 {
-    auto status = client.call(method::kStatus, Array());
-    const Dictionary* stores = status.value && status.value->asDictionary()
-        ? status.value->asDictionary()->find("stores")->asDictionary()
-        : nullptr;
-    if (!stores)
+    std::string text;
+    if (client.status(text) < 0)
         return false;
-    for (const auto& [name, store] : *stores)
-        if (store.asDictionary()->find("queue_depth")->int64Value() != 0)
+    auto status = nlohmann::json::parse(text, nullptr, false);
+    if (!status.is_object() || !status.contains("stores"))
+        return false;
+    for (const auto& [name, store] : status["stores"].items())
+        if (store.value("queue_depth", 0) != 0)
             return false;
     return true;
 }
 
-void waitUntilStoresIdle(MxReportingClient& client)
+void waitUntilStoresIdle(mxr::Client& client)
 {
     while (!storesIdle(client))
         std::this_thread::sleep_for(std::chrono::milliseconds(50));
@@ -277,11 +298,8 @@ void waitUntilStoresIdle(MxReportingClient& client)
 // its memory comes back once the session is gone.
 void measureMemory(const std::filesystem::path& socket, pid_t daemon, int reports)
 {
-    std::string error;
-    auto client = MxReportingClient::connect(socket, error);
-    client->createReportingSession(100);
-    client->setServiceType(7, 100);
-    client->startReportingSessionForID(100, nullptr);
+    auto client = connectOrExit(socket);
+    startSession(*client, 100);
     waitUntilStoresIdle(*client);
     long before = memoryKiB(daemon, "VmRSS");
 
@@ -291,8 +309,7 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
     for (int seq = 0; seq < reports; ++seq) {
         auto payload = realisticPayload(random, seq);
         wireBytes += wireSize(payload);
-        client->sendMessage(payload, 0x08000003, 1, std::vector<ReporterID>{100},
-                            [&](const MxClientResult<MxSendOutcome>&) { ++answered; });
+        client->sendAsync(payloadOf(payload), 0x08000003, 1, std::vector<std::int64_t>{100}, [&](int) { ++answered; });
         while (seq - answered.load() > 256)
             std::this_thread::yield();
     }
@@ -309,8 +326,8 @@ void measureMemory(const std::filesystem::path& socket, pid_t daemon, int report
                 "RSS %ld -> %ld KiB\n",
                 reports, perReport, wire, perReport / wire, before, kept);
 
-    client->stopReportingSessionForID(100);
-    client->destroyReportingSession(100);
+    client->stopSession(100);
+    client->destroySession(100);
     client.reset();
     auto stopped = Clock::now();
     for (int second : {1, 5, 15, 30}) {
@@ -343,9 +360,9 @@ void runLoad(const Options& options, pid_t echo, const std::filesystem::path& ec
     cpuBefore = cpuSeconds(daemon);
     Figures daemonFigures = drive(daemonSocket, options, true);
     {
-        std::string error;
-        if (auto client = MxReportingClient::connect(daemonSocket, error))
-            waitUntilStoresIdle(*client);
+        mxr::Client client(daemonSocket.c_str());
+        if (client.open())
+            waitUntilStoresIdle(client);
     }
     daemonFigures.cpuMicrosecondsPerReport =
         (cpuSeconds(daemon) - cpuBefore) * 1e6 / static_cast<double>(daemonFigures.answered);

@@ -21,7 +21,7 @@ namespace {
 class DaemonHardeningTest : public ::testing::Test {
 protected:
     void SetUp() override { daemon.start(); }
-    std::unique_ptr<MxReportingClient> connect() { return connectTo(daemon); }
+    std::unique_ptr<mxr::Client> connect() { return connectTo(daemon); }
 
     DaemonProcess daemon;
 };
@@ -32,31 +32,28 @@ TEST_F(DaemonHardeningTest, HeldStartRepliesNeverStopAClientWhoseSessionsAreBoun
 {
     auto client = connect();
     constexpr int kStarted = 600;
-    std::atomic<int> startsAnswered{0};
-    for (ReporterID id = 1; id <= kStarted; ++id) {
-        client->createReportingSession(id, nullptr);
-        client->startReportingSessionForID(
-            id, [&](MxClientResult<bool> result) { startsAnswered += result.value.value_or(false); });
+    for (std::int64_t id = 1; id <= kStarted; ++id) {
+        ASSERT_EQ(client->createSession(id), 0);
+        ASSERT_EQ(client->startSession(id), 0);
     }
-    for (ReporterID id = 1; id <= kStarted; ++id)
-        ASSERT_TRUE(client->stopReportingSessionForID(id).value.value_or(false)) << "stop " << id;
-    EXPECT_TRUE(waitUntil([&] { return startsAnswered.load() == kStarted; }));
+    for (std::int64_t id = 1; id <= kStarted; ++id)
+        ASSERT_EQ(client->stopSession(id), 0) << "stop " << id;
 
-    for (ReporterID id = kStarted + 1; id <= 1100; ++id)
-        client->createReportingSession(id, nullptr);
-    auto reporters = client->getAllReporters();
-    ASSERT_TRUE(reporters);
-    EXPECT_EQ(reporters.value->size(), 1024u) << "a client holds at most 1024 sessions";
+    for (std::int64_t id = kStarted + 1; id <= 1100; ++id)
+        ASSERT_EQ(client->createSession(id), 0);
+    std::vector<std::int64_t> reporters;
+    ASSERT_EQ(client->reporters(reporters), 0);
+    EXPECT_EQ(reporters.size(), 1024u) << "a client holds at most 1024 sessions";
     EXPECT_TRUE(daemon.waitForLog(fmt::format(
         "session limit reached: client pid {} holds 1024 sessions, none made for reporter 1025", getpid())));
-    EXPECT_TRUE(*client->createReportingSession(1).value) << "one it holds may be made anew";
-    EXPECT_TRUE(*client->destroyReportingSession(2).value);
-    EXPECT_TRUE(*client->createReportingSession(5000).value);
-    EXPECT_EQ(client->reporterID(5000).value, (Dictionary{{"reporterID", 5000}, {"serviceType", 65535}}));
+    EXPECT_EQ(client->createSession(1), 0) << "one it holds may be made anew";
+    EXPECT_EQ(client->destroySession(2), 0);
+    EXPECT_EQ(client->createSession(5000), 0);
+    EXPECT_EQ(validity(*client, 5000), (Dictionary{{"reporterID", 5000}, {"serviceType", 65535}}));
 
     auto other = connect();
-    EXPECT_TRUE(*other->createReportingSession(7000).value);
-    EXPECT_EQ(other->reporterID(7000).value, (Dictionary{{"reporterID", 7000}, {"serviceType", 65535}}))
+    EXPECT_EQ(other->createSession(7000), 0);
+    EXPECT_EQ(validity(*other, 7000), (Dictionary{{"reporterID", 7000}, {"serviceType", 65535}}))
         << "the bound is each client's own";
 }
 
@@ -65,19 +62,12 @@ TEST_F(DaemonHardeningTest, HeldStartRepliesNeverStopAClientWhoseSessionsAreBoun
 TEST_F(DaemonHardeningTest, AMessageNamesAtMostAThousandAndTwentyFourReporters)
 {
     auto client = connect();
-    ASSERT_TRUE(*client->createReportingSession(5).value);
-    auto idsOf = [](std::size_t count) {
-        return Value(Array(std::vector<Value>(count, Value(5))));
-    };
-    auto method = std::string("sendMessage:withCategory:andType:forReportingIDs:reply:");
-    auto refused = client->call(method, Array{Dictionary{{"k", 1}}, 3, 1, idsOf(1'000'000)});
-    ASSERT_TRUE(refused.error);
-    EXPECT_EQ(refused.error->code, 2);
-    EXPECT_EQ(refused.error->message,
-              "argument 4 of " + method + " must be an array of at most 1024 reporter IDs or nil");
-    auto taken = client->call(method, Array{Dictionary{{"k", 1}}, 3, 1, idsOf(1024)});
-    ASSERT_TRUE(taken.value) << (taken.error ? taken.error->message : "");
-    EXPECT_TRUE(taken.value->isNil());
+    ASSERT_EQ(client->createSession(5), 0);
+    mxr::Payload report;
+    report.add("k", 1);
+    EXPECT_EQ(client->send(report, 3, 1, std::vector<std::int64_t>(1'000'000, 5)), -EINVAL)
+        << "refused as a bad argument";
+    EXPECT_EQ(client->send(report, 3, 1, std::vector<std::int64_t>(1024, 5)), 0);
     EXPECT_TRUE(waitUntil([&] {
         return daemon.query("tally", "SELECT count(*) FROM events WHERE name LIKE '%Playback.Start'")[0][0] == "1024";
     }));
@@ -91,11 +81,11 @@ TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)
     daemon.writeFile("etc/harmonia/stores.json", R"({"tally": {"max_bytes": 1048576}})");
     daemon.start();
     auto client = connectTo(daemon);
-    ASSERT_TRUE(*client->createReportingSession(5).value);
+    ASSERT_EQ(client->createSession(5), 0);
     Dictionary report{{"filler", std::string(500, 'f')}};
     for (int i = 0; i < 10000; ++i)
-        client->sendMessage(report, 3, 1, std::vector<ReporterID>{5}, nullptr);
-    ASSERT_TRUE(client->sendMessage(report, 3, 1, std::vector<ReporterID>{5}));
+        client->sendAsync(payloadOf(report), 3, 1, std::vector<std::int64_t>{5}, nullptr);
+    ASSERT_EQ(client->send(payloadOf(report), 3, 1, {5}), 0);
     ASSERT_TRUE(daemon.waitForLog("tally.db: pruned"));
     auto onDisk = [&] {
         std::uintmax_t bytes = 0;
@@ -129,10 +119,10 @@ TEST(DaemonPermissionsTest, UnderAnOpenUmaskEveryDirectoryAndFileGetsItsOwnMode)
     daemon.start();
     umask(previous);
     auto client = connectTo(daemon);
-    ASSERT_TRUE(*client->createReportingSession(3).value);
-    client->startReportingSessionForID(3, nullptr);
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<ReporterID>{3}));
-    ASSERT_TRUE(*client->stopReportingSessionForID(3).value);
+    ASSERT_EQ(client->createSession(3), 0);
+    client->startSession(3);
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"a", 1}}), 3, 1, {3}), 0);
+    ASSERT_EQ(client->stopSession(3), 0);
     ASSERT_TRUE(
         waitUntil([&] { return std::filesystem::exists(daemon.path("var/lib/harmonia/metrics/mxreportingd.prom")); }));
     auto mode = [&](const std::string& relative) {

@@ -18,7 +18,6 @@
 #include <msgpack.hpp>
 #include <nlohmann/json.hpp>
 
-#include "client/MxReportingClient.h"
 #include "integration/DaemonProcess.h"
 #include "integration/IntegrationHelpers.h"
 #include "wire/Datagram.h"
@@ -29,7 +28,7 @@ namespace {
 class DaemonIntegrationTest : public ::testing::Test {
 protected:
     void SetUp() override { daemon.start(); }
-    std::unique_ptr<MxReportingClient> connect() { return connectTo(daemon); }
+    std::unique_ptr<mxr::Client> connect() { return connectTo(daemon); }
 
     DaemonProcess daemon;
 };
@@ -37,7 +36,7 @@ protected:
 TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
 {
     auto bystander = connect();
-    ASSERT_TRUE(*bystander->createReportingSession(7).value);
+    ASSERT_EQ(bystander->createSession(7), 0);
 
     struct Case {
         std::string bytes;
@@ -64,8 +63,8 @@ TEST_F(DaemonIntegrationTest, BadInputClosesOnlyThatConnection)
         EXPECT_TRUE(raw.waitForClose()) << badInput.reason;
         EXPECT_TRUE(daemon.waitForLog("pid " + std::to_string(getpid()) + ": " + badInput.reason)) << badInput.reason;
     }
-    EXPECT_TRUE(*bystander->setServiceType(7, 7).value) << "the bystander is still served";
-    EXPECT_EQ(*bystander->getServiceNameForReporterID(7).value, 7);
+    EXPECT_EQ(bystander->setServiceType(7, 7), 0) << "the bystander is still served";
+    EXPECT_EQ(bystander->serviceType(7), 7);
 }
 
 TEST_F(DaemonIntegrationTest, AClientThatPipelinesAndNeverReadsIsHeldAtItsBoundAndHoldsUpNobody)
@@ -102,8 +101,8 @@ TEST_F(DaemonIntegrationTest, AClientThatPipelinesAndNeverReadsIsHeldAtItsBoundA
 
     auto client = connect();
     auto began = std::chrono::steady_clock::now();
-    ASSERT_TRUE(*client->createReportingSession(9).value);
-    EXPECT_EQ(client->reporterID(9).value, (Dictionary{{"reporterID", 9}, {"serviceType", 65535}}));
+    ASSERT_EQ(client->createSession(9), 0);
+    EXPECT_EQ(validity(*client, 9), (Dictionary{{"reporterID", 9}, {"serviceType", 65535}}));
     // Not a speed check: before the bounds, a round trip waited out the whole flood.
     EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(1));
 
@@ -119,7 +118,7 @@ TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)
         daemon.spawn({MXREPORT_PATH, "create", "11", "--", "type", "11", "test", "--", "start", "11", "--wait"});
     ASSERT_TRUE(daemon.waitForLog("session created for reporter 11"));
     ASSERT_TRUE(waitUntil([&] {
-        return bystander->reporterID(11).value == Dictionary{{"reporterID", 11}, {"serviceType", 11}};
+        return validity(*bystander, 11) == Dictionary{{"reporterID", 11}, {"serviceType", 11}};
     }));
     ::kill(victim, SIGKILL);
     waitpid(victim, nullptr, 0);
@@ -138,17 +137,15 @@ TEST_F(DaemonIntegrationTest, AKilledClientsSessionsStopAndItsUptimeIsReported)
                                                      "'com.kestrel.harmonia.mxreportingclientuptime'")[0][0]);
     EXPECT_EQ(uptime["processName"], "mxreport");
     EXPECT_TRUE(uptime["seconds"].is_number_float());
-    EXPECT_EQ(bystander->reporterID(11).value, (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
-    EXPECT_TRUE(*bystander->createReportingSession(12).value);
+    EXPECT_EQ(validity(*bystander, 11), (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
+    EXPECT_EQ(bystander->createSession(12), 0);
 }
 
 TEST_F(DaemonIntegrationTest, ReportingSwitchFollowsThePreferencesWhenTheNotificationIsPosted)
 {
     auto client = connect();
     auto refused = [&] {
-        auto outcome = client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::nullopt);
-        return outcome.value && outcome.value->has_value() && (*outcome.value)->code == 1 &&
-            (*outcome.value)->domain == "com.kestrel.audio.reporting";
+        return client->send(payloadOf(Dictionary{{"a", 1}}), 3, 1, std::nullopt) == -EPERM;
     };
     daemon.writeFile("var/lib/harmonia/preferences/com.kestrel.harmonia.json",
                      R"({"disable_reporting": true, "device_name": "den"})");
@@ -164,32 +161,33 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSigtermUnderLoadLosesNoth
 {
     daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
     auto client = connect();
-    ASSERT_TRUE(*client->createReportingSession(21).value);
-    ASSERT_TRUE(*client->setServiceType(7, 21).value);
-    ASSERT_TRUE(*client->setConfiguration(Dictionary{{"HostApplicationDisplayID", "ExampleHost"}}, 21).value);
-    client->startReportingSessionForID(21, nullptr);
+    ASSERT_EQ(client->createSession(21), 0);
+    ASSERT_EQ(client->setServiceType(21, 7), 0);
+    ASSERT_EQ(client->setConfiguration(21, payloadOf(Dictionary{{"HostApplicationDisplayID", "ExampleHost"}})), 0);
+    client->startSession(21);
     for (int i = 0; i < 50; ++i)
-        ASSERT_TRUE(
-            client->sendMessage(Dictionary{{"seq", i}, {"EngineOnTime", 0.5}, {"mxreporting_timestamp", 100 + i}},
-                                0x08000003, 1, std::vector<ReporterID>{21}));
-    ASSERT_TRUE(*client->stopReportingSessionForID(21).value);
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"alone", true}}, 1, 0, std::nullopt));
-    ASSERT_TRUE(*client->createReportingSession(4).value);
-    ASSERT_TRUE(*client->setServiceType(10, 4).value); // alarms: sent alone, up to 59 s later
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"alarm", 1}}, 3, 1, std::vector<ReporterID>{4}));
+        ASSERT_EQ(
+            client->send(payloadOf(Dictionary{{"seq", i}, {"EngineOnTime", 0.5}, {"mxreporting_timestamp", 100 + i}}),
+                         0x08000003, 1, {21}),
+            0);
+    ASSERT_EQ(client->stopSession(21), 0);
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"alone", true}}), 1, 0, std::nullopt), 0);
+    ASSERT_EQ(client->createSession(4), 0);
+    ASSERT_EQ(client->setServiceType(4, 10), 0); // alarms: sent alone, up to 59 s later
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"alarm", 1}}), 3, 1, {4}), 0);
 
     // Then pipelined load on a started session, and SIGTERM in the middle of it.
-    ASSERT_TRUE(*client->createReportingSession(3).value);
-    client->startReportingSessionForID(3, nullptr);
+    ASSERT_EQ(client->createSession(3), 0);
+    client->startSession(3);
     std::atomic<int> acknowledged{0};
     std::atomic<bool> sending{true};
     std::thread load([&] {
         for (int i = 0; sending; ++i) {
-            client->sendMessage(
-                Dictionary{{"seq", i}}, 3, 2, std::vector<ReporterID>{3},
-                [&](const MxClientResult<MxSendOutcome>& result) { acknowledged += result.value ? 1 : 0; });
+            client->sendAsync(payloadOf(Dictionary{{"seq", i}}), 3, 2, std::vector<std::int64_t>{3},
+                              [&](int result) { acknowledged += result == 0 ? 1 : 0; });
+            std::vector<std::int64_t> reporters;
             if (i % 64 == 63)
-                client->getAllReporters(); // some 64 requests in flight
+                client->reporters(reporters); // some 64 requests in flight
         }
     });
     EXPECT_TRUE(waitUntil([&] { return acknowledged > 5000; }));
@@ -198,6 +196,7 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSigtermUnderLoadLosesNoth
     sending = false;
     load.join();
     EXPECT_TRUE(daemon.waitForLog("everything taken is committed"));
+    client.reset();
 
     auto count = [&](const std::string& store, const std::string& where) {
         return std::stoi(daemon.query(store, "SELECT count(*) FROM " + where)[0][0]);
@@ -234,7 +233,7 @@ TEST_F(DaemonIntegrationTest, ASecondDaemonOnTheSameRootLeavesTheFirstAlone)
     EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH}, text), 1);
     EXPECT_THAT(
         text, ::testing::HasSubstr(fmt::format("another mxreportingd (pid {}) is running on this root", daemon.pid())));
-    EXPECT_TRUE(*connect()->createReportingSession(1).value) << "the first one still serves its socket";
+    EXPECT_EQ(connect()->createSession(1), 0) << "the first one still serves its socket";
 }
 
 TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
@@ -246,17 +245,17 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
     daemon.start();
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    ASSERT_TRUE(*client->createReportingSession(3).value);
-    client->startReportingSessionForID(3, nullptr);
+    ASSERT_EQ(client->createSession(3), 0);
+    client->startSession(3);
     // More than the client may owe: it ends up waiting for room.
     constexpr int kReports = 80000;
     std::atomic<int> acknowledged{0};
+    auto report = payloadOf(Dictionary{{"filler", std::string(100, 'f')}});
     for (int i = 0; i < kReports; ++i)
-        client->sendMessage(Dictionary{{"seq", i}, {"filler", std::string(100, 'f')}}, 3, 1, std::vector<ReporterID>{3},
-                            [&](const MxClientResult<MxSendOutcome>& result) {
-                                if (result.value)
-                                    ++acknowledged;
-                            });
+        client->sendAsync(report, 3, 1, std::vector<std::int64_t>{3}, [&](int result) {
+            if (result == 0)
+                ++acknowledged;
+        });
     ASSERT_TRUE(daemon.waitForLog("the clients that sent them wait until it can write again"));
 
     // The client whose reports wait is held back once it owes its bound; the others
@@ -264,18 +263,18 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
     auto bystander = connectTo(daemon);
     std::string lastStatus;
     auto heldBack = [&] {
-        auto status = bystander->call("status", Array());
-        lastStatus = status.value ? status.value->description() : status.error->message;
-        for (const auto& entry : status.value ? *status.value->asDictionary()->find("clients")->asArray() : Array())
-            if (*entry.asDictionary()->find("held_back") == Value(true))
+        if (bystander->status(lastStatus) < 0)
+            return false;
+        auto status = nlohmann::json::parse(lastStatus);
+        for (const auto& entry : status["clients"])
+            if (entry["held_back"] == true)
                 return true;
         return false;
     };
     ASSERT_TRUE(waitUntil(heldBack, std::chrono::seconds(60))) << lastStatus << "\n" << daemon.log();
-    ASSERT_TRUE(*bystander->createReportingSession(8).value);
+    ASSERT_EQ(bystander->createSession(8), 0);
     for (int i = 0; i < 20; ++i)
-        ASSERT_TRUE(bystander->sendMessage(Dictionary{{"bystander", i}}, 3, 1, std::vector<ReporterID>{8}).value)
-            << "report " << i;
+        ASSERT_EQ(bystander->send(payloadOf(Dictionary{{"bystander", i}}), 3, 1, {8}), 0) << "report " << i;
 
     // Shutting down starts while the stores cannot write.
     daemon.signal(SIGTERM);
@@ -294,6 +293,7 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
     for (auto at = log.find("cannot write"); at != std::string::npos; at = log.find("cannot write", at + 1))
         ++failures;
     EXPECT_LE(failures, 3u) << "one line per store when failing starts, not one per row";
+    client.reset();
 }
 
 TEST(DaemonStoreFailureTest, StoresThatCannotBeWrittenAtStartUpAreAClearError)
@@ -316,8 +316,8 @@ TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
     EXPECT_TRUE(daemon.waitForLog("joule.db is corrupt"));
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    ASSERT_TRUE(*client->createReportingSession(3).value);
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"EngineOnTime", 1}}, 3, 1, std::vector<ReporterID>{3}));
+    ASSERT_EQ(client->createSession(3), 0);
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"EngineOnTime", 1}}), 3, 1, {3}), 0);
     EXPECT_TRUE(waitUntil([&] { return daemon.query("joule", "SELECT count(*) FROM events")[0][0] == "1"; }));
     // Committed before the directory goes, or the new store would hold it too.
     EXPECT_TRUE(waitUntil([&] { return daemon.query("tally", "SELECT count(*) FROM events")[0][0] == "1"; }));
@@ -327,7 +327,7 @@ TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)
     EXPECT_TRUE(setAside);
 
     std::filesystem::remove_all(daemon.path("var/lib/harmonia"));
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"after", 1}}, 3, 1, std::vector<ReporterID>{3}));
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"after", 1}}), 3, 1, {3}), 0);
     EXPECT_TRUE(daemon.waitForLog("tally.db was removed: making a new one"));
     EXPECT_TRUE(waitUntil([&] {
         auto rows = daemon.query("tally", "SELECT count(*) FROM events");
@@ -343,10 +343,10 @@ TEST_F(DaemonIntegrationTest, ASymlinkPlantedForTheSummaryDirectoryIsNotFollowed
     std::filesystem::create_directories(daemon.path("var/log/harmonia"));
     std::filesystem::create_directory_symlink(elsewhere, daemon.path("var/log/harmonia/reporting"));
     auto client = connect();
-    ASSERT_TRUE(*client->createReportingSession(5).value);
-    client->startReportingSessionForID(5, nullptr);
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<ReporterID>{5}));
-    ASSERT_TRUE(*client->stopReportingSessionForID(5).value);
+    ASSERT_EQ(client->createSession(5), 0);
+    client->startSession(5);
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"a", 1}}), 3, 1, {5}), 0);
+    ASSERT_EQ(client->stopSession(5), 0);
     EXPECT_TRUE(daemon.waitForLog("var/log/harmonia/reporting is not a directory"));
     EXPECT_TRUE(std::filesystem::is_empty(elsewhere));
 }
@@ -365,21 +365,22 @@ TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRows
     daemon.start();
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    for (ReporterID id = 1; id <= 4; ++id) {
-        ASSERT_TRUE(*client->createReportingSession(id).value);
-        ASSERT_TRUE(*client->setServiceType(11, id).value); // test sessions: no backend waits
-        ASSERT_TRUE(
-            *client->setConfiguration(Dictionary{{"HostApplicationDisplayID", fmt::format("h{}", id)}}, id).value);
-        client->startReportingSessionForID(id, nullptr);
-        ASSERT_TRUE(client->sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<ReporterID>{id}));
-        ASSERT_TRUE(*client->stopReportingSessionForID(id).value);
+    for (std::int64_t id = 1; id <= 4; ++id) {
+        ASSERT_EQ(client->createSession(id), 0);
+        ASSERT_EQ(client->setServiceType(id, 11), 0); // test sessions: no backend waits
+        ASSERT_EQ(
+            client->setConfiguration(id, payloadOf(Dictionary{{"HostApplicationDisplayID", fmt::format("h{}", id)}})),
+            0);
+        client->startSession(id);
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"a", 1}}), 3, 1, {id}), 0);
+        ASSERT_EQ(client->stopSession(id), 0);
     }
     Dictionary report{{"filler", std::string(200, 'f')}};
     for (int i = 0; i < 3000; ++i)
-        client->sendMessage(report, 1, 0, std::vector<ReporterID>{4}, nullptr); // to analytics
+        client->sendAsync(payloadOf(report), 1, 0, std::vector<std::int64_t>{4}, nullptr); // to analytics
     for (int i = 0; i < 3000; ++i)
-        client->sendMessage(report, 1, 0, std::nullopt, nullptr); // alone, to the spool
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"last", 1}}, 1, 0, std::nullopt));
+        client->sendAsync(payloadOf(report), 1, 0, std::nullopt, nullptr); // alone, to the spool
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"last", 1}}), 1, 0, std::nullopt), 0);
     EXPECT_TRUE(daemon.waitForLog("tally.db: pruned"));
     EXPECT_TRUE(daemon.waitForLog("had not been exported to every collector"));
     daemon.signal(SIGTERM);
@@ -408,13 +409,13 @@ TEST(DaemonConfigurationTest, ACheckNamesTheBadLineAndAReloadWithErrorsKeepsTheC
     auto stored = [&](const std::string& name) {
         return daemon.query("tally", "SELECT count(*) FROM events WHERE name = '" + name + "'")[0][0];
     };
-    ASSERT_TRUE(*client->createReportingSession(1).value);
-    ASSERT_TRUE(*client->setServiceType(11, 1).value); // a test session: no backend waits
-    client->startReportingSessionForID(1, nullptr);
+    ASSERT_EQ(client->createSession(1), 0);
+    ASSERT_EQ(client->setServiceType(1, 11), 0); // a test session: no backend waits
+    client->startSession(1);
     // Playback events are disabled; a volume event after each shows it was written.
     auto sendBoth = [&](int round) {
-        ASSERT_TRUE(client->sendMessage(Dictionary{{"round", round}}, 0x08000003, 1, std::vector<ReporterID>{1}));
-        ASSERT_TRUE(client->sendMessage(Dictionary{{"round", round}}, 11, 0, std::vector<ReporterID>{1}));
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"round", round}}), 0x08000003, 1, {1}), 0);
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"round", round}}), 11, 0, {1}), 0);
         ASSERT_TRUE(waitUntil([&] { return stored("com.kestrel.harmonia.Volume.Generic") == std::to_string(round); }));
     };
     sendBoth(1);
@@ -454,18 +455,18 @@ TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnS
         post(mark);
         ASSERT_TRUE(daemon.waitForLog(fmt::format("orientation feed: ignored \"{}\"", mark)));
     };
-    auto recorded = [&](const std::string& mode, const std::string& text, ReporterID id) {
+    auto recorded = [&](const std::string& mode, const std::string& text, std::int64_t id) {
         return daemon.waitForLog(fmt::format("mode={} orientation=\"{}\" app=\"(null)\"", mode, text)) &&
             daemon.waitForLog(fmt::format("id=\"MxReportingService {}\"", id));
     };
     // Types 7 and 2 are tracked, 1 is not, and nor is 7 on a device of class 6.
     for (auto [id, type] : {std::pair{1, 7}, {2, 2}, {3, 1}, {4, 7}}) {
-        ASSERT_TRUE(*client->createReportingSession(id).value);
-        ASSERT_TRUE(*client->setServiceType(static_cast<ServiceType>(type), id).value);
+        ASSERT_EQ(client->createSession(id), 0);
+        ASSERT_EQ(client->setServiceType(id, static_cast<std::uint16_t>(type)), 0);
     }
-    auto startAndWait = [&](ReporterID id) {
-        client->startReportingSessionForID(id, nullptr);
-        ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{id}));
+    auto startAndWait = [&](std::int64_t id) {
+        client->startSession(id);
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"rate", 48000}}), 3, 1, {id}), 0);
     };
     post("device 1"); // before any start: nobody hears it
     handled();
@@ -481,14 +482,14 @@ TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnS
     startAndWait(2);
     post("ui 4");
     EXPECT_TRUE(recorded("ui", "landscape-right", 2));
-    for (ReporterID id : {1, 2, 3, 4})
-        ASSERT_TRUE(*client->stopReportingSessionForID(id).value);
+    for (std::int64_t id : {1, 2, 3, 4})
+        ASSERT_EQ(client->stopSession(id), 0);
     post("device 5"); // between periods
     handled();
     startAndWait(1);
     post("device 6");
     EXPECT_TRUE(recorded("device", "face-down", 1));
-    ASSERT_TRUE(*client->stopReportingSessionForID(1).value);
+    ASSERT_EQ(client->stopSession(1), 0);
 
     // The stop's reply comes before its backend flush: wait for every summary.
     std::map<std::string, std::vector<nlohmann::json>> byReporter;
@@ -537,27 +538,28 @@ TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)
     channel("KestrelAE2MCA/overloads", 1); // and a driver missing then is never sampled
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    ASSERT_TRUE(*client->createReportingSession(6).value);
-    ASSERT_TRUE(*client->setServiceType(7, 6).value);
-    client->startReportingSessionForID(6, nullptr);
-    ASSERT_TRUE(client->sendMessage(Dictionary{{"rate", 48000}}, 3, 1, std::vector<ReporterID>{6}));
+    ASSERT_EQ(client->createSession(6), 0);
+    ASSERT_EQ(client->setServiceType(6, 7), 0);
+    client->startSession(6);
+    ASSERT_EQ(client->send(payloadOf(Dictionary{{"rate", 48000}}), 3, 1, {6}), 0);
     channel("KestrelAE2MCA/overloads", 8);
     channel("Speaker/Amp/underruns", 13);
     channel("Speaker/Amp/level", 20); // down: not reported
     channel("Front/MCA/late", 4);
     channel("Late/MCA/added", 9);
     channel("Haptics/Stats/pulses", 105);
-    ASSERT_TRUE(*client->stopReportingSessionForID(6).value);
+    ASSERT_EQ(client->stopSession(6), 0);
     auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
     EXPECT_EQ(nlohmann::json::parse(std::ifstream(summary))[2]["DriverStats_Generic_1"]["Haptics_Stats_pulses"], 5);
 
     // A second period, whose stop finds a channel gone: only that channel is lost.
-    client->startReportingSessionForID(6, nullptr);
-    ASSERT_TRUE(client->reporterID(6).value) << "the start (and its snapshot) came first";
+    client->startSession(6);
+    std::uint16_t type = 0;
+    ASSERT_EQ(client->isValid(6, type), 1) << "the start (and its snapshot) came first";
     channel("Haptics/Stats/pulses", 107);
     std::filesystem::remove(daemon.path("run/harmonia/chanstat/Speaker/Amp/level"));
     channel("Speaker/Amp/underruns", 20);
-    ASSERT_TRUE(*client->stopReportingSessionForID(6).value);
+    ASSERT_EQ(client->stopSession(6), 0);
     EXPECT_TRUE(daemon.waitForLog("Speaker/Amp/level left out of this sample: No such file or directory"));
 
     daemon.signal(SIGTERM);
@@ -636,10 +638,10 @@ TEST_F(DaemonIntegrationTest, AStreamWhoseDaemonStopsAnsweringEndsWithWhatWasNot
 TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 {
     auto client = connect();
-    ASSERT_TRUE(*client->createReportingSession(3).value);
-    client->startReportingSessionForID(3, nullptr);
+    ASSERT_EQ(client->createSession(3), 0);
+    client->startSession(3);
     for (int i = 0; i < 500; ++i)
-        ASSERT_TRUE(client->sendMessage(Dictionary{{"seq", i}}, 3, 1, std::vector<ReporterID>{3}));
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"seq", i}}), 3, 1, {3}), 0);
     auto committed = [&](const std::string& store, const std::string& table) {
         auto rows = daemon.query(store, "SELECT count(*) FROM " + table);
         return rows.empty() ? 0 : std::stoi(rows[0][0]);
@@ -648,7 +650,7 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
         waitUntil([&] { return committed("tally", "events") == 500 && committed("uplink", "messages") == 500; }));
     // Keep the daemon busy while it dies.
     for (int i = 0; i < 200; ++i)
-        client->sendMessage(Dictionary{{"late", i}}, 3, 1, std::vector<ReporterID>{3}, nullptr);
+        client->sendAsync(payloadOf(Dictionary{{"late", i}}), 3, 1, std::vector<std::int64_t>{3}, nullptr);
     daemon.signal(SIGKILL);
     EXPECT_EQ(daemon.waitForExit(), 128 + SIGKILL);
 
@@ -659,9 +661,9 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonKeepsWhatItCommittedAndStartsCleanly)
 
     daemon.start();
     auto again = connect();
-    ASSERT_TRUE(*again->createReportingSession(4).value);
-    again->startReportingSessionForID(4, nullptr);
-    ASSERT_TRUE(*again->stopReportingSessionForID(4).value);
+    ASSERT_EQ(again->createSession(4), 0);
+    again->startSession(4);
+    ASSERT_EQ(again->stopSession(4), 0);
     EXPECT_TRUE(waitUntil([&] { return daemon.query("uplink", "SELECT count(*) FROM sessions")[0][0] == "2"; }))
         << "backend sessions go on numbering after the crash";
 }

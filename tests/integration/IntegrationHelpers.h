@@ -1,7 +1,8 @@
 #pragma once
 // What the integration tests share beyond the daemon itself: a connection that speaks
-// raw bytes, a client of the real library, a small tmpfs to fill, and the memory a
-// daemon may take however a client behaves.
+// raw bytes, a client of the library (libmxreporting, through its C++ header) with the
+// tests' reports as its payloads, a small tmpfs to fill, and the memory a daemon may
+// take however a client behaves.
 
 #include <cerrno>
 #include <cstring>
@@ -18,8 +19,11 @@
 #include <gtest/gtest.h>
 #include <msgpack.hpp>
 
-#include "client/MxReportingClient.h"
+#include <mxreporting/mxreporting.hpp>
+
 #include "integration/DaemonProcess.h"
+#include "value/JsonValue.h"
+#include "value/Value.h"
 
 namespace mx::testing {
 
@@ -80,12 +84,42 @@ inline std::string packed(const std::function<void(msgpack::packer<msgpack::sbuf
     return std::string(buffer.data(), buffer.size());
 }
 
-inline std::unique_ptr<MxReportingClient> connectTo(const DaemonProcess& daemon)
+// A client of the library on the daemon's socket.
+inline std::unique_ptr<mxr::Client> connectTo(const DaemonProcess& daemon)
 {
-    std::string error;
-    auto client = MxReportingClient::connect(daemon.socketPath(), error);
-    EXPECT_TRUE(client) << error;
+    auto client = std::make_unique<mxr::Client>(daemon.socketPath().c_str());
+    EXPECT_TRUE(client->open()) << mxr::errorText(client->error());
     return client;
+}
+
+// A report written as the tests write them, as the library takes it: nested values
+// go as their JSON text.
+inline mxr::Payload payloadOf(const Dictionary& dictionary)
+{
+    mxr::Payload payload;
+    for (const auto& [key, value] : dictionary) {
+        const char* name = key.c_str();
+        if (const std::int64_t* integer = value.asInt())
+            payload.add(name, *integer);
+        else if (const double* real = value.asDouble())
+            payload.add(name, *real);
+        else if (const std::string* text = value.asString())
+            payload.add(name, *text);
+        else if (const bool* flag = value.asBool())
+            payload.add(name, *flag);
+        else
+            payload.addJson(name, toJsonText(value).c_str());
+    }
+    return payload;
+}
+
+// The daemon's answer to reporterID:valid:, as the protocol words it.
+inline Dictionary validity(mxr::Client& client, std::int64_t reporterID)
+{
+    std::uint16_t type = 0;
+    int found = client.isValid(reporterID, type);
+    EXPECT_GE(found, 0) << mxr::errorText(found);
+    return Dictionary{{"reporterID", found == 1 ? reporterID : 0}, {"serviceType", type}};
 }
 
 // A small tmpfs over `path` for as long as it lives, where this machine lets a test
