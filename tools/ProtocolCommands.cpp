@@ -49,9 +49,10 @@ std::unique_ptr<MxReportCommand> start(const Words& words)
             return failed("start", error);
         std::printf("start %lld: sent, its reply is held until the session stops\n", static_cast<long long>(id));
         std::fflush(stdout);
-        while (wait)
+        if (!wait)
+            return kExitDone;
+        for (;;)
             pause();
-        return kExitDone;
     });
 }
 

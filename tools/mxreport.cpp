@@ -6,6 +6,7 @@
 // the daemon share one connection.
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <grp.h>
@@ -150,7 +151,10 @@ void sayUnreachable(const std::string& socket, int error)
 {
     struct stat status {};
     if (error == -EACCES && ::stat(socket.c_str(), &status) == 0) {
-        struct group* owner = getgrgid(status.st_gid);
+        struct group entry {};
+        struct group* owner = nullptr;
+        std::array<char, 4096> buffer{};
+        getgrgid_r(status.st_gid, &entry, buffer.data(), buffer.size(), &owner);
         std::string name = owner ? owner->gr_name : std::to_string(status.st_gid);
         std::fprintf(stderr,
                      "mxreport: permission denied on %s: only its group may connect; add this user to group %s "
@@ -197,6 +201,7 @@ int run(int argc, char** argv)
         return viewStore(chain[0]);
 
     std::vector<std::unique_ptr<MxReportCommand>> commands;
+    commands.reserve(chain.size());
     for (const auto& command : chain)
         commands.push_back(parseCommand(command));
     std::optional<mxr::Client> client;

@@ -9,7 +9,6 @@
  * was called; the process is killed (SIGSYS) by any other system call. Under a
  * sanitizer, whose runtime makes calls and allocations of its own, neither the filter
  * nor the counting applies: the reports must still all arrive. */
-#define _GNU_SOURCE
 #include <errno.h>
 #include <inttypes.h>
 #include <linux/audit.h>
@@ -32,10 +31,10 @@
 #ifndef MXREPORTING_PROBE_UNDER_SANITIZER
 /* Every allocation of the process goes through here; those of the sending thread,
  * while it sends, are counted. */
-extern void *__libc_malloc(size_t size);
-extern void *__libc_calloc(size_t count, size_t size);
-extern void *__libc_realloc(void *pointer, size_t size);
-extern void *__libc_memalign(size_t alignment, size_t size);
+extern void *__libc_malloc(size_t size); /* NOLINT(bugprone-reserved-identifier): glibc's own allocator */
+extern void *__libc_calloc(size_t count, size_t size); /* NOLINT(bugprone-reserved-identifier): glibc's own allocator */
+extern void *__libc_realloc(void *pointer, size_t size); /* NOLINT(bugprone-reserved-identifier): glibc's own allocator */
+extern void *__libc_memalign(size_t alignment, size_t size); /* NOLINT(bugprone-reserved-identifier): glibc's own allocator */
 
 static __thread int counting;
 static atomic_int allocations;
@@ -165,7 +164,7 @@ int main(int argc, char **argv)
         mxr_client_get_rt_counts(probe.client, &sent, &dropped, &failed);
         if (sent + dropped + failed >= (uint64_t)probe.reports)
             break;
-        struct timespec pause = {.tv_sec = 0, .tv_nsec = 10 * 1000 * 1000};
+        struct timespec pause = {.tv_sec = 0, .tv_nsec = 10L * 1000 * 1000};
         nanosleep(&pause, NULL);
     }
     int stopped = mxr_session_stop(probe.client, REPORTER);
