@@ -84,7 +84,7 @@ void MxReportingConnection::call(std::string_view method, Array params, Completi
 }
 
 int MxReportingConnection::callAndWait(std::string_view method, Array params, Value& result,
-                                       MxReportingSessionEffect effect)
+                                       const MxReportingSessionEffect& effect)
 {
     return wait(Request{0, std::string(method), std::move(params), nullptr, {}}, result, effect);
 }

@@ -39,9 +39,6 @@ struct mxr_throttle {
 
 namespace {
 
-// The most reporter IDs the daemon takes in one message.
-constexpr std::size_t kMaximumReporterIDs = 1024;
-
 // Where the library's lines go: the caller's function, or standard error.
 struct LogDestination {
     std::mutex mutex;
@@ -137,13 +134,13 @@ int addValue(mxr_payload* p, const char* key, Value value)
 
 using Kind = MxReportingSessionEffect::Kind;
 
-int sessionCall(mxr_client* c, std::string_view method, Array params, MxReportingSessionEffect effect)
+int sessionCall(mxr_client* c, std::string_view method, Array params, const MxReportingSessionEffect& effect)
 {
     if (!c)
         return -EINVAL;
     return guarded([&] {
         Value result;
-        int error = c->connection->callAndWait(method, std::move(params), result, std::move(effect));
+        int error = c->connection->callAndWait(method, std::move(params), result, effect);
         return expectTrue(error, result);
     });
 }
