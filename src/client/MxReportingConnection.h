@@ -62,8 +62,7 @@ public:
     void call(std::string_view method, Array params, Completion done, MxReportingSessionEffect effect = {});
     // The same, waiting for the reply up to the timeout. -EDEADLK from the
     // connection's own thread, where the reply could never come.
-    int callAndWait(std::string_view method, Array params, Value& result,
-                    const MxReportingSessionEffect& effect = {});
+    int callAndWait(std::string_view method, Array params, Value& result, const MxReportingSessionEffect& effect = {});
     // A start: the daemon holds its reply until the session is stopped, so it is sent
     // and not waited for, and restoring the session starts it again rather than this.
     void start(std::int64_t reporterID);
