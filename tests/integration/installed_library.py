@@ -39,8 +39,10 @@ def main():
         flags = run(["pkg-config", "--cflags", "--libs", "mxreporting"],
                     env=dict(os.environ, PKG_CONFIG_PATH=os.path.dirname(pc[0]))).stdout.split()
         program = os.path.join(prefix, "realtime_reporter")
+        # A sanitized build's library needs its runtime linked into the program.
+        sanitizer = os.environ.get("MXREPORTING_EXAMPLE_LINK_FLAGS", "").split()
         compiled = run(["cc", "-std=c99", "-Wall", "-Werror", os.path.join(source, "examples/realtime_reporter.c"),
-                        *flags, "-lpthread", "-o", program])
+                        *flags, *sanitizer, "-lpthread", "-o", program])
         checks.equal("the C example builds against the installed files", compiled.returncode, 0)
         print(compiled.stderr, end="")
 
