@@ -1,0 +1,39 @@
+#pragma once
+// What a process has cost so far, read from /proc: the CPU time and the context
+// switches of all its threads, and its memory.
+
+#include <cstdint>
+#include <map>
+#include <string>
+#include <sys/types.h>
+
+namespace mx::bench {
+
+struct ThreadCounters {
+    double cpuSeconds = 0;      // run time, to the nanosecond (schedstat)
+    std::uint64_t switches = 0; // voluntary and involuntary context switches
+
+    ThreadCounters& operator+=(const ThreadCounters& other)
+    {
+        cpuSeconds += other.cpuSeconds;
+        switches += other.switches;
+        return *this;
+    }
+};
+
+struct ProcessCounters : ThreadCounters {
+    std::map<std::string, ThreadCounters> byThreadName; // what the threads of each name cost
+
+    // The threads living now: a thread that ended since an earlier reading takes its
+    // share with it, so readings compare across a span in which no thread ends.
+    static ProcessCounters of(pid_t pid);
+    ProcessCounters operator-(const ProcessCounters& earlier) const;
+};
+
+// A field of /proc/PID/status in KiB ("VmHWM", "VmRSS"), or -1.
+long memoryKiB(pid_t pid, const std::string& field);
+
+// Forgets the peak resident size so far: VmHWM starts again from VmRSS.
+void resetPeakMemory(pid_t pid);
+
+} // namespace mx::bench
