@@ -140,6 +140,12 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
                            "FROM pragma_page_count(), pragma_freelist_count(), pragma_page_size()",
                            -1, SQLITE_PREPARE_PERSISTENT, &connection.dataSize, nullptr) != SQLITE_OK)
         return fail(std::string(sqlite3_errmsg(connection.database)) + " in the size query");
+    // Every batch begins and commits: parsed once.
+    if (sqlite3_prepare_v3(connection.database, "BEGIN", -1, SQLITE_PREPARE_PERSISTENT, &connection.begin, nullptr) !=
+            SQLITE_OK ||
+        sqlite3_prepare_v3(connection.database, "COMMIT", -1, SQLITE_PREPARE_PERSISTENT, &connection.commit, nullptr) !=
+            SQLITE_OK)
+        return fail(std::string(sqlite3_errmsg(connection.database)) + " in preparing a transaction");
     struct stat status {};
     if (::stat(path.c_str(), &status) != 0)
         return fail("vanished as it was opened");
@@ -153,8 +159,10 @@ void SqliteStore::disconnect(Connection& connection)
     for (auto* statement : connection.statements)
         sqlite3_finalize(statement);
     connection.statements.clear();
-    sqlite3_finalize(connection.dataSize);
-    connection.dataSize = nullptr;
+    for (auto** statement : {&connection.dataSize, &connection.begin, &connection.commit}) {
+        sqlite3_finalize(*statement);
+        *statement = nullptr;
+    }
     sqlite3_close(connection.database);
     connection.database = nullptr;
 }
@@ -191,7 +199,9 @@ void SqliteStore::submit(SqliteWrite write)
     std::lock_guard lock(mutex_);
     queue_.push_back(std::move(write));
     ++submitted_;
-    if (writerWaiting_)
+    // A quiet writer is woken by the first row, a gathering one by the row that fills
+    // its batch; the rows between wait for the window to end.
+    if (writerWaiting_ || (gathering_ && queue_.size() == kBatchLimit))
         changed_.notify_all();
 }
 
@@ -199,6 +209,7 @@ void SqliteStore::flush()
 {
     std::unique_lock lock(mutex_);
     std::uint64_t target = submitted_;
+    flushing_ = committed_ < target;
     changed_.notify_all();
     changed_.wait(lock, [&] { return committed_ >= target; });
 }
@@ -206,16 +217,29 @@ void SqliteStore::flush()
 void SqliteStore::run()
 {
     std::unique_lock lock(mutex_);
+    // While rows keep coming the writer gathers window after window on its own clock,
+    // and callers never wake it; a window that brings nothing makes it quiet, and then
+    // the next row wakes it.
+    bool active = false;
     for (;;) {
-        writerWaiting_ = true;
-        changed_.wait(lock, [&] { return !queue_.empty() || stopping_; });
-        writerWaiting_ = false;
-        if (queue_.empty() && stopping_)
-            return;
-        if (!stopping_ && queue_.size() < kBatchLimit) {
+        if (!active && queue_.empty() && !stopping_) {
             lock.unlock();
-            std::this_thread::sleep_for(kBatchWindow);
+            cutBackLog();
             lock.lock();
+            writerWaiting_ = true;
+            changed_.wait(lock, [&] { return !queue_.empty() || stopping_; });
+            writerWaiting_ = false;
+        }
+        gathering_ = true;
+        changed_.wait_for(lock, kBatchWindow, [&] { return queue_.size() >= kBatchLimit || stopping_ || flushing_; });
+        gathering_ = false;
+        if (queue_.size() <= kBatchLimit)
+            flushing_ = false;
+        active = !queue_.empty();
+        if (!active) {
+            if (stopping_)
+                return;
+            continue;
         }
         if (newRetention_) {
             retention_ = *std::exchange(newRetention_, std::nullopt);
@@ -232,19 +256,13 @@ void SqliteStore::run()
         // The rows' debts settle now, outside the lock: a client held back by them is
         // resumed from here.
         batch.clear();
-        // Age is looked at now and then; size after every batch, which costs three
-        // page counts, so that a burst never takes the store far past its bound.
-        if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval ||
-            (retention_.maxBytes > 0 && connection_.database && dataBytes() > rowsShare()))
+        // Age is looked at now and then; size after any batch that may have taken the
+        // rows past their share, so that a burst never takes the store far past its bound.
+        if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval || rowsMayExceedShare())
             prune();
         lock.lock();
         committed_ += written;
         changed_.notify_all();
-        if (queue_.empty() && !stopping_) {
-            lock.unlock();
-            cutBackLog();
-            lock.lock();
-        }
     }
 }
 
@@ -297,7 +315,20 @@ std::uint64_t SqliteStore::dataBytes()
     if (sqlite3_step(connection_.dataSize) == SQLITE_ROW)
         bytes = sqlite3_column_int64(connection_.dataSize, 0);
     sqlite3_reset(connection_.dataSize);
-    return static_cast<std::uint64_t>(bytes);
+    measuredBytes_ = static_cast<std::uint64_t>(bytes);
+    unmeasuredBytes_ = 0;
+    return *measuredBytes_;
+}
+
+// The three page counts are asked for only when the rows written since they were last
+// asked for could, grown by their pages and indexes, have passed the share.
+bool SqliteStore::rowsMayExceedShare()
+{
+    if (retention_.maxBytes == 0 || !connection_.database)
+        return false;
+    if (measuredBytes_ && *measuredBytes_ + kRowGrowthFactor * unmeasuredBytes_ <= rowsShare())
+        return false;
+    return dataBytes() > rowsShare();
 }
 
 // Rows removed by one step in one transaction, or -1 when it failed.
@@ -435,6 +466,7 @@ bool SqliteStore::stillOnDisk(std::string& error)
         MXLOG(nullptr, Error, "{} was removed: making a new one", path_.string());
     disconnect(connection_);
     logConfigured_ = false;
+    measuredBytes_.reset();
     int code = SQLITE_OK;
     if (connect(path_, schema_, statementTexts_, connection_, error, code))
         return true;
@@ -461,9 +493,16 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
         }
         return false;
     };
-    if (sqlite3_exec(database, "BEGIN", nullptr, nullptr, nullptr) != SQLITE_OK)
+    auto stepOnce = [](sqlite3_stmt* statement) {
+        int stepped = sqlite3_step(statement);
+        sqlite3_reset(statement);
+        return stepped == SQLITE_DONE;
+    };
+    if (!stepOnce(connection_.begin))
         return failed("begin");
+    std::uint64_t bytes = 0;
     for (auto& write : batch) {
+        bytes += kRowOverheadBytes;
         sqlite3_stmt* statement = connection_.statements[write.statement];
         if (texts_.size() < write.parameters.size())
             texts_.resize(write.parameters.size());
@@ -472,16 +511,19 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
             std::visit(
                 [&](const auto& value) {
                     using T = std::decay_t<decltype(value)>;
-                    if constexpr (std::is_same_v<T, std::nullptr_t>)
+                    if constexpr (std::is_same_v<T, std::nullptr_t>) {
                         sqlite3_bind_null(statement, index);
-                    else if constexpr (std::is_same_v<T, std::int64_t>)
+                    } else if constexpr (std::is_same_v<T, std::int64_t>) {
                         sqlite3_bind_int64(statement, index, value);
-                    else if constexpr (std::is_same_v<T, double>)
+                        bytes += sizeof value;
+                    } else if constexpr (std::is_same_v<T, double>) {
                         sqlite3_bind_double(statement, index, value);
-                    else if constexpr (std::is_same_v<T, std::string>)
+                        bytes += sizeof value;
+                    } else if constexpr (std::is_same_v<T, std::string>) {
                         sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()),
                                           SQLITE_STATIC);
-                    else {
+                        bytes += value.size();
+                    } else {
                         // The text stays in its buffer until the row is stepped.
                         std::string& text = texts_[i];
                         text.clear();
@@ -490,6 +532,7 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
                         else
                             appendJsonText(text, (*value)());
                         sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+                        bytes += text.size();
                     }
                 },
                 write.parameters[i]);
@@ -504,8 +547,9 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
     for (auto& text : texts_)
         if (text.capacity() > kTextKeptBytes)
             std::string().swap(text);
-    if (sqlite3_exec(database, "COMMIT", nullptr, nullptr, nullptr) != SQLITE_OK)
+    if (!stepOnce(connection_.commit))
         return failed("commit");
+    unmeasuredBytes_ += bytes;
     return true;
 }
 

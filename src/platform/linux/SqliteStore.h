@@ -74,10 +74,12 @@ class SqliteStore {
 public:
     // A batch stays short enough that a client held back by its rows gets room back
     // within a millisecond or two, not after a commit of thousands of rows.
-    static constexpr std::size_t kBatchLimit = 512;
-    // How long the writer lets a batch gather once the first row of it arrived: a
-    // thousand rows a millisecond cost one transaction and one wake-up, not a thousand.
-    static constexpr std::chrono::milliseconds kBatchWindow{2};
+    static constexpr std::size_t kBatchLimit = 256;
+    // How long the writer lets a batch gather, from its first row or from the last
+    // commit while rows keep coming, unless the batch fills first: at everyday rates a transaction and its wake-ups
+    // cost far more than a row, so one commit a window carries what a few hundred reports left. It is also what a
+    // SIGKILL may take of rows whose reports were answered, with the commit's own time on top.
+    static constexpr std::chrono::milliseconds kBatchWindow{50};
     // Writers yield the processor to request handling: a commit that takes the CPU
     // a client's request wakes on delays its reply by the length of the commit.
     // Under sustained load they still get their share, and the bounded queue
@@ -95,6 +97,11 @@ public:
     static constexpr std::chrono::seconds kPruneInterval{10};
     static constexpr std::int64_t kAgeChunk = 2000;
     static constexpr std::int64_t kSizeChunk = 100;
+    // What a stored row takes beyond its parameters' bytes, and how much more its pages
+    // and indexes take than that, at most: the size is asked for only when what the
+    // rows may take by this reckoning could pass their share.
+    static constexpr std::uint64_t kRowOverheadBytes = 64;
+    static constexpr std::uint64_t kRowGrowthFactor = 2;
     static constexpr double kSizeLowWater = 0.9;
     // A store's byte bound holds its file and its write-ahead log together, as `du`
     // sees them: the log's share is a quarter of the bound, within these; the rows
@@ -140,6 +147,8 @@ private:
         sqlite3* database = nullptr;
         std::vector<sqlite3_stmt*> statements;
         sqlite3_stmt* dataSize = nullptr; // the bytes the rows take
+        sqlite3_stmt* begin = nullptr;
+        sqlite3_stmt* commit = nullptr;
         dev_t device = 0;
         ino_t inode = 0;
     };
@@ -161,6 +170,7 @@ private:
     void cutBackLog();
     std::int64_t pruneStep(const SqliteRetention::Step& step, std::int64_t cutoff);
     std::uint64_t dataBytes();
+    bool rowsMayExceedShare();
 
     const std::filesystem::path path_;
     const std::vector<std::string> schema_;
@@ -171,6 +181,10 @@ private:
     Connection connection_;
     std::vector<std::string> texts_; // writer thread only: each parameter's JSON text for the row at hand
     std::chrono::steady_clock::time_point lastPrune_{};
+    // Writer thread only: what the rows took when last asked (nothing: ask at once), and
+    // what the batches since bound and stepped.
+    std::optional<std::uint64_t> measuredBytes_;
+    std::uint64_t unmeasuredBytes_ = 0;
 
     std::mutex mutex_;
     std::condition_variable changed_;
@@ -179,7 +193,9 @@ private:
     std::uint64_t committed_ = 0;
     std::uint64_t failures_ = 0;
     bool stopping_ = false;
-    bool writerWaiting_ = false;
+    bool flushing_ = false;      // a flush waits: the batch at hand goes now
+    bool writerWaiting_ = false; // for a first row
+    bool gathering_ = false;     // for the window to end or the batch to fill
     std::thread writer_;
 };
 
