@@ -102,9 +102,11 @@ void MxReportingSession::start()
 
     MxReportingSessionUplink::Configuration configuration{userInfo_, serviceName(), serviceType(),
                                                           uplinkSessionStarted()};
-    uplinkQueue()->dispatch([self = shared_from_this(), configuration = std::move(configuration)] {
-        self->uplink_.configure(self->serviceType(), configuration);
-    });
+    uplinkQueue()->dispatch(
+        [self = shared_from_this(), earlier = uplink_.takeHeld(), configuration = std::move(configuration)]() mutable {
+            self->deliver(std::move(earlier));
+            self->uplink_.configure(self->serviceType(), configuration);
+        });
 }
 
 void MxReportingSession::stop()
@@ -126,7 +128,10 @@ void MxReportingSession::stop()
     }
     writeSummaryJson();
 
-    uplinkQueue()->dispatch([self = shared_from_this()] { self->uplink_.flush(self->serviceType()); });
+    uplinkQueue()->dispatch([self = shared_from_this(), earlier = uplink_.takeHeld()]() mutable {
+        self->deliver(std::move(earlier));
+        self->uplink_.flush(self->serviceType());
+    });
 
     dropAggregated(aggregatedPayloadData_);
     dropAggregated(nestedAggregatedPayloadData_);
@@ -171,13 +176,27 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
     // Whether the message goes in-session or alone is decided now, not at delivery.
     bool wasStarted = started();
     // Owed by the client that sent it until delivered, and so is what the delivery writes.
-    uplinkQueue()->dispatch(
-        [self = shared_from_this(), cleaned, message, wasStarted, category, type, debt = BacklogDebt::incur()] {
-            ScopedBacklogAccount charging(debt);
-            self->uplink_.deliver(self->serviceType(), cleaned, message, wasStarted, category, type, *self->userInfo_);
-        });
+    if (uplink_.hold({std::move(cleaned), message, wasStarted, category, type, BacklogDebt::incur()}))
+        queueHeldDeliveries();
     if (reply)
         reply(std::nullopt);
+}
+
+void MxReportingSession::queueHeldDeliveries()
+{
+    uplinkQueue()->dispatchAfter(MxReportingSessionUplink::kDeliveryGathering,
+                                 [self = shared_from_this()] { self->deliver(self->uplink_.takeHeld()); });
+}
+
+void MxReportingSession::deliver(std::vector<MxReportingSessionUplink::Delivery> deliveries)
+{
+    for (auto& delivery : deliveries) {
+        // Each delivery's debt settles as soon as it is delivered.
+        auto debt = std::move(delivery.debt);
+        ScopedBacklogAccount charging(debt);
+        uplink_.deliver(serviceType(), delivery.cleaned, delivery.message, delivery.wasStarted, delivery.category,
+                        delivery.type, *userInfo_);
+    }
 }
 
 bool MxReportingSession::shouldReportOrientation() const

@@ -118,6 +118,10 @@ private:
     void unregisterOrientation();
     // `mode` is "device" or "ui"; runs on a thread of the orientation service.
     void recordOrientation(std::string_view mode, int orientation);
+    // Queues the run that delivers what is held then.
+    void queueHeldDeliveries();
+    // Uplink queue only.
+    void deliver(std::vector<MxReportingSessionUplink::Delivery> deliveries);
     // New empty stores for a period, sharing one arena.
     void makePeriodStores();
     // Keeps a message in both stores: as it is, and under its identifier.

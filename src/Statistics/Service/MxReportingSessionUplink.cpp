@@ -2,6 +2,7 @@
 
 #include <cassert>
 #include <random>
+#include <utility>
 
 #include "Statistics/MxReportingUtilityWait.h"
 #include "Statistics/Service/MxReportingSession.h"
@@ -44,6 +45,19 @@ MxReportingSessionUplink::MxReportingSessionUplink(ReporterID reporterID)
       queue_(
           ProcessWide<Dispatch>::get().makeSerialQueue("com.kestrel.harmonia.session.uplink", QueuePriority::Utility))
 {
+}
+
+bool MxReportingSessionUplink::hold(Delivery delivery)
+{
+    std::lock_guard lock(heldMutex_);
+    held_.push_back(std::move(delivery));
+    return held_.size() == 1;
+}
+
+std::vector<MxReportingSessionUplink::Delivery> MxReportingSessionUplink::takeHeld()
+{
+    std::lock_guard lock(heldMutex_);
+    return std::exchange(held_, {});
 }
 
 void MxReportingSessionUplink::configure(ServiceType currentType, const Configuration& configuration)

@@ -2,18 +2,26 @@
 // A session's side of the reporting backend: its backend session and token, and the
 // work that runs on the session's own serial uplink queue, in submission order:
 // backend configuration with the discovery wait, in-session deliveries, the flush.
+// Deliveries are held and go in gathered runs: at everyday rates a queue hop per
+// report costs more than the delivery, so a run a few milliseconds after the first
+// held one takes all that came since. Configuration and flush take what is held
+// before they are queued, so nothing is delivered out of its order with them.
 // Owned by its MxReportingSession, which queues that work holding itself, so the
 // session (and this object) outlives every queued job. Also sends single messages,
 // which go alone from the global utility queue.
 
 #include <atomic>
+#include <chrono>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "Statistics/MxAtomicProperty.h"
 #include "Statistics/MxLockedDictionary.h"
 #include "Statistics/MxReportingVocabulary.h"
+#include "platform/BacklogAccount.h"
 #include "platform/UniqueFunction.h"
 #include "platform/Uplink.h"
 #include "platform/WorkQueue.h"
@@ -36,6 +44,21 @@ public:
         bool discovered = false;
     };
 
+    // A message on its way to the backend, owed by the client that sent it until it
+    // is delivered.
+    struct Delivery {
+        Dictionary cleaned;
+        Dictionary message;
+        bool wasStarted = false;
+        MessageCategory category = 0;
+        MessageType type = 0;
+        BacklogDebt debt;
+    };
+
+    // How long a run of deliveries gathers after the first of it is held. Short beside
+    // the stores' own gathering: together they stay within what a SIGKILL may take.
+    static constexpr std::chrono::milliseconds kDeliveryGathering{20};
+
     explicit MxReportingSessionUplink(ReporterID reporterID);
     MxReportingSessionUplink(const MxReportingSessionUplink&) = delete;
     MxReportingSessionUplink& operator=(const MxReportingSessionUplink&) = delete;
@@ -46,6 +69,12 @@ public:
     bool uplinkSessionStarted() const { return uplinkSessionStarted_.load(); }
     std::shared_ptr<UplinkSession> uplinkSession() const { return uplinkSession_.get(); }
     std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplinkAgentToken_.get(); }
+
+    // Any thread. Holds the delivery for the next run; true when nothing was held
+    // before it, and the caller queues that run.
+    bool hold(Delivery delivery);
+    // Any thread. What is held, in order, for a job about to be queued.
+    std::vector<Delivery> takeHeld();
 
     // Uplink queue only. `currentType` is the session's service type as the job runs.
     void configure(ServiceType currentType, const Configuration& configuration);
@@ -66,6 +95,8 @@ private:
     std::atomic<bool> uplinkSessionStarted_{false};
     MxAtomicProperty<std::shared_ptr<UplinkSession>> uplinkSession_;
     MxAtomicProperty<std::optional<UplinkSecureHierarchyToken>> uplinkAgentToken_;
+    std::mutex heldMutex_;
+    std::vector<Delivery> held_;
 };
 
 } // namespace mx

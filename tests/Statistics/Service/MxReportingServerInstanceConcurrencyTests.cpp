@@ -58,8 +58,8 @@ protected:
 
     static std::vector<ReporterID> ownIDs(int client) { return {100 + client * 10 + 1, 100 + client * 10 + 2}; }
 
-    // Runs a marker through every session's backend queue and waits for all of them:
-    // everything queued before is then delivered.
+    // Runs a marker through every session's backend queue, after the run of what each
+    // holds, and waits for all of them: everything sent before is then delivered.
     void drainSessionQueues()
     {
         std::vector<std::shared_ptr<MxReportingSession>> sessions;
@@ -73,7 +73,8 @@ protected:
         ASSERT_EQ(listed.get_future().wait_for(kBound), std::future_status::ready);
         Countdown drained(static_cast<int>(sessions.size()));
         for (const auto& session : sessions)
-            session->uplinkQueue()->dispatch([&] { drained.arrive(); });
+            session->uplinkQueue()->dispatchAfter(2 * MxReportingSessionUplink::kDeliveryGathering,
+                                                  [&] { drained.arrive(); });
         ASSERT_TRUE(drained.wait());
     }
 

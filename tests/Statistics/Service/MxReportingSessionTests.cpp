@@ -25,7 +25,13 @@ protected:
         return session;
     }
 
-    void run() { platform.dispatch.runUntilIdle(); }
+    // Runs what is queued, and the deliveries it held once they have gathered.
+    void run()
+    {
+        platform.dispatch.runUntilIdle();
+        platform.dispatch.advance(MxReportingSessionUplink::kDeliveryGathering);
+        platform.dispatch.runUntilIdle();
+    }
 
     static std::vector<std::string> identifiers(const MxReportingSession& session)
     {
