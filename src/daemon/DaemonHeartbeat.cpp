@@ -30,19 +30,10 @@ void DaemonHeartbeat::stop()
 void DaemonHeartbeat::beat()
 {
     sd_notify(0, "WATCHDOG=1");
-    serverQueue_->dispatch([this] {
-        // The file is written off the server queue, whose requests a slow disk must not
-        // hold up, and one write at a time: a beat that finds the last one unfinished
-        // leaves the file to the next.
-        if (writing_.exchange(true))
-            return;
-        ProcessWide<Dispatch>::get()
-            .globalQueue(QueuePriority::Utility)
-            .dispatch([this, snapshot = status_.snapshot()] {
-                MxReportingMetrics::write(snapshot);
-                sd_notify(0, ("STATUS=" + MxReportingStatus::summaryLine(snapshot)).c_str());
-                writing_.store(false);
-            });
+    serverQueue_->dispatch([&status = status_] {
+        auto snapshot = status.snapshot();
+        MxReportingMetrics::write(snapshot);
+        sd_notify(0, ("STATUS=" + MxReportingStatus::summaryLine(snapshot)).c_str());
     });
     timer_.expires_after(interval_);
     timer_.async_wait([this](const std::error_code& cancelled) {

@@ -1,14 +1,12 @@
 #pragma once
 // The daemon's pulse, every few seconds: systemd's watchdog is told that the I/O
-// context of the connections still runs handlers, and the server queue takes the
-// status view, from which a utility queue writes the metrics file and systemd's
-// status line. The watchdog is fed
+// context of the connections still runs handlers, and the server queue writes the
+// metrics file and systemd's status line from the status view. The watchdog is fed
 // by a timer, not by the server queue, because the server queue may rightly wait a
 // long time on a full disk (a declared wait: the pool lends a thread that keeps the
 // timer and the connections going), and a restart then would lose what the stores
 // still hold.
 
-#include <atomic>
 #include <chrono>
 #include <memory>
 
@@ -41,7 +39,6 @@ private:
     std::shared_ptr<WorkQueue> serverQueue_;
     MxReportingStatus& status_;
     std::chrono::milliseconds interval_ = kInterval;
-    std::atomic<bool> writing_{false};
 };
 
 } // namespace mx
