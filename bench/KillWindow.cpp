@@ -8,6 +8,7 @@
 #include <cstring>
 #include <random>
 #include <sqlite3.h>
+#include <stdexcept>
 #include <string>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -119,10 +120,8 @@ KillWindowFigures measureKillWindow(const std::filesystem::path& root, double ra
     double windowsSum = 0;
     for (int number = 0; number < rounds; ++number) {
         pid_t daemon = spawnDaemon(root);
-        if (!waitForSocket(daemonSocket(root))) {
-            std::fprintf(stderr, "kill window: the daemon did not come up\n");
-            std::exit(1);
-        }
+        if (!waitForSocket(daemonSocket(root)))
+            throw std::runtime_error("kill window: the daemon did not come up");
         double began = epochSeconds();
         int base = number * static_cast<int>(kMostReports);
         std::int64_t reporterID = 500 + number;

@@ -9,6 +9,7 @@
 #include <spawn.h>
 #include <string>
 #include <sys/wait.h>
+#include <system_error>
 #include <thread>
 #include <unistd.h>
 #include <vector>
@@ -25,6 +26,7 @@ pid_t spawnDaemon(const std::filesystem::path& root)
     if (const char* path = std::getenv("PATH"))
         environment.push_back(std::string("PATH=") + path);
     std::vector<char*> pointers;
+    pointers.reserve(environment.size() + 1);
     for (auto& entry : environment)
         pointers.push_back(entry.data());
     pointers.push_back(nullptr);
@@ -39,10 +41,8 @@ pid_t spawnDaemon(const std::filesystem::path& root)
     pid_t pid = 0;
     int failed = posix_spawn(&pid, program.c_str(), &actions, nullptr, arguments, pointers.data());
     posix_spawn_file_actions_destroy(&actions);
-    if (failed != 0) {
-        std::fprintf(stderr, "cannot start %s: %s\n", program.c_str(), std::strerror(failed));
-        std::exit(1);
-    }
+    if (failed != 0)
+        throw std::system_error(failed, std::generic_category(), "cannot start " + program);
     return pid;
 }
 
