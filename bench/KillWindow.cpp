@@ -5,13 +5,11 @@
 #include <chrono>
 #include <csignal>
 #include <cstdio>
-#include <cstring>
 #include <random>
 #include <sqlite3.h>
 #include <stdexcept>
 #include <string>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -20,8 +18,8 @@
 #include <fmt/format.h>
 
 #include "BenchReport.h"
+#include "RawRpc.h"
 #include "Servers.h"
-#include "wire/MsgpackRpcDecoder.h"
 #include "wire/MsgpackRpcMessage.h"
 #include "wire/MxReportingMethods.h"
 
@@ -54,15 +52,6 @@ std::int64_t countRows(const std::filesystem::path& store, const std::string& sq
     return count;
 }
 
-int connectTo(const std::filesystem::path& socket)
-{
-    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, socket.c_str(), sizeof(address.sun_path) - 1);
-    return ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0 ? fd : -1;
-}
-
 // One daemon's life: reports at `rate` from report number `base` on, then the kill.
 struct Round {
     std::vector<Clock::time_point> acknowledgedAt = std::vector<Clock::time_point>(kMostReports);
@@ -91,24 +80,13 @@ void sendReports(int fd, double rate, int base, std::int64_t reporterID, Round& 
 // Replies come in the order of their reports: one client, one session.
 void readReplies(int fd, Round& round)
 {
-    MsgpackRpcDecoder decoder;
-    for (;;) {
-        auto space = decoder.buffer();
-        ssize_t got = ::read(fd, space.data(), space.size());
-        if (got <= 0)
-            return;
-        auto now = Clock::now();
-        decoder.consumed(static_cast<std::size_t>(got));
-        Value message;
-        std::string reason;
-        while (decoder.next(message, reason) == MsgpackRpcDecoder::Status::Message) {
-            auto response = parseRpcResponse(message, reason);
-            if (!response || !response->error.isNil() || response->msgid != round.acknowledged.load())
-                return;
-            round.acknowledgedAt[response->msgid] = now;
-            ++round.acknowledged;
-        }
-    }
+    readResponses(fd, [&](const RpcResponse& response, Clock::time_point now) {
+        if (!response.error.isNil() || response.msgid != round.acknowledged.load())
+            return false;
+        round.acknowledgedAt[response.msgid] = now;
+        ++round.acknowledged;
+        return true;
+    });
 }
 
 } // namespace
@@ -128,7 +106,7 @@ KillWindowFigures measureKillWindow(const std::filesystem::path& root, double ra
         auto owner = std::make_unique<mxr::Client>(daemonSocket(root).c_str());
         owner->open();
         startBenchSession(*owner, reporterID);
-        int fd = connectTo(daemonSocket(root));
+        int fd = connectRaw(daemonSocket(root));
         Round round;
         std::thread reader([&] { readReplies(fd, round); });
         std::thread sender([&] { sendReports(fd, rate, base, reporterID, round); });

@@ -4,18 +4,16 @@
 #include <atomic>
 #include <chrono>
 #include <cstdio>
-#include <cstring>
 #include <stdexcept>
 #include <string>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <thread>
 #include <unistd.h>
 #include <vector>
 
 #include "BenchReport.h"
 #include "ProcessCounters.h"
-#include "wire/MsgpackRpcDecoder.h"
+#include "RawRpc.h"
 #include "wire/MsgpackRpcMessage.h"
 #include "wire/MxReportingMethods.h"
 
@@ -27,31 +25,6 @@ using Clock = std::chrono::steady_clock;
 
 // Request ids of the reports start here; anything below is not a report's reply.
 constexpr std::uint32_t kFirstReportID = 1000;
-
-int connectTo(const std::filesystem::path& socket)
-{
-    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, socket.c_str(), sizeof(address.sun_path) - 1);
-    if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) != 0) {
-        std::perror("open loop: connect");
-        std::_Exit(1);
-    }
-    return fd;
-}
-
-bool sendAll(int fd, const char* bytes, std::size_t size)
-{
-    while (size > 0) {
-        ssize_t sent = ::send(fd, bytes, size, MSG_NOSIGNAL);
-        if (sent <= 0)
-            return false;
-        bytes += sent;
-        size -= static_cast<std::size_t>(sent);
-    }
-    return true;
-}
 
 // Creates, configures and starts the session of `reporterID` on the connection, as a
 // component does before its first report. The start is answered when the session
@@ -70,19 +43,9 @@ void startSession(int fd, std::int64_t reporterID)
     encodeRpcRequest(buffer, msgid + 1, method::kStartReportingSessionForID, Array{Value(reporterID)});
     if (!sendAll(fd, buffer.data(), buffer.size()))
         throw std::runtime_error("open loop: the session's requests were not taken");
-    MsgpackRpcDecoder decoder;
-    for (std::uint32_t answered = 0; answered < msgid;) {
-        auto space = decoder.buffer();
-        ssize_t got = ::read(fd, space.data(), space.size());
-        if (got <= 0)
-            throw std::runtime_error("open loop: the connection ended before the session started");
-        decoder.consumed(static_cast<std::size_t>(got));
-        Value message;
-        std::string reason;
-        while (decoder.next(message, reason) == MsgpackRpcDecoder::Status::Message)
-            if (parseRpcResponse(message, reason))
-                ++answered;
-    }
+    std::uint32_t answered = 0;
+    if (!readResponses(fd, [&](const RpcResponse&, Clock::time_point) { return ++answered < msgid; }))
+        throw std::runtime_error("open loop: the connection ended before the session started");
 }
 
 // The replies: each report's latency from when it was due, filled in by msgid.
@@ -97,32 +60,17 @@ struct Replies {
 
 void readReplies(int fd, Replies& replies)
 {
-    MsgpackRpcDecoder decoder;
-    for (;;) {
-        auto space = decoder.buffer();
-        ssize_t got = ::read(fd, space.data(), space.size());
-        if (got <= 0)
-            return;
-        auto now = Clock::now();
-        decoder.consumed(static_cast<std::size_t>(got));
-        Value message;
-        std::string reason;
-        while (decoder.next(message, reason) == MsgpackRpcDecoder::Status::Message) {
-            auto response = parseRpcResponse(message, reason);
-            if (!response || response->msgid < kFirstReportID)
-                continue;
-            std::size_t index = response->msgid - kFirstReportID;
-            if (index >= replies.due.size())
-                continue;
-            replies.latencyMicroseconds[index] =
-                std::chrono::duration<double, std::micro>(now - replies.due[index]).count();
-            if (!response->error.isNil())
-                ++replies.errors;
-            replies.lastReply.store(now.time_since_epoch().count());
-            if (++replies.answered == replies.due.size())
-                return;
-        }
-    }
+    readResponses(fd, [&](const RpcResponse& response, Clock::time_point now) {
+        if (response.msgid < kFirstReportID || response.msgid - kFirstReportID >= replies.due.size())
+            return true;
+        std::size_t index = response.msgid - kFirstReportID;
+        replies.latencyMicroseconds[index] =
+            std::chrono::duration<double, std::micro>(now - replies.due[index]).count();
+        if (!response.error.isNil())
+            ++replies.errors;
+        replies.lastReply.store(now.time_since_epoch().count());
+        return ++replies.answered < replies.due.size();
+    });
 }
 
 double percentile(const std::vector<double>& sorted, double fraction)
@@ -140,7 +88,9 @@ OpenLoopFigures runOpenLoop(const std::filesystem::path& socket, pid_t server, d
 {
     auto count = static_cast<std::size_t>(rate * seconds);
     auto period = std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(1.0 / rate));
-    int fd = connectTo(socket);
+    int fd = connectRaw(socket);
+    if (fd < 0)
+        throw std::runtime_error("open loop: cannot connect to " + socket.string());
     if (reporterID != 0)
         startSession(fd, reporterID);
     Replies replies(count);
