@@ -4,66 +4,14 @@ loopback gets valid log batches for a flushed batch session and a standalone
 message; with the receiver down a flush reports the error, the daemon goes on, and
 what it could not send reaches the receiver once it is back."""
 
-import gzip
-import http.server
 import json
 import os
 import sys
-import threading
 
+from collector import Receiver
 from harness import Checks, Daemon, wait_for
 
 DAEMON = sys.argv[1]
-
-
-class Receiver:
-    """A collector's logs endpoint that keeps every record it is sent."""
-
-    def __init__(self, port=0):
-        self.records = []
-        self.gzipped = 0
-        self.refusals = 0  # answer this many requests with 503 and Retry-After: 1
-        self.lock = threading.Lock()
-        receiver = self
-
-        class Handler(http.server.BaseHTTPRequestHandler):
-            def do_POST(self):
-                body = self.rfile.read(int(self.headers["Content-Length"]))
-                if self.headers.get("Content-Encoding") == "gzip":
-                    body = gzip.decompress(body)
-                    with receiver.lock:
-                        receiver.gzipped += 1
-                request = json.loads(body)
-                with receiver.lock:
-                    if receiver.refusals > 0:
-                        receiver.refusals -= 1
-                        self.send_response(503)
-                        self.send_header("Retry-After", "1")
-                        self.send_header("Content-Length", "0")
-                        self.end_headers()
-                        return
-                    for resource in request["resourceLogs"]:
-                        for scope in resource["scopeLogs"]:
-                            receiver.records.extend(scope["logRecords"])
-                self.send_response(200)
-                self.send_header("Content-Type", "application/json")
-                self.end_headers()
-                self.wfile.write(b"{}")
-
-            def log_message(self, *args):
-                pass
-
-        self.server = http.server.ThreadingHTTPServer(("127.0.0.1", port), Handler)
-        self.port = self.server.server_address[1]
-        threading.Thread(target=self.server.serve_forever, daemon=True).start()
-
-    def stop(self):
-        self.server.shutdown()
-        self.server.server_close()
-
-    def bodies(self):
-        with self.lock:
-            return [record["body"] for record in self.records]
 
 
 def attributes(record):

@@ -1,12 +1,137 @@
 #include "platform/linux/ConfigFile.h"
 
 #include <algorithm>
+#include <cctype>
+#include <cstring>
 #include <fstream>
 #include <sstream>
 
 #include <fmt/format.h>
 
 namespace mx {
+
+namespace {
+
+std::vector<std::string> tokensOf(ConfigFile::Pointer at)
+{
+    std::vector<std::string> tokens;
+    for (; !at.empty(); at = at.parent_pointer())
+        tokens.push_back(at.back());
+    std::reverse(tokens.begin(), tokens.end());
+    return tokens;
+}
+
+// Finds where a value begins in JSON text that is known to parse: nlohmann's
+// documents keep no positions, and an error placed by searching for the key's text
+// would land on the first setting of that name, in whichever section it is.
+class JsonTextLocator {
+public:
+    explicit JsonTextLocator(std::string_view text) : text_(text) {}
+
+    // The offset of the value at `tokens`, or of its key when `atKey` and it is an
+    // object's member; 0 when it is not there.
+    std::size_t find(const std::vector<std::string>& tokens, bool atKey)
+    {
+        std::size_t key = std::string_view::npos;
+        at_ = 0;
+        for (const auto& token : tokens) {
+            space();
+            key = std::string_view::npos;
+            if (peek() == '{') {
+                key = member(token);
+                if (key == std::string_view::npos)
+                    return 0;
+            } else if (peek() != '[' || !element(token)) {
+                return 0;
+            }
+        }
+        space();
+        return atKey && key != std::string_view::npos ? key : at_;
+    }
+
+private:
+    char peek() const { return at_ < text_.size() ? text_[at_] : '\0'; }
+    void space()
+    {
+        while (at_ < text_.size() && std::isspace(static_cast<unsigned char>(text_[at_])))
+            ++at_;
+    }
+    void string()
+    {
+        for (++at_; at_ < text_.size() && text_[at_] != '"'; ++at_)
+            if (text_[at_] == '\\')
+                ++at_;
+        ++at_;
+    }
+    void value()
+    {
+        space();
+        if (peek() == '"')
+            return string();
+        if (peek() != '{' && peek() != '[') {
+            while (at_ < text_.size() && !std::strchr(",}] \t\r\n", text_[at_]))
+                ++at_;
+            return;
+        }
+        int depth = 0;
+        do {
+            char c = text_[at_];
+            if (c == '"') {
+                string();
+                continue;
+            }
+            depth += (c == '{' || c == '[') ? 1 : (c == '}' || c == ']') ? -1 : 0;
+            ++at_;
+        } while (depth > 0 && at_ < text_.size());
+    }
+    void separator()
+    {
+        space();
+        if (peek() == ',')
+            ++at_;
+    }
+    // Moves to the value of member `name`; where its key begins, npos when absent.
+    std::size_t member(const std::string& name)
+    {
+        ++at_;
+        for (;;) {
+            space();
+            if (peek() != '"')
+                return std::string_view::npos;
+            std::size_t key = at_;
+            string();
+            bool found = nlohmann::json::parse(text_.substr(key, at_ - key)).get<std::string>() == name;
+            space();
+            ++at_; // ':'
+            space();
+            if (found)
+                return key;
+            value();
+            separator();
+        }
+    }
+    // Moves to element `index` of an array; false when it has fewer.
+    bool element(const std::string& index)
+    {
+        if (index.empty() || !std::all_of(index.begin(), index.end(), ::isdigit))
+            return false;
+        ++at_;
+        for (std::size_t n = 0, wanted = std::stoul(index);; ++n) {
+            space();
+            if (peek() == ']' || peek() == '\0')
+                return false;
+            if (n == wanted)
+                return true;
+            value();
+            separator();
+        }
+    }
+
+    std::string_view text_;
+    std::size_t at_ = 0;
+};
+
+} // namespace
 
 ConfigFile::ConfigFile(std::filesystem::path path, std::vector<std::string>& errors)
     : path_(std::move(path)), errors_(errors)
@@ -40,31 +165,47 @@ std::string ConfigFile::place(std::size_t offset) const
     return fmt::format("{}:{}:{}", path_.string(), line, column);
 }
 
-void ConfigFile::fail(std::string_view text, const std::string& message)
+std::string ConfigFile::settingName(const Pointer& at) const
 {
-    auto at = text.empty() ? std::string::npos : text_.find(text);
-    errors_.push_back(fmt::format("{}: {}", place(at == std::string::npos ? 0 : at), message));
+    std::string name;
+    const nlohmann::json* node = &document_;
+    for (const auto& token : tokensOf(at)) {
+        if (node && node->is_array()) {
+            name += "[" + token + "]";
+            node = &(*node)[std::stoul(token)];
+            continue;
+        }
+        name += (name.empty() ? "" : ".") + token;
+        node = node && node->is_object() && node->contains(token) ? &(*node)[token] : nullptr;
+    }
+    return name.empty() ? path_.filename().string() : name;
 }
 
-bool ConfigFile::onlyKeys(const nlohmann::json& object, std::initializer_list<std::string_view> allowed,
-                          std::string_view what)
+void ConfigFile::fail(const Pointer& at, const std::string& message)
+{
+    errors_.push_back(fmt::format("{}: {}", place(JsonTextLocator(text_).find(tokensOf(at), false)), message));
+}
+
+bool ConfigFile::onlyKeys(const Pointer& at, std::initializer_list<std::string_view> allowed)
 {
     bool clean = true;
-    for (const auto& [key, value] : object.items())
+    for (const auto& [key, value] : document_.at(at).items())
         if (std::find(allowed.begin(), allowed.end(), key) == allowed.end()) {
             std::string expected;
             for (auto name : allowed)
                 expected += (expected.empty() ? "" : ", ") + std::string(name);
-            fail("\"" + key + "\"", fmt::format("{} has no setting \"{}\" (it has {})", what, key, expected));
+            errors_.push_back(fmt::format("{}: {} has no setting \"{}\" (it has {})",
+                                          place(JsonTextLocator(text_).find(tokensOf(at / key), true)), settingName(at),
+                                          key, expected));
             clean = false;
         }
     return clean;
 }
 
-bool ConfigFile::expect(bool holds, std::string_view key, std::string_view what)
+bool ConfigFile::expect(bool holds, const Pointer& at, std::string_view what)
 {
     if (!holds)
-        fail("\"" + std::string(key) + "\"", fmt::format("\"{}\" must be {}", key, what));
+        fail(at, fmt::format("{} must be {}", settingName(at), what));
     return holds;
 }
 

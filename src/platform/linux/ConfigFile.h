@@ -1,8 +1,9 @@
 #pragma once
 // One JSON file of etc/harmonia/ read strictly: a syntax error, a key the file may
 // not have or a value of the wrong type is an error that names the file, the line and
-// the column ("etc/harmonia/uplink.json:3:14: ..."), so that an operator can go
-// straight to it. A file that is not there is no error: its defaults hold.
+// the column of the setting, and the setting itself
+// ("etc/harmonia/stores.json:3:18: joule.max_bytes must be ..."), so that an operator
+// can go straight to it. A file that is not there is no error: its defaults hold.
 
 #include <filesystem>
 #include <initializer_list>
@@ -16,6 +17,8 @@ namespace mx {
 
 class ConfigFile {
 public:
+    using Pointer = nlohmann::json::json_pointer;
+
     // Reads the file now; errors are added to `errors`.
     ConfigFile(std::filesystem::path path, std::vector<std::string>& errors);
 
@@ -23,13 +26,17 @@ public:
     // The document when the file exists and parses as JSON, else nullptr.
     const nlohmann::json* document() const { return parsed_ ? &document_ : nullptr; }
 
-    // Adds an error at the first place `text` is written in the file (a key with its
-    // quotes, a value), or at its start when it is not found.
-    void fail(std::string_view text, const std::string& message);
-    // Errors for every member of `object` that is not one of `allowed`; true if none.
-    bool onlyKeys(const nlohmann::json& object, std::initializer_list<std::string_view> allowed, std::string_view what);
-    // Whether `value` holds what `what` says; an error at `key` when not.
-    bool expect(bool holds, std::string_view key, std::string_view what);
+    // Adds an error placed at the value `at` points to.
+    void fail(const Pointer& at, const std::string& message);
+    // Errors, each at its key, for every member of the object at `at` that is not one
+    // of `allowed`; true if none.
+    bool onlyKeys(const Pointer& at, std::initializer_list<std::string_view> allowed);
+    // Whether the value at `at` holds what `what` says; an error naming the setting
+    // when not ("joule.max_bytes must be a number of at least 0").
+    bool expect(bool holds, const Pointer& at, std::string_view what);
+    // The setting `at` points to as an operator writes it: "backends[1].headers.Key",
+    // the file's name for the whole document.
+    std::string settingName(const Pointer& at) const;
 
     const std::filesystem::path& path() const { return path_; }
 

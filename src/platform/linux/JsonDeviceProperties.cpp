@@ -38,14 +38,14 @@ bool JsonDeviceProperties::check(const std::filesystem::path& file, std::vector<
     if (!document)
         return false;
     if (!document->is_object()) {
-        config.fail("", "expected an object of device properties");
+        config.fail(ConfigFile::Pointer(), "expected an object of device properties");
         return false;
     }
-    bool good = config.onlyKeys(*document, {"InternalBuild", "DeviceClassNumber"}, "device.json");
+    bool good = config.onlyKeys(ConfigFile::Pointer(), {"InternalBuild", "DeviceClassNumber"});
     if (auto flag = document->find("InternalBuild"); flag != document->end())
-        good &= config.expect(flag->is_boolean(), "InternalBuild", "true or false");
+        good &= config.expect(flag->is_boolean(), ConfigFile::Pointer("/InternalBuild"), "true or false");
     if (auto number = document->find("DeviceClassNumber"); number != document->end())
-        good &= config.expect(number->is_number_integer(), "DeviceClassNumber", "an integer");
+        good &= config.expect(number->is_number_integer(), ConfigFile::Pointer("/DeviceClassNumber"), "an integer");
     return good;
 }
 

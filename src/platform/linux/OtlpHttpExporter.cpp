@@ -26,6 +26,8 @@ constexpr auto kIdlePoll = std::chrono::milliseconds(200);
 constexpr auto kFirstBackoff = std::chrono::seconds(1);
 constexpr auto kLongestBackoff = std::chrono::seconds(60);
 constexpr auto kProbeReuse = std::chrono::seconds(5);
+constexpr auto kProbeTimeout = std::chrono::seconds(3);
+constexpr auto kConnectTimeout = std::chrono::seconds(3);
 
 Json anyValue(const Json& value)
 {
@@ -149,8 +151,8 @@ constexpr std::chrono::seconds kLagInterval{2};
 
 } // namespace
 
-OtlpHttpExporter::OtlpHttpExporter(std::filesystem::path spool, std::string url)
-    : spool_(std::move(spool)), url_(std::move(url))
+OtlpHttpExporter::OtlpHttpExporter(std::filesystem::path spool, OtlpCollector collector)
+    : spool_(std::move(spool)), collector_(std::move(collector))
 {
     thread_ = std::thread([this] {
         pthread_setname_np(pthread_self(), "mx-otlp");
@@ -195,7 +197,8 @@ bool OtlpHttpExporter::probe()
     long status = 0;
     // A handle of its own: the exporter thread's may be in the middle of a request.
     CURL* curl = curl_easy_init();
-    post(curl, logsRequest(Json::array()), retryAfter, status);
+    post(curl, logsRequest(Json::array()), std::min<std::chrono::milliseconds>(collector_.timeout, kProbeTimeout),
+         retryAfter, status);
     curl_easy_cleanup(curl);
     std::lock_guard lock(mutex_);
     lastProbe_ = std::chrono::steady_clock::now();
@@ -203,25 +206,38 @@ bool OtlpHttpExporter::probe()
     return probeAnswered_;
 }
 
-std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string& body, std::chrono::seconds& retryAfter,
+std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string& body,
+                                                  std::chrono::milliseconds timeout, std::chrono::seconds& retryAfter,
                                                   long& status)
 {
     status = 0;
     if (!curl)
         return UplinkError{-1, "cannot create an HTTP request"};
-    std::string compressed = gzip(body);
+    std::string compressed = collector_.gzip ? gzip(body) : std::string();
+    const std::string& sent = collector_.gzip ? compressed : body;
     char failure[CURL_ERROR_SIZE] = "";
-    curl_easy_setopt(curl, CURLOPT_URL, url_.c_str());
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, compressed.data());
-    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(compressed.size()));
-    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, 3L);
-    curl_easy_setopt(curl, CURLOPT_TIMEOUT, 15L);
+    curl_easy_setopt(curl, CURLOPT_URL, collector_.url.c_str());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDS, sent.data());
+    curl_easy_setopt(curl, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(sent.size()));
+    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT_MS,
+                     static_cast<long>(std::min<std::chrono::milliseconds>(timeout, kConnectTimeout).count()));
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, static_cast<long>(timeout.count()));
     curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(curl, CURLOPT_ACCEPT_ENCODING, "");
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, failure);
     curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, discardBody);
+    // Empty names leave curl's own choice: the system's CAs, no client certificate.
+    auto fileOption = [&](CURLoption option, const std::string& path) {
+        curl_easy_setopt(curl, option, path.empty() ? nullptr : path.c_str());
+    };
+    fileOption(CURLOPT_CAINFO, collector_.caFile);
+    fileOption(CURLOPT_SSLCERT, collector_.certFile);
+    fileOption(CURLOPT_SSLKEY, collector_.keyFile);
     curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
-    headers = curl_slist_append(headers, "Content-Encoding: gzip");
+    if (collector_.gzip)
+        headers = curl_slist_append(headers, "Content-Encoding: gzip");
+    for (const auto& [name, value] : collector_.headers)
+        headers = curl_slist_append(headers, (name + ": " + value).c_str());
     curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
     CURLcode result = curl_easy_perform(curl);
     curl_off_t retry = 0;
@@ -231,10 +247,15 @@ std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string&
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, nullptr);
     curl_slist_free_all(headers);
     retryAfter = std::chrono::seconds(retry);
+    if (result == CURLE_PEER_FAILED_VERIFICATION)
+        return UplinkError{result,
+                           fmt::format("{}: {} (the CA to trust is tls.ca_file of this collector in uplink.json)",
+                                       collector_.url, failure[0] ? failure : curl_easy_strerror(result))};
     if (result != CURLE_OK)
-        return UplinkError{result, fmt::format("{}: {}", url_, failure[0] ? failure : curl_easy_strerror(result))};
+        return UplinkError{result,
+                           fmt::format("{}: {}", collector_.url, failure[0] ? failure : curl_easy_strerror(result))};
     if (status < 200 || status >= 300)
-        return UplinkError{status, fmt::format("{}: HTTP status {}", url_, status)};
+        return UplinkError{status, fmt::format("{}: HTTP status {}", collector_.url, status)};
     return std::nullopt;
 }
 
@@ -246,7 +267,8 @@ bool OtlpHttpExporter::openSpool()
         return true;
     if (database_) {
         // The store set the file aside or made it anew: the rows to export are there now.
-        MXLOG(nullptr, Default, "otlp exporter to {}: {} was made anew, reading the new one", url_, spool_.string());
+        MXLOG(nullptr, Default, "otlp exporter to {}: {} was made anew, reading the new one", collector_.url,
+              spool_.string());
         sqlite3_close(database_);
         database_ = nullptr;
     }
@@ -281,7 +303,7 @@ void OtlpHttpExporter::run()
             if (failure && !wasFailing)
                 MXLOG(nullptr, Error, "otlp export failing, keeping messages in the spool: {}", failure->description);
             if (!failure && wasFailing)
-                MXLOG(nullptr, Default, "otlp export to {} recovered", url_);
+                MXLOG(nullptr, Default, "otlp export to {} recovered", collector_.url);
         }
         changed_.notify_all();
         measureLag();
@@ -317,7 +339,7 @@ void OtlpHttpExporter::measureLag()
         sqlite3_stmt* statement = nullptr;
         if (sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr) != SQLITE_OK)
             return;
-        sqlite3_bind_text(statement, 1, url_.c_str(), -1, SQLITE_TRANSIENT);
+        sqlite3_bind_text(statement, 1, collector_.url.c_str(), -1, SQLITE_TRANSIENT);
         if (sqlite3_step(statement) == SQLITE_ROW && sqlite3_column_int64(statement, 0) > 0) {
             count += sqlite3_column_int64(statement, 0);
             double first = sqlite3_column_double(statement, 1);
@@ -355,7 +377,7 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
         query(
             sql,
             [&](sqlite3_stmt* s) {
-                sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT);
+                sqlite3_bind_text(s, 1, collector_.url.c_str(), -1, SQLITE_TRANSIENT);
                 sqlite3_bind_int64(s, 2, number);
             },
             [](sqlite3_stmt*) {});
@@ -363,7 +385,7 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
     auto send = [&](const Json& records, std::optional<UplinkError>& failure) {
         std::chrono::seconds retryAfter{0};
         long status = 0;
-        failure = post(handle_, logsRequest(records), retryAfter, status);
+        failure = post(handle_, logsRequest(records), collector_.timeout, retryAfter, status);
         if (failure && retryAfter.count() > 0) {
             failure->description += fmt::format(" (retry after {} s)", retryAfter.count());
             retryAfter_ = retryAfter;
@@ -381,7 +403,7 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
     std::int64_t cursor = 0;
     query(
         "SELECT stream_cursor FROM exports WHERE backend = ?1",
-        [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
+        [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, collector_.url.c_str(), -1, SQLITE_TRANSIENT); },
         [&](sqlite3_stmt* s) { cursor = sqlite3_column_int64(s, 0); });
 
     Json records = Json::array();
@@ -408,7 +430,8 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
 
     std::vector<std::int64_t> sessions;
     query(
-        kFlushedSessionsQuery, [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, url_.c_str(), -1, SQLITE_TRANSIENT); },
+        kFlushedSessionsQuery,
+        [&](sqlite3_stmt* s) { sqlite3_bind_text(s, 1, collector_.url.c_str(), -1, SQLITE_TRANSIENT); },
         [&](sqlite3_stmt* s) { sessions.push_back(sqlite3_column_int64(s, 0)); });
     for (auto session : sessions) {
         std::int64_t after = 0;
@@ -450,7 +473,7 @@ std::optional<UplinkError> OtlpHttpExporter::waitForSession(std::int64_t session
         return std::nullopt;
     if (settled && error_)
         return error_;
-    return UplinkError{-1, fmt::format("{}: session not acknowledged in time, kept in the spool", url_)};
+    return UplinkError{-1, fmt::format("{}: session not acknowledged in time, kept in the spool", collector_.url)};
 }
 
 } // namespace mx

@@ -20,6 +20,7 @@
 #include <thread>
 
 #include "platform/Uplink.h"
+#include "platform/linux/OtlpCollector.h"
 
 struct sqlite3;
 
@@ -27,12 +28,13 @@ namespace mx {
 
 class OtlpHttpExporter {
 public:
-    OtlpHttpExporter(std::filesystem::path spool, std::string url);
+    OtlpHttpExporter(std::filesystem::path spool, OtlpCollector collector);
     ~OtlpHttpExporter();
     OtlpHttpExporter(const OtlpHttpExporter&) = delete;
     OtlpHttpExporter& operator=(const OtlpHttpExporter&) = delete;
 
-    const std::string& url() const { return url_; }
+    const std::string& url() const { return collector_.url; }
+    const OtlpCollector& collector() const { return collector_; }
     // Whether the collector answers an HTTP request at all (any status). Blocks for
     // at most a few seconds; callable from any thread.
     bool probe();
@@ -56,11 +58,11 @@ private:
     bool openSpool();
     void measureLag();
     // `status` is the HTTP status, 0 when no response came at all.
-    std::optional<UplinkError> post(void* curl, const std::string& body, std::chrono::seconds& retryAfter,
-                                    long& status);
+    std::optional<UplinkError> post(void* curl, const std::string& body, std::chrono::milliseconds timeout,
+                                    std::chrono::seconds& retryAfter, long& status);
 
     std::filesystem::path spool_;
-    std::string url_;
+    const OtlpCollector collector_;
     sqlite3* database_ = nullptr; // exporter thread only, as are the two below
     dev_t spoolDevice_ = 0;
     ino_t spoolInode_ = 0;

@@ -2,12 +2,12 @@
 
 #include <algorithm>
 
-#include <curl/curl.h>
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
 #include <systemd/sd-id128.h>
 
 #include "platform/linux/ConfigFile.h"
+#include "platform/linux/OtlpCollector.h"
 #include "platform/linux/SpoolUplinkSession.h"
 #include "platform/linux/StoreLimits.h"
 #include "value/JsonValue.h"
@@ -15,22 +15,6 @@
 namespace mx {
 
 namespace {
-
-// A collector's address: an http or https URL with a host, as curl reads it.
-bool isCollectorUrl(const std::string& url)
-{
-    CURLU* parsed = curl_url();
-    bool good = curl_url_set(parsed, CURLUPART_URL, url.c_str(), 0) == CURLUE_OK;
-    char* scheme = nullptr;
-    char* host = nullptr;
-    good = good && curl_url_get(parsed, CURLUPART_SCHEME, &scheme, 0) == CURLUE_OK &&
-        curl_url_get(parsed, CURLUPART_HOST, &host, 0) == CURLUE_OK && host && *host &&
-        (std::string_view(scheme) == "http" || std::string_view(scheme) == "https");
-    curl_free(scheme);
-    curl_free(host);
-    curl_url_cleanup(parsed);
-    return good;
-}
 
 constexpr auto kSettleTimeout = std::chrono::seconds(10);
 
@@ -43,13 +27,13 @@ constexpr const char* kMessagesTable =
 // Spool rows go oldest first, those every collector acknowledged before any other. A
 // one-shot or realtime message is acknowledged by a collector whose stream cursor
 // passed it, a batch session's message by one that exported its session.
-SqliteRetention spoolRetention(const StoreLimit& limit, const std::vector<std::string>& collectors)
+SqliteRetention spoolRetention(const StoreLimit& limit, const std::vector<OtlpCollector>& collectors)
 {
     std::string acknowledged = "1";
     if (!collectors.empty()) {
         std::string listed;
-        for (const auto& url : collectors) {
-            std::string quoted = url;
+        for (const auto& collector : collectors) {
+            std::string quoted = collector.url;
             for (std::size_t at = quoted.find('\''); at != std::string::npos; at = quoted.find('\'', at + 2))
                 quoted.insert(at, 1, '\'');
             listed += (listed.empty() ? "'" : ", '") + quoted + "'";
@@ -82,6 +66,7 @@ SqliteRetention spoolRetention(const StoreLimit& limit, const std::vector<std::s
 std::optional<SpoolUplink::Backends> SpoolUplink::readBackends(const std::filesystem::path& configuration,
                                                                std::vector<std::string>& errors)
 {
+    using Pointer = ConfigFile::Pointer;
     ConfigFile file(configuration, errors);
     if (!file.exists())
         return Backends{true, {}};
@@ -89,36 +74,40 @@ std::optional<SpoolUplink::Backends> SpoolUplink::readBackends(const std::filesy
     if (!document)
         return std::nullopt;
     if (!document->is_object() || !document->contains("backends")) {
-        file.fail("", "expected {\"backends\": [...]}");
+        file.fail(Pointer(), "expected {\"backends\": [...]}");
         return std::nullopt;
     }
-    bool good = file.onlyKeys(*document, {"backends"}, "uplink.json");
+    bool good = file.onlyKeys(Pointer(), {"backends"});
     const auto& listed = (*document)["backends"];
-    if (!file.expect(listed.is_array(), "backends", "an array of backends"))
+    if (!file.expect(listed.is_array(), Pointer("/backends"), "an array of backends"))
         return std::nullopt;
     Backends backends{false, {}};
-    for (const auto& backend : listed) {
+    for (std::size_t index = 0; index < listed.size(); ++index) {
+        const auto& backend = listed[index];
+        auto at = Pointer("/backends") / index;
         std::string type = backend.is_object() && backend.contains("type") && backend["type"].is_string()
             ? backend["type"].get<std::string>()
             : "";
         if (type == "spool") {
-            good &= file.onlyKeys(backend, {"type"}, "a spool backend");
+            good &= file.onlyKeys(at, {"type"});
             backends.spool = true;
         } else if (type == "otlp-http") {
-            good &= file.onlyKeys(backend, {"type", "url"}, "an otlp-http backend");
-            auto url = backend.find("url");
-            if (!file.expect(url != backend.end() && url->is_string(), "url", "the collector's URL, a string")) {
-                good = false;
+            auto collector = OtlpCollector::read(file, at);
+            good &= collector.has_value();
+            if (!collector)
                 continue;
-            }
-            if (!isCollectorUrl(url->get<std::string>())) {
-                file.fail(url->dump(), fmt::format("{} is no http or https URL with a host", url->dump()));
+            // Each collector's progress through the spool is kept by its URL.
+            if (std::any_of(backends.collectors.begin(), backends.collectors.end(),
+                            [&](const auto& listedBefore) { return listedBefore.url == collector->url; })) {
+                file.fail(at / "url",
+                          fmt::format("{}: {} is listed twice", file.settingName(at / "url"), collector->url));
                 good = false;
             }
-            backends.collectors.push_back(url->get<std::string>());
+            backends.collectors.push_back(std::move(*collector));
         } else {
-            file.fail(type.empty() ? "backends" : "\"" + type + "\"",
-                      fmt::format("unknown backend {}: the types are \"spool\" and \"otlp-http\"", backend.dump()));
+            file.fail(at,
+                      fmt::format("{}: unknown backend {}: the types are \"spool\" and \"otlp-http\"",
+                                  file.settingName(at), backend.dump()));
             good = false;
         }
     }
@@ -149,13 +138,13 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
 }
 
 SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed,
-                         const std::vector<std::string>& collectors)
+                         const std::vector<OtlpCollector>& collectors)
     : store_(std::move(store)),
       lastSessionID_(store_->queryInteger("SELECT max(id) FROM sessions")),
       spoolListed_(spoolListed)
 {
-    for (const auto& url : collectors)
-        exporters_.push_back(std::make_shared<OtlpHttpExporter>(store_->path(), url));
+    for (const auto& collector : collectors)
+        exporters_.push_back(std::make_shared<OtlpHttpExporter>(store_->path(), collector));
 }
 
 SpoolUplink::~SpoolUplink() = default;
@@ -169,11 +158,13 @@ void SpoolUplink::reconfigure(const Backends& backends, const StoreLimit& limit)
         // One reconfiguration at a time, or two could each start an exporter for one URL.
         std::lock_guard lock(exportersMutex_);
         std::vector<std::shared_ptr<OtlpHttpExporter>> kept;
-        for (const auto& url : backends.collectors) {
+        for (const auto& collector : backends.collectors) {
+            // A collector whose settings changed is reached anew; it goes on from its
+            // place in the spool, which is kept by its URL.
             auto found = std::find_if(exporters_.begin(), exporters_.end(),
-                                      [&](const auto& exporter) { return exporter->url() == url; });
+                                      [&](const auto& exporter) { return exporter->collector() == collector; });
             kept.push_back(found != exporters_.end() ? *found
-                                                     : std::make_shared<OtlpHttpExporter>(store_->path(), url));
+                                                     : std::make_shared<OtlpHttpExporter>(store_->path(), collector));
         }
         replaced = std::exchange(exporters_, std::move(kept));
     }
@@ -246,7 +237,7 @@ bool SpoolUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, st
     store_->submit({kInsertMessage,
                     {nullptr, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, std::move(payload),
                      std::move(sessionInfo), std::move(userInfo)}});
-    for (auto& exporter : exporters_) {
+    for (auto& exporter : exporters()) {
         exporter->wake();
         // Spooled all the same: the exporter sends it once the collector is back.
         if (auto failing = exporter->currentError()) {

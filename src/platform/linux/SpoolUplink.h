@@ -5,7 +5,7 @@
 // hold its messages until then and send a realtime session's at once. One-shot
 // messages carry their own session and user information and belong to no session.
 // Backends come from uplink.json: {"backends": [{"type": "spool"},
-// {"type": "otlp-http", "url": "http://127.0.0.1:4318/v1/logs"}]}; the spool is always
+// {"type": "otlp-http", "url": "http://127.0.0.1:4318/v1/logs", ...}]}; the spool is always
 // the store behind them, so a collector that is down loses nothing.
 // Thread-safe; completions run on the global utility queue.
 
@@ -15,6 +15,7 @@
 #include <mutex>
 
 #include "platform/Uplink.h"
+#include "platform/linux/OtlpCollector.h"
 #include "platform/linux/OtlpHttpExporter.h"
 #include "platform/linux/SqliteStore.h"
 
@@ -27,7 +28,7 @@ public:
     // The backends uplink.json lists: whether the spool is one, and the collectors.
     struct Backends {
         bool spool = true;
-        std::vector<std::string> collectors;
+        std::vector<OtlpCollector> collectors;
     };
     // The backends of `configuration`; without the file, the spool alone. Nothing,
     // with `errors` added, for a file that lists anything else.
@@ -63,7 +64,7 @@ public:
     enum Statement : std::size_t { kInsertSession, kFlushSession, kInsertMessage };
 
 private:
-    SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed, const std::vector<std::string>& collectors);
+    SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed, const std::vector<OtlpCollector>& collectors);
 
     std::unique_ptr<SqliteStore> store_;
     std::atomic<std::int64_t> lastSessionID_;

@@ -20,17 +20,17 @@ std::optional<std::vector<std::string>> SqliteTally::readDisabled(const std::fil
     if (!document)
         return std::nullopt;
     if (!document->is_object()) {
-        file.fail("", "expected {\"disabled\": [names or prefixes]}");
+        file.fail(ConfigFile::Pointer(), "expected {\"disabled\": [names or prefixes]}");
         return std::nullopt;
     }
-    bool good = file.onlyKeys(*document, {"disabled"}, "tally.json");
+    bool good = file.onlyKeys(ConfigFile::Pointer(), {"disabled"});
     std::vector<std::string> disabled;
     auto listed = document->find("disabled");
     if (listed == document->end())
         return good ? std::optional(disabled) : std::nullopt;
     bool strings = listed->is_array() &&
         std::all_of(listed->begin(), listed->end(), [](const auto& entry) { return entry.is_string(); });
-    if (!file.expect(strings, "disabled", "an array of event names or prefixes") || !good)
+    if (!file.expect(strings, ConfigFile::Pointer("/disabled"), "an array of event names or prefixes") || !good)
         return std::nullopt;
     for (const auto& entry : *listed)
         disabled.push_back(entry.get<std::string>());

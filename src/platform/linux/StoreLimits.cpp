@@ -18,16 +18,18 @@ bool readSection(ConfigFile& file, const Json& document, const char* name, std::
     if (!document.contains(name))
         return true;
     const Json& section = document[name];
-    if (!file.expect(section.is_object(), name, "an object"))
+    auto at = ConfigFile::Pointer() / std::string(name);
+    if (!file.expect(section.is_object(), at, "an object"))
         return false;
-    bool good = file.onlyKeys(section, keys, fmt::format("\"{}\"", name));
+    bool good = file.onlyKeys(at, keys);
     std::size_t index = 0;
     for (auto key : keys) {
         auto found = section.find(key);
         double* value = values[index++];
         if (found == section.end())
             continue;
-        if (file.expect(found->is_number() && found->get<double>() >= 0, key, "a number of at least 0"))
+        if (file.expect(found->is_number() && found->get<double>() >= 0, at / std::string(key),
+                        "a number of at least 0"))
             *value = found->get<double>();
         else
             good = false;
@@ -58,10 +60,10 @@ std::optional<StoreLimits> StoreLimits::read(const std::filesystem::path& path, 
     if (!document)
         return std::nullopt;
     if (!document->is_object()) {
-        file.fail("", "expected an object of store limits");
+        file.fail(ConfigFile::Pointer(), "expected an object of store limits");
         return std::nullopt;
     }
-    bool good = file.onlyKeys(*document, {"tally", "joule", "uplink", "summaries"}, "stores.json");
+    bool good = file.onlyKeys(ConfigFile::Pointer(), {"tally", "joule", "uplink", "summaries"});
     double files = static_cast<double>(limits.summaries.maxFiles);
     double bytes = static_cast<double>(limits.summaries.maxBytes);
     good &= readStore(file, *document, "tally", limits.tally);

@@ -79,13 +79,18 @@ TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)
         return directory / name;
     };
     std::vector<std::string> errors;
-    EXPECT_FALSE(SpoolUplink::readBackends(write("uplink.json",
-                                                 "{\"backends\": [\n  {\"type\": \"spool\"},\n"
-                                                 "  {\"type\": \"otlp-http\", \"url\": \"not a url\"},\n"
-                                                 "  {\"type\": \"otlp-http\", \"urll\": 1}]}"),
-                                           errors));
-    EXPECT_FALSE(
-        StoreLimits::read(write("stores.json", "{\"tally\": {\"max_bytes\": \"big\"},\n \"tallly\": {}}"), errors));
+    write("ca.pem", "not a certificate");
+    EXPECT_FALSE(SpoolUplink::readBackends(
+        write("uplink.json",
+              "{\"backends\": [\n  {\"type\": \"spool\"},\n"
+              "  {\"type\": \"otlp-http\", \"url\": \"not a url\", \"compression\": \"zip\"},\n"
+              "  {\"type\": \"otlp-http\", \"urll\": 1},\n"
+              "  {\"type\": \"otlp-http\", \"url\": \"https://c:4318\", \"headers\": {\"Key\": 7},\n"
+              "   \"tls\": {\"ca_file\": \"ca.pem\", \"cert_file\": \"none.pem\"}}]}"),
+        errors));
+    EXPECT_FALSE(StoreLimits::read(
+        write("stores.json", "{\"tally\": {\"max_bytes\": 1},\n \"joule\": {\"max_bytes\": \"big\"}, \"tallly\": {}}"),
+        errors));
     EXPECT_FALSE(SqliteTally::readDisabled(write("tally.json", "{\"disabled\": [\"a\",]}"), errors));
     EXPECT_FALSE(JsonDeviceProperties::check(write("device.json", "{\"InternalBuild\": \"yes\"}"), errors));
     auto in = [&](const std::string& file) {
@@ -94,13 +99,20 @@ TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)
     EXPECT_THAT(
         errors,
         ::testing::ElementsAre(
-            in("uplink.json") + ":3:32: \"not a url\" is no http or https URL with a host",
-            in("uplink.json") + ":4:25: an otlp-http backend has no setting \"urll\" (it has type, url)",
-            in("uplink.json") + ":3:25: \"url\" must be the collector's URL, a string",
-            in("stores.json") + ":2:2: stores.json has no setting \"tallly\" (it has tally, joule, uplink, summaries)",
-            in("stores.json") + ":1:12: \"max_bytes\" must be a number of at least 0",
+            in("uplink.json") + ":3:32: backends[1].url: \"not a url\" is no http or https URL with a host",
+            in("uplink.json") + ":3:60: backends[1].compression must be \"gzip\" or \"none\"",
+            in("uplink.json") +
+                ":4:25: backends[2] has no setting \"urll\" (it has type, url, headers, tls, "
+                "timeout_seconds, compression)",
+            in("uplink.json") + ":4:3: backends[2] has no url: the collector's URL",
+            in("uplink.json") + ":5:69: backends[3].headers.Key must be a string",
+            in("uplink.json") + ":6:23: backends[3].tls.ca_file: " + in("ca.pem") + " holds no PEM certificate",
+            in("uplink.json") + ":6:46: backends[3].tls.cert_file: " + in("none.pem") +
+                " cannot be read: No such file or directory",
+            in("stores.json") + ":2:33: stores.json has no setting \"tallly\" (it has tally, joule, uplink, summaries)",
+            in("stores.json") + ":2:25: joule.max_bytes must be a number of at least 0",
             ::testing::StartsWith(in("tally.json") + ":1:19: syntax error"),
-            in("device.json") + ":1:2: \"InternalBuild\" must be true or false"));
+            in("device.json") + ":1:19: InternalBuild must be true or false"));
 
     errors.clear();
     std::filesystem::remove(directory / "uplink.json");
