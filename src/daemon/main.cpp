@@ -16,6 +16,7 @@
 #include <curl/curl.h>
 #include <systemd/sd-daemon.h>
 
+#include "Statistics/Service/MxReportingMetrics.h"
 #include "Statistics/Service/MxReportingServiceDelegate.h"
 #include "Statistics/Service/MxReportingSessionSummary.h"
 #include "Statistics/Service/MxReportingStatus.h"
@@ -265,6 +266,7 @@ int run(int argc, char** argv)
     tally->store().flush();
     joule->store().flush();
     uplink->store().flush();
+    MxReportingMetrics::remove();
     MXLOG(nullptr, Default, "mxreportingd stopped: everything taken is committed ({} ms)",
           std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - began).count());
     // Queues and connections are not torn down: the process simply ends.

@@ -4,27 +4,12 @@ with python3-msgpack and checks the replies the protocol promises. Written from
 the wire protocol alone, so it catches what a shared client library would hide."""
 
 import datetime
-import os
 import re
 import sys
 
 from harness import BOUND, Checks, Daemon, wait_for
 
 DAEMON = sys.argv[1]
-
-
-def parse_prometheus(text):
-    """Series to value; raises on any line that is not a comment or a sample."""
-    sample = re.compile(r'^([a-zA-Z_:][a-zA-Z0-9_:]*(\{[a-zA-Z_][a-zA-Z0-9_]*="(?:[^"\\\n]|\\.)*"'
-                        r'(,[a-zA-Z_][a-zA-Z0-9_]*="(?:[^"\\\n]|\\.)*")*\})?) (\S+)$')
-    series = {}
-    for line in text.splitlines():
-        if line.startswith("# HELP ") or line.startswith("# TYPE "):
-            continue
-        match = sample.match(line)
-        assert match, f"not Prometheus text: {line!r}"
-        series[match.group(1)] = float(match.group(4))
-    return series
 
 
 def main():
@@ -82,13 +67,6 @@ def main():
               ["bytes", "failures", "queue_depth", "rows_written"])
         error, _ = a.reply(a.send("status", 1))
         check("status takes no arguments", error["code"], 2)
-        metrics = daemon.path("var/lib/harmonia/metrics/mxreportingd.prom")
-        # Rewritten every few seconds: wait for the one after the reports.
-        reports = lambda: os.path.exists(metrics) and parse_prometheus(open(metrics).read()).get(
-            "mxreportingd_reports_received_total")
-        checks.check("metrics file brought up to date", wait_for(lambda: reports() == 3.0))
-        check("metrics: a store's rows",
-              'mxreportingd_store_rows_written_total{store="tally"}' in parse_prometheus(open(metrics).read()), True)
 
         daemon.write("var/lib/harmonia/preferences/com.kestrel.harmonia.json", '{"disable_reporting": true}')
         daemon.process.send_signal(1)  # SIGHUP posts the preferences notification

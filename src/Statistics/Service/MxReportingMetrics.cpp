@@ -1,6 +1,9 @@
 #include "Statistics/Service/MxReportingMetrics.h"
 
-#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <mutex>
+#include <utility>
 
 #include <fmt/format.h>
 
@@ -74,7 +77,7 @@ void partSeries(std::string& out, const Value* parts, const char* label, const S
 
 } // namespace
 
-std::string MxReportingMetrics::prometheusText(const Dictionary& status)
+std::string MxReportingMetrics::prometheusText(const Dictionary& status, double now)
 {
     std::string out;
     const Value* version = status.find("version");
@@ -101,22 +104,46 @@ std::string MxReportingMetrics::prometheusText(const Dictionary& status)
                 fmt::format("mxreportingd_exporter_failing{{exporter=\"{}\"}} {}\n", labelValue(name), failing ? 1 : 0);
         }
     }
+    out += "# HELP mxreportingd_last_update_timestamp_seconds When the daemon wrote this file.\n"
+           "# TYPE mxreportingd_last_update_timestamp_seconds gauge\n";
+    out += fmt::format("mxreportingd_last_update_timestamp_seconds {:.3f}\n", now);
     return out;
 }
 
+namespace {
+
+// Writes and the removal, one at a time: a write that began before the removal must
+// not bring the file back.
+std::mutex gFileMutex;
+bool gRemoved = false;
+
+} // namespace
+
 void MxReportingMetrics::write(const Dictionary& status)
 {
-    static std::atomic<bool> failing{false};
+    static bool failing = false;
+    std::lock_guard lock(gFileMutex);
+    if (gRemoved)
+        return;
+    auto now = std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
     auto& fileSystem = ProcessWide<FileSystem>::get();
     auto path = fileSystem.resolve(kPath);
     // Readable by anyone, whatever the umask: a node exporter reads it as its own user.
     auto failure = fileSystem.createDirectories(path.parent_path(), kDirectoryMode, FileModes::Exact);
     if (!failure)
-        failure = fileSystem.writeAtomically(path, prometheusText(status), kFileMode);
-    if (failure && !failing.exchange(true))
+        failure = fileSystem.writeAtomically(path, prometheusText(status, now), kFileMode);
+    if (failure && !std::exchange(failing, true))
         MXLOG(nullptr, Error, "cannot write the metrics file {}: {}", path.string(), *failure);
-    if (!failure && failing.exchange(false))
+    if (!failure && std::exchange(failing, false))
         MXLOG(nullptr, Default, "metrics file {} written again", path.string());
+}
+
+void MxReportingMetrics::remove()
+{
+    std::lock_guard lock(gFileMutex);
+    gRemoved = true;
+    std::error_code ignored; // never written, or already gone
+    std::filesystem::remove(ProcessWide<FileSystem>::get().resolve(kPath), ignored);
 }
 
 } // namespace mx
