@@ -106,7 +106,7 @@ std::string joined(const std::vector<std::string>& errors)
 
 [[noreturn]] void fail(const std::string& message)
 {
-    MXLOG(nullptr, Error, "mxreportingd cannot start: {}", message);
+    MXLOG(nullptr, Error, "mxreportingd cannot start (running as {}): {}", PosixFileSystem::processIdentity(), message);
     // Worker threads already run: no static destructor may pull the world from under them.
     std::_Exit(1);
 }

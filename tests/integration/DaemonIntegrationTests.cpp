@@ -304,8 +304,13 @@ TEST(DaemonStoreFailureTest, StoresThatCannotBeWrittenAtStartUpAreAClearError)
         GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
     std::string text;
     EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH}, text), 1);
-    EXPECT_THAT(
-        text, ::testing::HasSubstr("mxreportingd cannot start: " + daemon.path("var/lib/harmonia/tally.db").string()));
+    // What to mend: the file, its directory's owner and mode, and whom the daemon runs as.
+    EXPECT_THAT(text,
+                ::testing::ContainsRegex("mxreportingd cannot start \\(running as user [^ ]+, group [^ ]+\\): " +
+                                         daemon.path("var/lib/harmonia/tally.db").string() +
+                                         ": cannot make it: Read-only file system \\(" +
+                                         daemon.path("var/lib/harmonia").string() +
+                                         " is owned by [^ ]+:[^ ]+, mode [0-7]+; this process runs as"));
 }
 
 TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)

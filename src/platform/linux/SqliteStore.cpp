@@ -57,8 +57,14 @@ std::optional<std::string> makeFile(const std::filesystem::path& path)
     if (auto failure = PosixFileSystem::makeDirectories(path.parent_path(), PosixFileSystem::kDaemonDirectoryMode))
         return "cannot make its directory: " + *failure;
     int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, SqliteStore::kFileMode);
-    if (fd < 0)
-        return errno == EEXIST ? std::nullopt : std::optional<std::string>("cannot make it: " + errnoText(errno));
+    if (fd < 0) {
+        int error = errno;
+        if (error == EEXIST)
+            return std::nullopt;
+        bool refused = error == EACCES || error == EPERM || error == EROFS;
+        return "cannot make it: " + errnoText(error) +
+            (refused ? PosixFileSystem::accessHint(path.parent_path()) : std::string());
+    }
     bool set = ::fchmod(fd, SqliteStore::kFileMode) == 0;
     int failure = errno;
     ::close(fd);
@@ -107,7 +113,8 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
     if (sqlite3_open_v2(path.c_str(), &connection.database,
                         SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK)
         return fail(std::string("cannot open: ") +
-                    (connection.database ? sqlite3_errmsg(connection.database) : "out of memory"));
+                    (connection.database ? sqlite3_errmsg(connection.database) : "out of memory") +
+                    PosixFileSystem::accessHint(path));
     sqlite3_busy_timeout(connection.database, kBusyTimeoutMilliseconds);
     // The last step proves that the store can be written, not just read.
     // A new store gives pruned pages back to the file system; an older one reuses them.
