@@ -46,7 +46,8 @@ std::string growthSince(const Values& before)
 
 bool internalBuild()
 {
-    auto properties = nlohmann::json::parse(std::ifstream(MxReportingPath(kDevicePropertiesPath)), nullptr, false);
+    auto properties = nlohmann::json::parse(std::ifstream(MxReportingPath(kDevicePropertiesPath)), nullptr, false,
+                                            /*ignore_comments=*/true);
     return properties.is_object() && properties.value("InternalBuild", false) == true;
 }
 

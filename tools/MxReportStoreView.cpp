@@ -1,7 +1,14 @@
 #include "MxReportStoreView.h"
 
 #include <algorithm>
+#include <array>
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
+#include <grp.h>
+#include <optional>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <vector>
 
 #include <fmt/format.h>
@@ -82,12 +89,36 @@ std::string plain(const nlohmann::ordered_json& value)
 
 } // namespace
 
+// What keeps this user from reading the store at `path`, said so that it can be mended.
+static std::optional<std::string> unreadable(const std::filesystem::path& path)
+{
+    if (::access(path.c_str(), R_OK) == 0)
+        return std::nullopt;
+    int error = errno;
+    if (error == ENOENT)
+        return fmt::format("{} does not exist: mxreportingd makes it when it starts (is MXREPORTING_ROOT right?)",
+                           path.string());
+    struct stat status {};
+    struct group entry {};
+    struct group* owner = nullptr;
+    std::array<char, 4096> buffer{};
+    if (error != EACCES || ::stat(path.c_str(), &status) != 0 ||
+        getgrgid_r(status.st_gid, &entry, buffer.data(), buffer.size(), &owner) != 0 || !owner)
+        return fmt::format("cannot read {}: {}", path.string(), std::strerror(error));
+    return fmt::format("cannot read {}: only its owner and group {} may; add this user to group {} (then log in again)",
+                       path.string(), owner->gr_name, owner->gr_name);
+}
+
 int printStore(const std::filesystem::path& storeDirectory, const MxReportStoreQuery& query)
 {
     const View* view = viewFor(query.store);
     if (!view)
         return 64;
     auto path = storeDirectory / view->database;
+    if (auto problem = unreadable(path)) {
+        std::fprintf(stderr, "mxreport: %s\n", problem->c_str());
+        return 2;
+    }
     sqlite3* database = nullptr;
     if (sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
         std::fprintf(stderr, "mxreport: cannot open %s: %s\n", path.c_str(), sqlite3_errmsg(database));

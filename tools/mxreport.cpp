@@ -9,6 +9,7 @@
 #include <array>
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <grp.h>
 #include <optional>
 #include <sys/stat.h>
@@ -29,8 +30,8 @@ using namespace mx;
 namespace {
 
 constexpr const char* kUsage =
-    R"(usage: mxreport [--socket PATH] [--timeout SECONDS] COMMAND [ARGS] [-- COMMAND [ARGS]]...
-       mxreport --help | --version
+    R"(Usage: mxreport [--socket PATH] [--timeout SECONDS] COMMAND [ARGS] [-- COMMAND [ARGS]]...
+   or: mxreport --help | --version
 
 Talks to mxreportingd on $MXREPORTING_ROOT/run/harmonia/reporting.sock. Commands joined
 by "--" run in order on one connection (a session lives as long as its connection);
@@ -56,7 +57,7 @@ Protocol operations:
 Preferences (domain com.kestrel.harmonia) and notifications:
   defaults read [KEY]               print the domain or one key
   defaults write KEY VALUE          VALUE as JSON (true, 3, "name"), else as a string
-  defaults delete KEY
+  defaults delete KEY               remove one key
   notify [NAME]                     post NAME (default com.kestrel.harmonia.reporting)
 
 Orientation (recorded by long-form audio and telephony sessions on internal builds):
@@ -89,9 +90,26 @@ Driver channels (run/harmonia/chanstat/GROUP[/SUBGROUP]/NAME, one integer a file
   demo                              play a realistic session and show what happens
   help                              this text
 
-Exit status: 0 done; 1 the daemon refused or failed a command; 2 the daemon cannot be
-reached; 64 bad usage (nothing was done).
+Exit status:
+  0                                 done
+  1                                 the daemon refused or failed a command
+  2                                 the daemon cannot be reached
+  64                                bad usage (nothing was done)
+
+See also:
+  mxreportingd(8), mxreportingd.conf(5), mxreport-stores(1), mxreporting(3)
 )";
+
+// The help as help2man reads it: "*Title*" makes a heading a section of its own.
+std::string helpForManual()
+{
+    std::string text = kUsage;
+    for (const char* heading : {"Exit status", "See also"}) {
+        auto at = text.find(std::string("\n") + heading + ":\n");
+        text.replace(at + 1, std::strlen(heading) + 1, std::string("*") + heading + "*");
+    }
+    return text;
+}
 
 struct Options {
     std::string socket = MxReportingPath(kServiceSocketPath).string();
@@ -174,7 +192,10 @@ int run(int argc, char** argv)
         words.erase(words.begin());
         if (option == "--help")
             words = {"help"};
-        else if (option == "--version")
+        else if (option == "--help-man") {
+            std::fputs(helpForManual().c_str(), stdout);
+            return kExitDone;
+        } else if (option == "--version")
             words = {"version"};
         else if (option == "--socket" && !words.empty())
             options.socket = words[0], words.erase(words.begin());

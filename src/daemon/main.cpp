@@ -55,20 +55,56 @@ const char* malloc_conf = "background_thread:true,dirty_decay_ms:5000,muzzy_deca
 
 namespace {
 
-constexpr const char* kDescription = "mxreportingd: the Harmonia audio reporting daemon";
+constexpr const char* kDescription =
+    "mxreportingd: the Harmonia audio reporting daemon. Audio components connect to it on its Unix socket, open\n"
+    "reporting sessions and send usage and quality reports. Each report becomes an analytics event (tally.db), a\n"
+    "power log event when it carries an engine-on time (joule.db), and a message of its session in the backend\n"
+    "spool (uplink.db), from which the collectors listed in uplink.json are fed.";
 
-constexpr const char* kFiles = R"(Every path lives under $MXREPORTING_ROOT (default /):
+// The help's sections after the options. --help prints "Title:" headings; the manual
+// page is made by help2man from --help-man, where "*Title*" makes each its own section.
+struct HelpSection {
+    const char* title;
+    const char* body;
+};
+
+constexpr HelpSection kHelpSections[] = {
+    {"Files", R"(  Every path is under $MXREPORTING_ROOT (default /).
   run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
   run/harmonia/notify.sock          the notification endpoint
   run/harmonia/orientation.sock     the orientation feed ("device N", "ui N")
   var/lib/harmonia/                 tally.db, joule.db, uplink.db, preferences/
   var/lib/harmonia/metrics/         mxreportingd.prom, the status counters for Prometheus
-  etc/harmonia/                     device.json, tally.json, uplink.json, stores.json
-  var/log/harmonia/reporting/       session summary files (internal builds)
-Verbose logging: reporting_server_verbose=5 reporting_session_verbose=5
-SIGHUP re-reads etc/harmonia/ (a configuration with errors is refused, the one in use
-kept) and the preferences; SIGTERM commits the stores and exits.
-See what it does: mxreport status.)";
+  etc/harmonia/                     device.json, tally.json, uplink.json, stores.json:
+                                    see mxreportingd.conf(5) and the examples in
+                                    /usr/share/doc/mxreportingd/examples/
+  var/log/harmonia/reporting/       session summary files (internal builds))"},
+    {"Environment", R"(  MXREPORTING_ROOT                  the directory every path above is under
+  reporting_server_verbose=5        log every request
+  reporting_session_verbose=5       log every session's reports)"},
+    {"Signals", R"(  SIGHUP                            read etc/harmonia/ and the preferences again; a
+                                    configuration with errors is refused and the one
+                                    in use kept (systemctl reload mxreportingd)
+  SIGTERM, SIGINT                   take no more requests, commit everything taken to
+                                    the stores, remove the metrics file, exit 0)"},
+    {"Exit status", R"(  0                                 stopped by SIGTERM or SIGINT; or --check-config
+                                    found the configuration good
+  1                                 cannot start (the log says what to mend); or
+                                    --check-config found errors, each printed
+  2                                 a client asked it to stop (killService); systemd
+                                    does not restart it
+  64                                bad command-line usage)"},
+    {"See also", "  mxreport(1), mxreportingd.conf(5), mxreporting(3); what it does now: mxreport status"},
+};
+
+std::string helpFooter(bool forManual)
+{
+    std::string footer;
+    for (const auto& section : kHelpSections)
+        footer += forManual ? fmt::format("\n*{}*\n{}\n", section.title, section.body)
+                            : fmt::format("\n{}:\n{}\n", section.title, section.body);
+    return footer;
+}
 
 // How long a shutdown waits for the queues: sessions still waiting on backend
 // discovery take up to 9 s a round, and the unit's stop timeout is 90 s.
@@ -138,9 +174,16 @@ int run(int argc, char** argv)
     bool check = false;
     options.add_flag("--check-config", check,
                      "Check the configuration in etc/harmonia/ and exit: 0, or 1 with every error found");
-    options.footer(kFiles);
+    bool helpForManual = false;
+    options.add_flag("--help-man", helpForManual)->group("");
+    options.footer(helpFooter(false));
     try {
         options.parse(argc, argv);
+        if (helpForManual) {
+            options.footer(helpFooter(true));
+            std::fputs(options.help().c_str(), stdout);
+            return 0;
+        }
     } catch (const CLI::Success& done) {
         return options.exit(done);
     } catch (const CLI::ParseError& wrong) {

@@ -51,10 +51,19 @@ public:
 
 private:
     char peek() const { return at_ < text_.size() ? text_[at_] : '\0'; }
+    // Blanks and comments.
     void space()
     {
-        while (at_ < text_.size() && std::isspace(static_cast<unsigned char>(text_[at_])))
-            ++at_;
+        for (;;) {
+            while (at_ < text_.size() && std::isspace(static_cast<unsigned char>(text_[at_])))
+                ++at_;
+            if (text_.substr(at_, 2) == "//")
+                at_ = std::min(text_.find('\n', at_), text_.size());
+            else if (text_.substr(at_, 2) == "/*")
+                at_ = std::min(text_.find("*/", at_ + 2), text_.size() - 2) + 2;
+            else
+                return;
+        }
     }
     void string()
     {
@@ -69,7 +78,7 @@ private:
         if (peek() == '"')
             return string();
         if (peek() != '{' && peek() != '[') {
-            while (at_ < text_.size() && !std::strchr(",}] \t\r\n", text_[at_]))
+            while (at_ < text_.size() && !std::strchr(",}] \t\r\n/", text_[at_]))
                 ++at_;
             return;
         }
@@ -78,6 +87,10 @@ private:
             char c = text_[at_];
             if (c == '"') {
                 string();
+                continue;
+            }
+            if (c == '/') {
+                space();
                 continue;
             }
             depth += (c == '{' || c == '[') ? 1 : (c == '}' || c == ']') ? -1 : 0;
@@ -144,7 +157,7 @@ ConfigFile::ConfigFile(std::filesystem::path path, std::vector<std::string>& err
     text << stream.rdbuf();
     text_ = text.str();
     try {
-        document_ = nlohmann::json::parse(text_);
+        document_ = nlohmann::json::parse(text_, nullptr, true, /*ignore_comments=*/true);
         parsed_ = true;
     } catch (const nlohmann::json::parse_error& error) {
         // The library's message leads with its own position; ours is in front.

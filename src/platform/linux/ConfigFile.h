@@ -1,7 +1,7 @@
 #pragma once
-// One JSON file of etc/harmonia/ read strictly: a syntax error, a key the file may
-// not have or a value of the wrong type is an error that names the file, the line and
-// the column of the setting, and the setting itself
+// One JSON file of etc/harmonia/ (comments, // and /* */, allowed) read strictly: a
+// syntax error, a key the file may not have or a value of the wrong type is an error
+// that names the file, the line and the column of the setting, and the setting itself
 // ("etc/harmonia/stores.json:3:18: joule.max_bytes must be ..."), so that an operator
 // can go straight to it. A file that is not there is no error: its defaults hold.
 
