@@ -10,6 +10,7 @@
 #include <fmt/format.h>
 
 #include "Statistics/MxReportingDriverUtility.h"
+#include "tools/MxReportAccess.h"
 #include "tools/MxReportArguments.h"
 #include "wire/ChannelFiles.h"
 #include "wire/Datagram.h"
@@ -61,16 +62,17 @@ int writeDomain(const nlohmann::ordered_json& domain)
         if (!out) {
             int error = errno;
             std::fprintf(stderr,
-                         "mxreport: defaults: cannot write in %s: %s (the preferences are the daemon user's; "
-                         "write them as that user or as root)\n",
-                         path.parent_path().c_str(), errnoText(error).c_str());
+                         "mxreport: defaults: cannot write in %s: %s (%s). The preferences are the daemon "
+                         "user's: write them as that user or as root\n",
+                         path.parent_path().c_str(), errnoText(error).c_str(), ownership(path.parent_path()).c_str());
             return kExitRefused;
         }
     }
     if (std::rename(temporary.c_str(), path.c_str()) != 0) {
         int error = errno;
         std::remove(temporary.c_str());
-        std::fprintf(stderr, "mxreport: defaults: cannot replace %s: %s\n", path.c_str(), errnoText(error).c_str());
+        std::fprintf(stderr, "mxreport: defaults: cannot replace %s: %s (%s)\n", path.c_str(), errnoText(error).c_str(),
+                     ownership(path).c_str());
         return kExitRefused;
     }
     std::printf("defaults: %s written; post the notification (mxreport notify) for the daemon to read it\n",

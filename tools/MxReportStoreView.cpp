@@ -1,13 +1,11 @@
 #include "MxReportStoreView.h"
+#include "tools/MxReportAccess.h"
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <grp.h>
 #include <optional>
-#include <sys/stat.h>
 #include <unistd.h>
 #include <vector>
 
@@ -98,15 +96,11 @@ static std::optional<std::string> unreadable(const std::filesystem::path& path)
     if (error == ENOENT)
         return fmt::format("{} does not exist: mxreportingd makes it when it starts (is MXREPORTING_ROOT right?)",
                            path.string());
-    struct stat status {};
-    struct group entry {};
-    struct group* owner = nullptr;
-    std::array<char, 4096> buffer{};
-    if (error != EACCES || ::stat(path.c_str(), &status) != 0 ||
-        getgrgid_r(status.st_gid, &entry, buffer.data(), buffer.size(), &owner) != 0 || !owner)
+    std::string group = owningGroup(path);
+    if (error != EACCES || group.empty())
         return fmt::format("cannot read {}: {}", path.string(), std::strerror(error));
     return fmt::format("cannot read {}: only its owner and group {} may; add this user to group {} (then log in again)",
-                       path.string(), owner->gr_name, owner->gr_name);
+                       path.string(), group, group);
 }
 
 int printStore(const std::filesystem::path& storeDirectory, const MxReportStoreQuery& query)

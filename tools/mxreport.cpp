@@ -6,19 +6,17 @@
 // the daemon share one connection.
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <grp.h>
 #include <optional>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <fmt/format.h>
 
 #include "tools/DemoCommand.h"
 #include "tools/HostCommands.h"
+#include "tools/MxReportAccess.h"
 #include "tools/MxReportArguments.h"
 #include "tools/ProtocolCommands.h"
 #include "tools/StatusCommand.h"
@@ -167,17 +165,11 @@ int viewStore(const Words& words)
 // anyone listens.
 void sayUnreachable(const std::string& socket, int error)
 {
-    struct stat status {};
-    if (error == -EACCES && ::stat(socket.c_str(), &status) == 0) {
-        struct group entry {};
-        struct group* owner = nullptr;
-        std::array<char, 4096> buffer{};
-        getgrgid_r(status.st_gid, &entry, buffer.data(), buffer.size(), &owner);
-        std::string name = owner ? owner->gr_name : std::to_string(status.st_gid);
+    if (auto group = owningGroup(socket); error == -EACCES && !group.empty()) {
         std::fprintf(stderr,
                      "mxreport: permission denied on %s: only its group may connect; add this user to group %s "
                      "(then log in again)\n",
-                     socket.c_str(), name.c_str());
+                     socket.c_str(), group.c_str());
         return;
     }
     std::fprintf(stderr, "mxreport: cannot connect to %s: %s\n", socket.c_str(), mxr::errorText(error).c_str());

@@ -18,6 +18,7 @@ reporting is switched off on the host, NotConnected when it cannot be reached or
 connection is gone. The standard library and python3-msgpack are all it needs.
 """
 
+import grp
 import os
 import socket
 import threading
@@ -76,6 +77,20 @@ def _code(value, names, what, maximum):
     return value
 
 
+def _unreachable(path, error):
+    """What to fix when the daemon's socket cannot be connected to."""
+    if isinstance(error, PermissionError):
+        try:
+            group = grp.getgrgid(os.stat(path).st_gid).gr_name
+        except (OSError, KeyError):
+            group = "the socket's group"
+        return (f"permission denied on {path}: only its group may connect; "
+                f"add this user to group {group} (then log in again)")
+    if isinstance(error, (FileNotFoundError, ConnectionRefusedError)):
+        return f"cannot connect to {path}: {error.strerror} (is mxreportingd running? is MXREPORTING_ROOT right?)"
+    return f"cannot connect to {path}: {error.strerror or error}"
+
+
 class Client:
     """One connection to the daemon. Safe to use from several threads; a context manager
     that closes the connection on exit."""
@@ -94,7 +109,7 @@ class Client:
             self._socket.connect(self._path)
         except OSError as error:
             self._socket.close()
-            raise NotConnected(f"cannot connect to {self._path}: {error.strerror or error}") from error
+            raise NotConnected(_unreachable(self._path, error)) from error
 
     def __enter__(self):
         return self
