@@ -4,8 +4,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <optional>
+#include <system_error>
 #include <unistd.h>
 #include <vector>
 
@@ -98,7 +98,7 @@ static std::optional<std::string> unreadable(const std::filesystem::path& path)
                            path.string());
     std::string group = owningGroup(path);
     if (error != EACCES || group.empty())
-        return fmt::format("cannot read {}: {}", path.string(), std::strerror(error));
+        return fmt::format("cannot read {}: {}", path.string(), std::generic_category().message(error));
     return fmt::format("cannot read {}: only its owner and group {} may; add this user to group {} (then log in again)",
                        path.string(), group, group);
 }

@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <cstring>
 #include <memory>
+#include <system_error>
 
 #include <curl/curl.h>
 #include <fmt/format.h>
@@ -59,7 +60,7 @@ std::optional<std::string> pemProblem(const std::string& path, std::string_view 
 {
     Bio bio(BIO_new_file(path.c_str(), "r"), &BIO_free);
     if (!bio)
-        return fmt::format("{} cannot be read: {}", path, std::strerror(errno));
+        return fmt::format("{} cannot be read: {}", path, std::generic_category().message(errno));
     if (kind == "key") {
         EVP_PKEY* key = PEM_read_bio_PrivateKey(bio.get(), nullptr, noPassphrase, nullptr);
         EVP_PKEY_free(key);

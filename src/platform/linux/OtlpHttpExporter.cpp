@@ -237,7 +237,7 @@ std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string&
     if (collector_.gzip)
         headers = curl_slist_append(headers, "Content-Encoding: gzip");
     for (const auto& [name, value] : collector_.headers)
-        headers = curl_slist_append(headers, (name + ": " + value).c_str());
+        headers = curl_slist_append(headers, fmt::format("{}: {}", name, value).c_str());
     curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
     CURLcode result = curl_easy_perform(curl);
     curl_off_t retry = 0;
