@@ -17,11 +17,14 @@ namespace fs = std::filesystem;
 
 // A channel's text is one 64-bit integer and a line end, with room for white space.
 constexpr std::size_t kLongestText = 63;
-// A rewrite in place leaves the file empty for microseconds: the first reads again
+// A rewrite in place leaves the file empty for microseconds, or for as long as the
+// writer is preempted between its truncation and its write: the first reads again
 // come at once, the later ones after growing pauses with a random part, so that a
 // reader and a writer woken by the same timer tick do not meet at the same moment
-// again (at most about 10 ms in all).
-constexpr int kReadAttempts = 8;
+// again (at most about 100 ms in all). A file that was not written lately is not
+// being rewritten: what it holds is final at once.
+constexpr int kReadAttempts = 9;
+constexpr auto kRewriteWindow = std::chrono::seconds(1);
 constexpr int kImmediateAttempts = 2;
 constexpr auto kFirstPause = std::chrono::microseconds(25);
 
@@ -73,7 +76,7 @@ bool isDirectory(const fs::path& path)
 // A channel file's text, read through a descriptor that nothing on the other end can
 // block: opened without waiting (a FIFO put in a file's place opens at once) and
 // taken only when it is a regular file.
-bool readText(const std::string& path, std::string& text, int& error)
+bool readText(const std::string& path, std::string& text, bool& recentlyWritten, int& error)
 {
     int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
     if (fd < 0) {
@@ -86,6 +89,9 @@ bool readText(const std::string& path, std::string& text, int& error)
         ::close(fd);
         return false;
     }
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME, &now);
+    recentlyWritten = std::chrono::seconds(now.tv_sec - status.st_mtim.tv_sec) <= kRewriteWindow;
     char buffer[kLongestText + 1];
     ssize_t length = ::read(fd, buffer, sizeof(buffer));
     error = length < 0 ? errno : 0;
@@ -160,11 +166,14 @@ std::optional<std::int64_t> ChannelFiles::readValue(const std::string& path, int
     std::optional<std::int64_t> previous;
     for (int attempt = 0; attempt < kReadAttempts; ++attempt) {
         std::string text;
-        if (!readText(path, text, error))
+        bool recentlyWritten = false;
+        if (!readText(path, text, recentlyWritten, error))
             return std::nullopt;
         auto value = text.size() <= kLongestText ? parseValue(text) : std::nullopt;
-        if (value && (text.ends_with('\n') || value == previous))
+        if (value && (text.ends_with('\n') || value == previous || !recentlyWritten))
             return value;
+        if (!recentlyWritten)
+            break;
         previous = value;
         if (!value)
             pauseBeforeAttempt(attempt);

@@ -138,7 +138,7 @@ TEST_F(FileChanstatTest, ARewriteInPlaceIsNeverReadAsAMissingOrPartialValue)
             ASSERT_GE(fd, 0);
             ASSERT_EQ(::write(fd, "1000457\n", 8), 8);
             ::close(fd);
-            std::this_thread::sleep_for(std::chrono::microseconds(100));
+            std::this_thread::sleep_for(std::chrono::microseconds(500));
         }
     });
     int misread = 0;
