@@ -18,6 +18,10 @@ namespace mx {
 // How a mode asked for is applied to what is made: as the process umask filters it (as
 // mkdir does), or exactly, whatever the umask.
 enum class FileModes { UmaskFiltered, Exact };
+// Whether a replaced file must survive a power cut once written, or may be lost with
+// it (a file rewritten every few seconds anyway: syncing it would wake the disk and
+// the writer's thread each time).
+enum class Durability { Synced, Unsynced };
 
 class FileSystem {
 public:
@@ -31,7 +35,7 @@ public:
     // Replaces `file` with `contents`, exactly `mode`, so that readers see the old file
     // or the new one, never a part. The reason on failure.
     virtual std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents,
-                                                       mode_t mode) = 0;
+                                                       mode_t mode, Durability durability) = 0;
     // Removes the oldest files of `directory` (by modification time) until at most
     // `maxFiles` remain, holding at most `maxBytes` together. How many went.
     virtual std::size_t trimDirectory(const std::filesystem::path& directory, std::size_t maxFiles,

@@ -208,8 +208,8 @@ public:
         directories[directory] = mode;
         return directoryFailure;
     }
-    std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents,
-                                               mode_t) override
+    std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents, mode_t,
+                                               Durability) override
     {
         std::lock_guard lock(mutex_);
         if (directoryFailure)

@@ -131,7 +131,7 @@ void MxReportingMetrics::write(const Dictionary& status)
     // Readable by anyone, whatever the umask: a node exporter reads it as its own user.
     auto failure = fileSystem.createDirectories(path.parent_path(), kDirectoryMode, FileModes::Exact);
     if (!failure)
-        failure = fileSystem.writeAtomically(path, prometheusText(status, now), kFileMode);
+        failure = fileSystem.writeAtomically(path, prometheusText(status, now), kFileMode, Durability::Unsynced);
     if (failure && !std::exchange(failing, true))
         MXLOG(nullptr, Error, "cannot write the metrics file {}: {}", path.string(), *failure);
     if (!failure && std::exchange(failing, false))

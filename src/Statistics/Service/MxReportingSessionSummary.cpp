@@ -147,8 +147,9 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
     if (text.empty())
         return;
     // The file is its owner's and its group's to read, whatever the umask.
-    if (auto failure = fileSystem.writeAtomically(
-            directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text, kSummaryFileMode)) {
+    if (auto failure =
+            fileSystem.writeAtomically(directory / summaryFileName(std::time(nullptr), userInfo, serviceType), text,
+                                       kSummaryFileMode, Durability::Synced)) {
         MXLOG(logScope(), Error, "jsonOutput writeToURL: {}", *failure);
         return;
     }

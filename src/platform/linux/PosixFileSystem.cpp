@@ -149,7 +149,8 @@ std::optional<std::string> PosixFileSystem::makeDirectories(const std::filesyste
 }
 
 std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesystem::path& file,
-                                                            std::string_view contents, mode_t mode)
+                                                            std::string_view contents, mode_t mode,
+                                                            Durability durability)
 {
     Descriptor directory;
     if (auto failure = openDirectory(file.parent_path(), Missing::Fail, 0, directory))
@@ -179,12 +180,14 @@ std::optional<std::string> PosixFileSystem::writeAtomically(const std::filesyste
         data += written;
         left -= std::size_t(written);
     }
-    if (fsync(out.get()) != 0 || renameat(directory.get(), temporary.c_str(), directory.get(), name.c_str()) != 0) {
+    bool synced = durability == Durability::Unsynced || fsync(out.get()) == 0;
+    if (!synced || renameat(directory.get(), temporary.c_str(), directory.get(), name.c_str()) != 0) {
         std::string reason = errnoText(errno);
         unlinkat(directory.get(), temporary.c_str(), 0);
         return reason;
     }
-    fsync(directory.get());
+    if (durability == Durability::Synced)
+        fsync(directory.get());
     return std::nullopt;
 }
 

@@ -21,7 +21,7 @@ public:
     std::optional<std::string> createDirectories(const std::filesystem::path& directory, mode_t mode,
                                                  FileModes modes) override;
     std::optional<std::string> writeAtomically(const std::filesystem::path& file, std::string_view contents,
-                                               mode_t mode) override;
+                                               mode_t mode, Durability durability) override;
     // The daemon's own directories (its sockets', its stores'): every one it makes is
     // exactly `mode`, whatever the umask. The reason on failure.
     static std::optional<std::string> makeDirectories(const std::filesystem::path& directory, mode_t mode);
