@@ -16,8 +16,10 @@
 namespace mx {
 
 // How a mode asked for is applied to what is made: as the process umask filters it (as
-// mkdir does), or exactly, whatever the umask.
-enum class FileModes { UmaskFiltered, Exact };
+// mkdir does), or exactly, whatever the umask; ExactAlways also gives the directory
+// asked for (not its parents) the mode when it was already there, made by an older
+// version with another.
+enum class FileModes { UmaskFiltered, Exact, ExactAlways };
 // Whether a replaced file must survive a power cut once written, or may be lost with
 // it (a file rewritten every few seconds anyway: syncing it would wake the disk and
 // the writer's thread each time).

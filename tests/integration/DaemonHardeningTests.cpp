@@ -110,11 +110,14 @@ TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)
 
 // Another user must not move the socket aside, plant a file where the daemon writes,
 // or replace the metrics: every directory and file gets its own mode, whatever the
-// umask the daemon was started with.
+// umask the daemon was started with; and any user may read the metrics.
 TEST(DaemonPermissionsTest, UnderAnOpenUmaskEveryDirectoryAndFileGetsItsOwnMode)
 {
     DaemonProcess daemon;
     daemon.writeFile("etc/harmonia/device.json", R"({"InternalBuild": true})");
+    // As an older version left it: the node exporter's user could not read it.
+    std::filesystem::create_directories(daemon.path("var/lib/harmonia/metrics"));
+    std::filesystem::permissions(daemon.path("var/lib/harmonia/metrics"), std::filesystem::perms(0750));
     mode_t previous = umask(0);
     daemon.start();
     umask(previous);

@@ -129,7 +129,7 @@ void MxReportingMetrics::write(const Dictionary& status)
     auto& fileSystem = ProcessWide<FileSystem>::get();
     auto path = fileSystem.resolve(kPath);
     // Readable by anyone, whatever the umask: a node exporter reads it as its own user.
-    auto failure = fileSystem.createDirectories(path.parent_path(), kDirectoryMode, FileModes::Exact);
+    auto failure = fileSystem.createDirectories(path.parent_path(), kDirectoryMode, FileModes::ExactAlways);
     if (!failure)
         failure = fileSystem.writeAtomically(path, prometheusText(status, now), kFileMode, Durability::Unsynced);
     if (failure && !std::exchange(failing, true))

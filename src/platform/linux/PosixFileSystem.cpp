@@ -44,6 +44,12 @@ std::string groupName(gid_t gid)
     return found ? found->gr_name : std::to_string(gid);
 }
 
+bool hasMode(int fd, mode_t mode)
+{
+    struct stat status {};
+    return ::fstat(fd, &status) == 0 && (status.st_mode & 07777) == mode;
+}
+
 bool isRefusal(int error) { return error == EACCES || error == EPERM || error == EROFS; }
 
 } // namespace
@@ -90,7 +96,7 @@ private:
 };
 
 // How openDirectory treats a missing component.
-enum class Missing { Fail, Create, CreateExactly };
+enum class Missing { Fail, Create, CreateExactly, CreateExactlyAlways };
 
 // The directory `directory`: the host's root opened as it is, every component below
 // it without following a symbolic link, and made with `mode` where missing when asked.
@@ -107,6 +113,9 @@ std::optional<std::string> openDirectory(const std::filesystem::path& directory,
     if (current.get() < 0)
         return root.string() + ": " + errnoText(errno);
     std::filesystem::path walked = root;
+    std::filesystem::path target = (root / below).lexically_normal();
+    if (target.filename().empty())
+        target = target.parent_path();
     for (const auto& component : below) {
         if (component == "." || component.empty())
             continue;
@@ -125,7 +134,10 @@ std::optional<std::string> openDirectory(const std::filesystem::path& directory,
             return walked.string() +
                 (errno == ELOOP || errno == ENOTDIR ? " is not a directory" : ": " + errnoText(errno));
         // Set on what was opened, never on a path another could have swapped meanwhile.
-        if (made && missing == Missing::CreateExactly && fchmod(next.get(), mode) != 0)
+        bool last = walked == target;
+        bool exact = missing == Missing::CreateExactly || missing == Missing::CreateExactlyAlways;
+        if (((made && exact) || (last && missing == Missing::CreateExactlyAlways)) && !hasMode(next.get(), mode) &&
+            fchmod(next.get(), mode) != 0)
             return walked.string() + ": " + errnoText(errno);
         current = std::move(next);
     }
@@ -139,7 +151,10 @@ std::optional<std::string> PosixFileSystem::createDirectories(const std::filesys
                                                               FileModes modes)
 {
     Descriptor opened;
-    return openDirectory(directory, modes == FileModes::Exact ? Missing::CreateExactly : Missing::Create, mode, opened);
+    Missing missing = modes == FileModes::ExactAlways ? Missing::CreateExactlyAlways
+        : modes == FileModes::Exact                   ? Missing::CreateExactly
+                                                      : Missing::Create;
+    return openDirectory(directory, missing, mode, opened);
 }
 
 std::optional<std::string> PosixFileSystem::makeDirectories(const std::filesystem::path& directory, mode_t mode)
