@@ -10,10 +10,10 @@
 #include <fmt/format.h>
 
 #include "Statistics/MxReportingDriverUtility.h"
-#include "tools/MxReportAccess.h"
 #include "tools/MxReportArguments.h"
 #include "wire/ChannelFiles.h"
 #include "wire/Datagram.h"
+#include "wire/FileOwnership.h"
 #include "wire/OrientationDatagram.h"
 #include "wire/RootPath.h"
 
@@ -64,7 +64,8 @@ int writeDomain(const nlohmann::ordered_json& domain)
             std::fprintf(stderr,
                          "mxreport: defaults: cannot write in %s: %s (%s). The preferences are the daemon "
                          "user's: write them as that user or as root\n",
-                         path.parent_path().c_str(), errnoText(error).c_str(), ownership(path.parent_path()).c_str());
+                         path.parent_path().c_str(), errnoText(error).c_str(),
+                         describeOwnership(path.parent_path(), "this is").c_str());
             return kExitRefused;
         }
     }
@@ -72,7 +73,7 @@ int writeDomain(const nlohmann::ordered_json& domain)
         int error = errno;
         std::remove(temporary.c_str());
         std::fprintf(stderr, "mxreport: defaults: cannot replace %s: %s (%s)\n", path.c_str(), errnoText(error).c_str(),
-                     ownership(path).c_str());
+                     describeOwnership(path, "this is").c_str());
         return kExitRefused;
     }
     std::printf("defaults: %s written; post the notification (mxreport notify) for the daemon to read it\n",

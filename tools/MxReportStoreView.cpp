@@ -1,5 +1,4 @@
 #include "MxReportStoreView.h"
-#include "tools/MxReportAccess.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -14,6 +13,7 @@
 #include <sqlite3.h>
 
 #include "value/Value.h"
+#include "wire/FileOwnership.h"
 
 namespace mx {
 

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "MxReportStoreView.h"
+#include "tools/MxReportManualText.h"
 #include "wire/RootPath.h"
 
 namespace {
@@ -43,12 +44,7 @@ int main(int argc, char** argv)
 {
     std::vector<std::string> words(argv + 1, argv + argc);
     if (words.size() == 1 && (words[0] == "--help" || words[0] == "--help-man")) {
-        std::string text = kUsage;
-        // help2man makes "*Title*" a section of its own.
-        if (words[0] == "--help-man")
-            for (std::string heading : {"Exit status", "See also"})
-                text.replace(text.find("\n" + heading + ":\n") + 1, heading.size() + 1, "*" + heading + "*");
-        std::fputs(text.c_str(), stdout);
+        std::fputs((words[0] == "--help-man" ? mx::manualText(kUsage) : std::string(kUsage)).c_str(), stdout);
         return 0;
     }
     if (words.size() == 1 && words[0] == "--version") {

@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <optional>
 #include <unistd.h>
 
@@ -16,11 +15,12 @@
 
 #include "tools/DemoCommand.h"
 #include "tools/HostCommands.h"
-#include "tools/MxReportAccess.h"
 #include "tools/MxReportArguments.h"
+#include "tools/MxReportManualText.h"
 #include "tools/ProtocolCommands.h"
 #include "tools/StatusCommand.h"
 #include "tools/StreamCommands.h"
+#include "wire/FileOwnership.h"
 #include "wire/RootPath.h"
 
 using namespace mx;
@@ -98,17 +98,6 @@ See also:
   mxreportingd(8), mxreportingd.conf(5), mxreport-stores(1), mxreporting(3)
 )";
 
-// The help as help2man reads it: "*Title*" makes a heading a section of its own.
-std::string helpForManual()
-{
-    std::string text = kUsage;
-    for (const char* heading : {"Exit status", "See also"}) {
-        auto at = text.find(std::string("\n") + heading + ":\n");
-        text.replace(at + 1, std::strlen(heading) + 1, std::string("*") + heading + "*");
-    }
-    return text;
-}
-
 struct Options {
     std::string socket = MxReportingPath(kServiceSocketPath).string();
     std::optional<std::int64_t> timeoutSeconds;
@@ -185,7 +174,7 @@ int run(int argc, char** argv)
         if (option == "--help")
             words = {"help"};
         else if (option == "--help-man") {
-            std::fputs(helpForManual().c_str(), stdout);
+            std::fputs(manualText(kUsage).c_str(), stdout);
             return kExitDone;
         } else if (option == "--version")
             words = {"version"};

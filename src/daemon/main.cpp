@@ -14,6 +14,7 @@
 #include <CLI/CLI.hpp>
 #include <asio/signal_set.hpp>
 #include <curl/curl.h>
+#include <fmt/format.h>
 #include <systemd/sd-daemon.h>
 
 #include "Statistics/Service/MxReportingMetrics.h"
@@ -40,6 +41,7 @@
 #include "platform/linux/StderrLogSink.h"
 #include "platform/linux/StoreLimits.h"
 #include "platform/linux/UsdtTracePoints.h"
+#include "wire/FileOwnership.h"
 #include "wire/RootPath.h"
 
 using namespace mx;
@@ -142,7 +144,8 @@ std::string joined(const std::vector<std::string>& errors)
 
 [[noreturn]] void fail(const std::string& message)
 {
-    MXLOG(nullptr, Error, "mxreportingd cannot start (running as {}): {}", PosixFileSystem::processIdentity(), message);
+    MXLOG(nullptr, Error, "mxreportingd cannot start (running as {}): {}",
+          fmt::format("user {}, group {}", userName(geteuid()), groupName(getegid())), message);
     // Worker threads already run: no static destructor may pull the world from under them.
     std::_Exit(1);
 }

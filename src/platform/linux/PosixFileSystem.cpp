@@ -1,18 +1,16 @@
 #include "platform/linux/PosixFileSystem.h"
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
-#include <grp.h>
-#include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
 #include <vector>
 
 #include <fmt/format.h>
 
+#include "wire/FileOwnership.h"
 #include "wire/RootPath.h"
 
 namespace mx {
@@ -26,47 +24,20 @@ std::string errnoText(int error)
     return strerror_r(error, buffer, sizeof(buffer));
 }
 
-std::string userName(uid_t uid)
-{
-    struct passwd entry {};
-    struct passwd* found = nullptr;
-    std::array<char, 4096> buffer{};
-    getpwuid_r(uid, &entry, buffer.data(), buffer.size(), &found);
-    return found ? found->pw_name : std::to_string(uid);
-}
-
-std::string groupName(gid_t gid)
-{
-    struct group entry {};
-    struct group* found = nullptr;
-    std::array<char, 4096> buffer{};
-    getgrgid_r(gid, &entry, buffer.data(), buffer.size(), &found);
-    return found ? found->gr_name : std::to_string(gid);
-}
-
 bool hasMode(int fd, mode_t mode)
 {
     struct stat status {};
     return ::fstat(fd, &status) == 0 && (status.st_mode & 07777) == mode;
 }
 
-bool isRefusal(int error) { return error == EACCES || error == EPERM || error == EROFS; }
-
 } // namespace
 
-std::string PosixFileSystem::accessHint(const std::filesystem::path& path)
+std::string PosixFileSystem::refusalHint(int error, const std::filesystem::path& path)
 {
-    struct stat status {};
-    if (::stat(path.c_str(), &status) != 0)
+    if (error != EACCES && error != EPERM && error != EROFS)
         return "";
-    return fmt::format(" ({} is owned by {}:{}, mode {:04o}; this process runs as {}:{})", path.string(),
-                       userName(status.st_uid), groupName(status.st_gid), status.st_mode & 07777, userName(geteuid()),
-                       groupName(getegid()));
-}
-
-std::string PosixFileSystem::processIdentity()
-{
-    return fmt::format("user {}, group {}", userName(geteuid()), groupName(getegid()));
+    std::string ownership = describeOwnership(path, "this process runs as");
+    return ownership.empty() ? "" : " (" + ownership + ")";
 }
 
 std::filesystem::path PosixFileSystem::resolve(const std::string& path) { return MxReportingPath(path); }
@@ -126,7 +97,7 @@ std::optional<std::string> openDirectory(const std::filesystem::path& directory,
             if (!made && errno != EEXIST) {
                 int error = errno;
                 return walked.string() + ": " + errnoText(error) +
-                    (isRefusal(error) ? PosixFileSystem::accessHint(walked.parent_path()) : "");
+                    PosixFileSystem::refusalHint(error, walked.parent_path());
             }
         }
         Descriptor next(openat(current.get(), component.c_str(), O_DIRECTORY | O_NOFOLLOW | O_RDONLY | O_CLOEXEC));

@@ -25,11 +25,10 @@ public:
     // The daemon's own directories (its sockets', its stores'): every one it makes is
     // exactly `mode`, whatever the umask. The reason on failure.
     static std::optional<std::string> makeDirectories(const std::filesystem::path& directory, mode_t mode);
-    // What an operator needs to mend a refused access to `path`: " (PATH is owned by
-    // OWNER:GROUP, mode 0755; this process runs as USER:GROUP)", or "" if it cannot be looked at.
-    static std::string accessHint(const std::filesystem::path& path);
-    // "user NAME, group NAME": whom this process acts as.
-    static std::string processIdentity();
+    // What an operator needs to mend an access to `path` refused with `error`: " (PATH
+    // is owned by OWNER:GROUP, mode 0755; this process runs as USER:GROUP)", or "" for
+    // another error or a path that cannot be looked at.
+    static std::string refusalHint(int error, const std::filesystem::path& path);
     std::size_t trimDirectory(const std::filesystem::path& directory, std::size_t maxFiles,
                               std::uint64_t maxBytes) override;
 

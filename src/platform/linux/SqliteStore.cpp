@@ -61,9 +61,7 @@ std::optional<std::string> makeFile(const std::filesystem::path& path)
         int error = errno;
         if (error == EEXIST)
             return std::nullopt;
-        bool refused = error == EACCES || error == EPERM || error == EROFS;
-        return "cannot make it: " + errnoText(error) +
-            (refused ? PosixFileSystem::accessHint(path.parent_path()) : std::string());
+        return "cannot make it: " + errnoText(error) + PosixFileSystem::refusalHint(error, path.parent_path());
     }
     bool set = ::fchmod(fd, SqliteStore::kFileMode) == 0;
     int failure = errno;
@@ -112,9 +110,10 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
         return fail(*failure);
     if (sqlite3_open_v2(path.c_str(), &connection.database,
                         SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK)
-        return fail(std::string("cannot open: ") +
-                    (connection.database ? sqlite3_errmsg(connection.database) : "out of memory") +
-                    PosixFileSystem::accessHint(path));
+        return fail(
+            std::string("cannot open: ") +
+            (connection.database ? sqlite3_errmsg(connection.database) : "out of memory") +
+            PosixFileSystem::refusalHint(connection.database ? sqlite3_system_errno(connection.database) : 0, path));
     sqlite3_busy_timeout(connection.database, kBusyTimeoutMilliseconds);
     // The last step proves that the store can be written, not just read.
     // A new store gives pruned pages back to the file system; an older one reuses them.

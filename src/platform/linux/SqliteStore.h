@@ -76,9 +76,10 @@ public:
     // within a millisecond or two, not after a commit of thousands of rows.
     static constexpr std::size_t kBatchLimit = 256;
     // How long the writer lets a batch gather, from its first row or from the last
-    // commit while rows keep coming, unless the batch fills first: at everyday rates a transaction and its wake-ups
-    // cost far more than a row, so one commit a window carries what a few hundred reports left. It is also what a
-    // SIGKILL may take of rows whose reports were answered, with the commit's own time on top.
+    // commit while rows keep coming, unless the batch fills first: at everyday rates a
+    // transaction and its wake-ups cost far more than a row, so one commit a window
+    // carries what a few hundred reports left. It is also what a SIGKILL may take of
+    // rows whose reports were answered, with the commit's own time on top.
     static constexpr std::chrono::milliseconds kBatchWindow{50};
     // Writers yield the processor to request handling: a commit that takes the CPU
     // a client's request wakes on delays its reply by the length of the commit.

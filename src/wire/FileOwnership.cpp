@@ -1,4 +1,4 @@
-#include "tools/MxReportAccess.h"
+#include "wire/FileOwnership.h"
 
 #include <array>
 #include <grp.h>
@@ -10,8 +10,6 @@
 
 namespace mx {
 
-namespace {
-
 std::string userName(uid_t user)
 {
     struct passwd entry {};
@@ -20,8 +18,6 @@ std::string userName(uid_t user)
     getpwuid_r(user, &entry, buffer.data(), buffer.size(), &found);
     return found ? found->pw_name : std::to_string(user);
 }
-
-} // namespace
 
 std::string groupName(gid_t group)
 {
@@ -32,13 +28,15 @@ std::string groupName(gid_t group)
     return found ? found->gr_name : std::to_string(group);
 }
 
-std::string ownership(const std::filesystem::path& path)
+std::string processOwner() { return userName(geteuid()) + ":" + groupName(getegid()); }
+
+std::string describeOwnership(const std::filesystem::path& path, std::string_view self)
 {
     struct stat status {};
     if (::stat(path.c_str(), &status) != 0)
         return "";
-    return fmt::format("{} is owned by {}:{}, mode {:04o}; this is {}:{}", path.string(), userName(status.st_uid),
-                       groupName(status.st_gid), status.st_mode & 07777, userName(geteuid()), groupName(getegid()));
+    return fmt::format("{} is owned by {}:{}, mode {:04o}; {} {}", path.string(), userName(status.st_uid),
+                       groupName(status.st_gid), status.st_mode & 07777, self, processOwner());
 }
 
 std::string owningGroup(const std::filesystem::path& path)
