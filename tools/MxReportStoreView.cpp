@@ -85,10 +85,8 @@ std::string plain(const nlohmann::ordered_json& value)
     return value.is_string() ? value.get<std::string>() : value.dump();
 }
 
-} // namespace
-
 // What keeps this user from reading the store at `path`, said so that it can be mended.
-static std::optional<std::string> unreadable(const std::filesystem::path& path)
+std::optional<std::string> unreadable(const std::filesystem::path& path)
 {
     if (::access(path.c_str(), R_OK) == 0)
         return std::nullopt;
@@ -102,6 +100,8 @@ static std::optional<std::string> unreadable(const std::filesystem::path& path)
     return fmt::format("cannot read {}: only its owner and group {} may; add this user to group {} (then log in again)",
                        path.string(), group, group);
 }
+
+} // namespace
 
 int printStore(const std::filesystem::path& storeDirectory, const MxReportStoreQuery& query)
 {

@@ -144,8 +144,8 @@ std::string joined(const std::vector<std::string>& errors)
 
 [[noreturn]] void fail(const std::string& message)
 {
-    MXLOG(nullptr, Error, "mxreportingd cannot start (running as {}): {}",
-          fmt::format("user {}, group {}", userName(geteuid()), groupName(getegid())), message);
+    MXLOG(nullptr, Error, "mxreportingd cannot start (running as user {}, group {}): {}", userName(geteuid()),
+          groupName(getegid()), message);
     // Worker threads already run: no static destructor may pull the world from under them.
     std::_Exit(1);
 }

@@ -199,6 +199,11 @@ void ConfigFile::fail(const Pointer& at, const std::string& message)
     errors_.push_back(fmt::format("{}: {}", place(JsonTextLocator(text_).find(tokensOf(at), false)), message));
 }
 
+void ConfigFile::failSetting(const Pointer& at, const std::string& message)
+{
+    fail(at, settingName(at) + ": " + message);
+}
+
 bool ConfigFile::onlyKeys(const Pointer& at, std::initializer_list<std::string_view> allowed)
 {
     bool clean = true;

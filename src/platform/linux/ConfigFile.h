@@ -28,6 +28,8 @@ public:
 
     // Adds an error placed at the value `at` points to.
     void fail(const Pointer& at, const std::string& message);
+    // The same, the message led by the setting's name ("tls.ca_file: ...").
+    void failSetting(const Pointer& at, const std::string& message);
     // Errors, each at its key, for every member of the object at `at` that is not one
     // of `allowed`; true if none.
     bool onlyKeys(const Pointer& at, std::initializer_list<std::string_view> allowed);

@@ -127,7 +127,7 @@ bool readTls(ConfigFile& file, const ConfigFile::Pointer& at, OtlpCollector& col
         }
         auto path = file.path().parent_path() / tls[key].get<std::string>();
         if (auto problem = pemProblem(path.string(), kind)) {
-            file.fail(setting, fmt::format("{}: {}", file.settingName(setting), *problem));
+            file.failSetting(setting, *problem);
             good = false;
             return;
         }
@@ -137,13 +137,12 @@ bool readTls(ConfigFile& file, const ConfigFile::Pointer& at, OtlpCollector& col
     readFile("cert_file", "certificate", collector.certFile);
     readFile("key_file", "key", collector.keyFile);
     if (good && tls.contains("cert_file") != tls.contains("key_file")) {
-        file.fail(at, fmt::format("{}: cert_file and key_file go together", file.settingName(at)));
+        file.failSetting(at, "cert_file and key_file go together");
         good = false;
     }
     if (good && !collector.certFile.empty() && !keyMatches(collector.certFile, collector.keyFile)) {
-        file.fail(at / "key_file",
-                  fmt::format("{}: {} is not the key of {}", file.settingName(at / "key_file"), collector.keyFile,
-                              collector.certFile));
+        file.failSetting(at / "key_file",
+                         fmt::format("{} is not the key of {}", collector.keyFile, collector.certFile));
         good = false;
     }
     return good;
@@ -166,8 +165,7 @@ std::optional<OtlpCollector> OtlpCollector::read(ConfigFile& file, const ConfigF
     collector.url = url->get<std::string>();
     std::string scheme = collectorScheme(collector.url);
     if (scheme.empty()) {
-        file.fail(at / "url",
-                  fmt::format("{}: {} is no http or https URL with a host", file.settingName(at / "url"), url->dump()));
+        file.failSetting(at / "url", fmt::format("{} is no http or https URL with a host", url->dump()));
         good = false;
     }
     if (backend.contains("headers"))
@@ -175,9 +173,7 @@ std::optional<OtlpCollector> OtlpCollector::read(ConfigFile& file, const ConfigF
     if (backend.contains("tls")) {
         good &= readTls(file, at / "tls", collector);
         if (scheme == "http") {
-            file.fail(at / "tls",
-                      fmt::format("{}: tls is for an https collector, and {} is http", file.settingName(at / "tls"),
-                                  collector.url));
+            file.failSetting(at / "tls", fmt::format("tls is for an https collector, and {} is http", collector.url));
             good = false;
         }
     }

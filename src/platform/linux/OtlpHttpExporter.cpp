@@ -247,13 +247,13 @@ std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string&
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, nullptr);
     curl_slist_free_all(headers);
     retryAfter = std::chrono::seconds(retry);
-    if (result == CURLE_PEER_FAILED_VERIFICATION)
-        return UplinkError{result,
-                           fmt::format("{}: {} (the CA to trust is tls.ca_file of this collector in uplink.json)",
-                                       collector_.url, failure[0] ? failure : curl_easy_strerror(result))};
-    if (result != CURLE_OK)
-        return UplinkError{result,
-                           fmt::format("{}: {}", collector_.url, failure[0] ? failure : curl_easy_strerror(result))};
+    if (result != CURLE_OK) {
+        const char* hint = result == CURLE_PEER_FAILED_VERIFICATION
+            ? " (the CA to trust is tls.ca_file of this collector in uplink.json)"
+            : "";
+        return UplinkError{
+            result, fmt::format("{}: {}{}", collector_.url, failure[0] ? failure : curl_easy_strerror(result), hint)};
+    }
     if (status < 200 || status >= 300)
         return UplinkError{status, fmt::format("{}: HTTP status {}", collector_.url, status)};
     return std::nullopt;

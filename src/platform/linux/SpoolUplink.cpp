@@ -99,15 +99,13 @@ std::optional<SpoolUplink::Backends> SpoolUplink::readBackends(const std::filesy
             // Each collector's progress through the spool is kept by its URL.
             if (std::any_of(backends.collectors.begin(), backends.collectors.end(),
                             [&](const auto& listedBefore) { return listedBefore.url == collector->url; })) {
-                file.fail(at / "url",
-                          fmt::format("{}: {} is listed twice", file.settingName(at / "url"), collector->url));
+                file.failSetting(at / "url", collector->url + " is listed twice");
                 good = false;
             }
             backends.collectors.push_back(std::move(*collector));
         } else {
-            file.fail(at,
-                      fmt::format("{}: unknown backend {}: the types are \"spool\" and \"otlp-http\"",
-                                  file.settingName(at), backend.dump()));
+            file.failSetting(
+                at, fmt::format("unknown backend {}: the types are \"spool\" and \"otlp-http\"", backend.dump()));
             good = false;
         }
     }
