@@ -51,7 +51,8 @@ SqliteRetention spoolRetention(const StoreLimit& limit, const std::vector<OtlpCo
                            condition, count);
     };
     bool collecting = !collectors.empty();
-    SqliteRetention retention{limit.maxBytes, limit.maxAge, {}, {}, {}};
+    SqliteRetention retention{
+        limit.maxBytes, limit.maxAge, {}, {}, {}, "SELECT time FROM messages ORDER BY id LIMIT 1"};
     retention.olderThan = {{select("m.time < ?1 AND " + acknowledged, "?2")},
                            {select("m.time < ?1", "?2"), collecting}};
     retention.oldest = {{select(acknowledged, "?1")}, {select("1", "?1"), collecting}};

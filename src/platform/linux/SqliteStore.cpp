@@ -4,8 +4,6 @@
 #include <chrono>
 #include <ctime>
 #include <fcntl.h>
-#include <pthread.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <system_error>
 #include <unistd.h>
@@ -178,98 +176,137 @@ SqliteStore::SqliteStore(std::filesystem::path path, std::vector<std::string> sc
     : path_(std::move(path)),
       schema_(std::move(schema)),
       statementTexts_(std::move(statements)),
+      writer_(SqliteWriter::shared()),
       retention_(std::move(retention)),
       connection_(std::move(connection))
 {
-    writer_ = std::thread([this] {
-        pthread_setname_np(pthread_self(), "mx-store");
-        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
-        run();
-    });
+    std::lock_guard lock(writer_->mutex());
+    writer_->attach(*this);
 }
 
 SqliteStore::~SqliteStore()
 {
     {
-        std::lock_guard lock(mutex_);
-        stopping_ = true;
+        std::unique_lock lock(writer_->mutex());
+        closing_ = true;
+        writer_->hurry();
+        writer_->changed().wait(lock, [&] { return settled_ == submitted_; });
+        writer_->detach(*this, lock);
     }
-    changed_.notify_all();
-    writer_.join();
     disconnect(connection_);
 }
 
 void SqliteStore::submit(SqliteWrite write)
 {
     write.debt = BacklogDebt::incur();
-    std::lock_guard lock(mutex_);
+    std::lock_guard lock(writer_->mutex());
     queue_.push_back(std::move(write));
     ++submitted_;
-    // A quiet writer is woken by the first row, a gathering one by the row that fills
-    // its batch; the rows between wait for the window to end.
-    if (writerWaiting_ || (gathering_ && queue_.size() == kBatchLimit))
-        changed_.notify_all();
+    writer_->queued(queue_.size());
 }
 
 void SqliteStore::flush()
 {
-    std::unique_lock lock(mutex_);
+    std::unique_lock lock(writer_->mutex());
     std::uint64_t target = submitted_;
-    flushing_ = committed_ < target;
-    changed_.notify_all();
-    changed_.wait(lock, [&] { return committed_ >= target; });
+    if (settled_ < target)
+        writer_->hurry();
+    writer_->changed().wait(lock, [&] { return settled_ >= target; });
 }
 
-void SqliteStore::run()
+// A full batch goes before its window ends; a failing one waits for its retry, unless
+// the store closes.
+bool SqliteStore::wantsRound() const
 {
-    std::unique_lock lock(mutex_);
-    // While rows keep coming the writer gathers window after window on its own clock,
-    // and callers never wake it; a window that brings nothing makes it quiet, and then
-    // the next row wakes it.
-    bool active = false;
-    for (;;) {
-        if (!active && queue_.empty() && !stopping_) {
-            lock.unlock();
-            cutBackLog();
-            lock.lock();
-            writerWaiting_ = true;
-            changed_.wait(lock, [&] { return !queue_.empty() || stopping_; });
-            writerWaiting_ = false;
-        }
-        gathering_ = true;
-        changed_.wait_for(lock, kBatchWindow, [&] { return queue_.size() >= kBatchLimit || stopping_ || flushing_; });
-        gathering_ = false;
-        if (queue_.size() <= kBatchLimit)
-            flushing_ = false;
-        active = !queue_.empty();
-        if (!active) {
-            if (stopping_)
-                return;
-            continue;
-        }
+    if (batch_.empty())
+        return queue_.size() >= kBatchLimit;
+    return closing_;
+}
+
+std::optional<std::chrono::steady_clock::time_point> SqliteStore::retryAt() const
+{
+    if (batch_.empty())
+        return std::nullopt;
+    return retryAt_;
+}
+
+bool SqliteStore::takeBatch(std::chrono::steady_clock::time_point now)
+{
+    if (batch_.empty()) {
+        if (queue_.empty())
+            return false;
         if (newRetention_) {
             retention_ = *std::exchange(newRetention_, std::nullopt);
             logConfigured_ = false;
         }
-        std::deque<SqliteWrite> batch;
-        while (!queue_.empty() && batch.size() < kBatchLimit) {
-            batch.push_back(std::move(queue_.front()));
+        while (!queue_.empty() && batch_.size() < kBatchLimit) {
+            batch_.push_back(std::move(queue_.front()));
             queue_.pop_front();
         }
-        lock.unlock();
-        write(batch);
-        std::size_t written = batch.size();
-        // The rows' debts settle now, outside the lock: a client held back by them is
-        // resumed from here.
-        batch.clear();
+    } else if (!closing_ && now < retryAt_) {
+        return false;
+    }
+    queuedBehind_ = queue_.size();
+    giveUp_ = closing_;
+    return true;
+}
+
+void SqliteStore::endRound()
+{
+    if (std::exchange(roundCheckpoint_, false))
+        writer_->checkpoint(path_);
+    committed_ += std::exchange(roundWritten_, 0);
+    settled_ += std::exchange(roundSettled_, 0);
+    failures_ += std::exchange(roundFailures_, 0);
+}
+
+// One attempt at the batch at hand. Committed, its rows' debts settle here: a client
+// held back by them is resumed from this thread.
+void SqliteStore::writeBatch()
+{
+    auto now = std::chrono::steady_clock::now();
+    std::string error;
+    bool present = stillOnDisk(error);
+    if (present && !logConfigured_)
+        configureLog();
+    if (present)
+        checkpointIfBehind();
+    if (present && commit(batch_, error)) {
+        if (attempts_ > 0)
+            MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts_,
+                  describe(now - failingSince_));
+        attempts_ = 0;
+        retryDelay_ = kFirstRetry;
+        roundWritten_ = batch_.size();
+        roundSettled_ = batch_.size();
+        roundCheckpoint_ = logPages_ >= checkpointPages_;
+        batch_.clear();
         // Age is looked at now and then; size after any batch that may have taken the
         // rows past their share, so that a burst never takes the store far past its bound.
         if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval || rowsMayExceedShare())
             prune();
-        lock.lock();
-        committed_ += written;
-        changed_.notify_all();
+        return;
     }
+    ++roundFailures_;
+    if (attempts_++ == 0) {
+        failingSince_ = now;
+        MXLOG(nullptr, Error,
+              "{}: cannot write ({}); holding {} rows and retrying: the clients that sent them wait until it "
+              "can write again",
+              path_.string(), error, batch_.size() + queuedBehind_);
+    }
+    // Only a store being closed gives up, and says what it could not keep.
+    if (giveUp_ && attempts_ > 1) {
+        MXLOG(nullptr, Error, "{}: closing with {} rows that could not be written: {}", path_.string(),
+              batch_.size() + queuedBehind_, error);
+        roundSettled_ = batch_.size();
+        batch_.clear();
+        attempts_ = 0;
+        retryDelay_ = kFirstRetry;
+        return;
+    }
+    retryAt_ = now + retryDelay_;
+    retryDelay_ = std::min(retryDelay_ * 2, kLongestRetry);
 }
 
 // A batch larger than the log's share takes the log past it until the log starts
@@ -301,18 +338,38 @@ std::uint64_t SqliteStore::rowsShare() const
 
 // The log is checkpointed into the file once it holds half of what its share leaves
 // beside the shared-memory index, and cut back to that when it starts again: a batch
-// committed past it, before the checkpoint, still fits in the share.
+// committed past it, before the checkpoint, still fits in the share. The checkpoint
+// runs beside the writer (SqliteWriter): it waits on the disk twice, and every store's
+// rows would wait with it. A log that reaches twice its mark, the checkpoints falling
+// behind, is checkpointed here, before the next batch.
 void SqliteStore::configureLog()
 {
     logConfigured_ = true;
-    if (retention_.maxBytes == 0 || !connection_.database)
+    if (!connection_.database)
         return;
-    std::uint64_t limit = logShare() - kIndexBytes;
-    limit /= 2;
-    auto pages = std::max<std::uint64_t>(1, limit / kPageBytes);
-    sqlite3_exec(connection_.database, fmt::format("PRAGMA journal_size_limit={}", limit).c_str(), nullptr, nullptr,
-                 nullptr);
-    sqlite3_wal_autocheckpoint(connection_.database, static_cast<int>(pages));
+    checkpointPages_ = kUnboundedCheckpointPages;
+    if (retention_.maxBytes > 0) {
+        std::uint64_t limit = (logShare() - kIndexBytes) / 2;
+        checkpointPages_ = static_cast<int>(std::max<std::uint64_t>(1, limit / kPageBytes));
+        sqlite3_exec(connection_.database, fmt::format("PRAGMA journal_size_limit={}", limit).c_str(), nullptr, nullptr,
+                     nullptr);
+    }
+    // Replaces SQLite's own checkpoint after commits.
+    sqlite3_wal_hook(
+        connection_.database,
+        [](void* self, sqlite3*, const char*, int pages) {
+            static_cast<SqliteStore*>(self)->logPages_ = pages;
+            return SQLITE_OK;
+        },
+        this);
+}
+
+void SqliteStore::checkpointIfBehind()
+{
+    if (logPages_ < 2 * checkpointPages_)
+        return;
+    sqlite3_wal_checkpoint_v2(connection_.database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+    logPages_ = 0;
 }
 
 std::uint64_t SqliteStore::dataBytes()
@@ -358,6 +415,18 @@ std::int64_t SqliteStore::pruneStep(const SqliteRetention::Step& step, std::int6
     return sqlite3_changes(connection_.database);
 }
 
+bool SqliteStore::anyOlderThan(std::int64_t cutoff)
+{
+    if (retention_.firstTime.empty())
+        return true;
+    sqlite3_stmt* statement = nullptr;
+    bool older = true;
+    if (sqlite3_prepare_v2(connection_.database, retention_.firstTime.c_str(), -1, &statement, nullptr) == SQLITE_OK)
+        older = sqlite3_step(statement) == SQLITE_ROW && sqlite3_column_double(statement, 0) < double(cutoff);
+    sqlite3_finalize(statement);
+    return older;
+}
+
 void SqliteStore::prune()
 {
     lastPrune_ = std::chrono::steady_clock::now();
@@ -376,8 +445,9 @@ void SqliteStore::prune()
     };
     if (retention_.maxAge.count() > 0) {
         auto cutoff = static_cast<std::int64_t>(secondsSinceEpoch()) - retention_.maxAge.count();
-        for (const auto& step : retention_.olderThan)
-            while (run(step, cutoff) == kAgeChunk) {}
+        if (anyOlderThan(cutoff))
+            for (const auto& step : retention_.olderThan)
+                while (run(step, cutoff) == kAgeChunk) {}
     }
     if (retention_.maxBytes > 0)
         while (static_cast<double>(dataBytes()) > kSizeLowWater * static_cast<double>(rowsShare())) {
@@ -403,11 +473,9 @@ void SqliteStore::prune()
         MXLOG(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(), unexported);
 }
 
-// Holds the batch until it commits. Meanwhile nothing more is taken from the queue,
-// which fills, and then callers wait: that is the back-pressure, not a loss.
 void SqliteStore::setRetention(SqliteRetention retention)
 {
-    std::lock_guard lock(mutex_);
+    std::lock_guard lock(writer_->mutex());
     newRetention_ = std::move(retention);
 }
 
@@ -419,44 +487,9 @@ Dictionary SqliteStore::status()
         if (::stat((path_.native() + suffix).c_str(), &file) == 0)
             bytes += static_cast<std::uint64_t>(file.st_size);
     }
-    std::lock_guard lock(mutex_);
+    std::lock_guard lock(writer_->mutex());
     return Dictionary{
         {"rows_written", committed_}, {"queue_depth", queue_.size()}, {"bytes", bytes}, {"failures", failures_}};
-}
-
-void SqliteStore::write(std::deque<SqliteWrite>& batch)
-{
-    auto retry = kFirstRetry;
-    std::uint64_t attempts = 0;
-    auto began = std::chrono::steady_clock::now();
-    for (;;) {
-        std::string error;
-        bool present = stillOnDisk(error);
-        if (present && !logConfigured_)
-            configureLog();
-        if (present && commit(batch, error)) {
-            if (attempts == 0)
-                return;
-            MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts,
-                  describe(std::chrono::steady_clock::now() - began));
-            return;
-        }
-        std::unique_lock lock(mutex_);
-        ++failures_;
-        if (attempts++ == 0)
-            MXLOG(nullptr, Error,
-                  "{}: cannot write ({}); holding {} rows and retrying: the clients that sent them wait until it "
-                  "can write again",
-                  path_.string(), error, batch.size() + queue_.size());
-        // Only a store being destroyed gives up, and says what it could not keep.
-        if (stopping_ && attempts > 1) {
-            MXLOG(nullptr, Error, "{}: closing with {} rows that could not be written: {}", path_.string(),
-                  batch.size() + queue_.size(), error);
-            return;
-        }
-        changed_.wait_for(lock, retry, [&] { return stopping_; });
-        retry = std::min(retry * 2, kLongestRetry);
-    }
 }
 
 // A file removed under the open connection still takes writes, into nothing: the

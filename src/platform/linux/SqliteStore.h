@@ -1,21 +1,21 @@
 #pragma once
-// An embedded SQLite store written in batches on a writer thread of its own. Callers
-// hand over rows and go on, never waiting: each row is a debt on the account of the
-// client whose request made it (BacklogAccount), settled once the row is committed,
-// and a client whose rows wait unwritten past its bound is taken no further request
-// from. So the queue is bounded by what its clients may owe, nothing is ever dropped,
-// and a slow store holds back the clients that fill it and no other.
+// An embedded SQLite store written in batches by the process's one store writer
+// (SqliteWriter). Callers hand over rows and go on, never waiting: each row is a debt
+// on the account of the client whose request made it (BacklogAccount), settled once
+// the row is committed, and a client whose rows wait unwritten past its bound is taken
+// no further request from. So the queue is bounded by what its clients may owe,
+// nothing is ever dropped, and a slow store holds back the clients that fill it and
+// no other.
 // WAL journaling keeps every committed batch across a crash; destruction commits
 // everything handed over before.
 // Failure policy: a batch that cannot be written (full or read-only disk, the file
 // removed) is held and retried with backoff until it commits, while its clients'
-// debts stay; the failure is logged when it starts and when it clears. A file
-// removed while open is noticed and made anew; a corrupt file found at open is set
-// aside and a fresh store made.
+// debts stay and the other stores go on; the failure is logged when it starts and
+// when it clears. A file removed while open is noticed and made anew; a corrupt file
+// found at open is set aside and a fresh store made.
 // Thread-safe: any thread may submit.
 
 #include <chrono>
-#include <condition_variable>
 #include <cstdint>
 #include <deque>
 #include <filesystem>
@@ -24,12 +24,12 @@
 #include <optional>
 #include <string>
 #include <sys/types.h>
-#include <thread>
 #include <variant>
 #include <vector>
 
 #include "platform/BacklogAccount.h"
 #include "platform/UniqueFunction.h"
+#include "platform/linux/SqliteWriter.h"
 #include "value/Value.h"
 
 struct sqlite3;
@@ -62,6 +62,9 @@ struct SqliteRetention {
     std::vector<Step> olderThan;
     std::vector<Step> oldest;
     std::vector<std::string> tidy; // run after rows went, e.g. for rows that refer to them
+    // The time of the first row written, when the steps by age find nothing before it:
+    // they scan the table, and rows are written in the order of their time.
+    std::string firstTime;
 };
 
 struct SqliteWrite {
@@ -81,11 +84,6 @@ public:
     // carries what a few hundred reports left. It is also what a SIGKILL may take of
     // rows whose reports were answered, with the commit's own time on top.
     static constexpr std::chrono::milliseconds kBatchWindow{50};
-    // Writers yield the processor to request handling: a commit that takes the CPU
-    // a client's request wakes on delays its reply by the length of the commit.
-    // Under sustained load they still get their share, and the bounded queue
-    // slows requests down to the rate they commit at.
-    static constexpr int kWriterNiceness = 10;
     // A row's JSON text is built in a buffer kept from row to row, unless it grew
     // past this.
     static constexpr std::size_t kTextKeptBytes = std::size_t{64} << 10;
@@ -111,6 +109,8 @@ public:
     static constexpr std::uint64_t kLargestLogShare = 4 << 20;
     static constexpr std::uint64_t kIndexBytes = 32 << 10; // the log's shared-memory index
     static constexpr std::uint64_t kPageBytes = 4096;
+    // The log of a store without a size bound is checkpointed at SQLite's own mark.
+    static constexpr int kUnboundedCheckpointPages = 1000;
     // A store is its owner's to write and its group's (audio) to read.
     static constexpr mode_t kFileMode = 0640;
     // How long a write waits for a reader (mxreport, the exporter) to let go.
@@ -142,6 +142,8 @@ public:
     Dictionary status();
 
 private:
+    friend class SqliteWriter;
+
     // One open database file with its prepared statements. Writer thread only, once
     // the store runs.
     struct Connection {
@@ -160,44 +162,68 @@ private:
                         const std::vector<std::string>& statements, Connection& connection, std::string& error,
                         int& code);
     static void disconnect(Connection& connection);
-    void run();
-    void write(std::deque<SqliteWrite>& batch);
+
+    // The writer's side. Under its lock:
+    bool hasWork() const { return !queue_.empty() || !batch_.empty(); }
+    bool wantsRound() const;
+    std::optional<std::chrono::steady_clock::time_point> retryAt() const;
+    bool takeBatch(std::chrono::steady_clock::time_point now);
+    bool queuedBeyondBatch() const { return !queue_.empty(); }
+    void endRound();
+    // Without it:
+    void writeBatch();
+    void cutBackLog();
+
     bool stillOnDisk(std::string& error);
     bool commit(std::deque<SqliteWrite>& batch, std::string& error);
     void prune();
     std::uint64_t logShare() const;
     std::uint64_t rowsShare() const;
     void configureLog();
-    void cutBackLog();
+    void checkpointIfBehind();
     std::int64_t pruneStep(const SqliteRetention::Step& step, std::int64_t cutoff);
+    bool anyOlderThan(std::int64_t cutoff);
     std::uint64_t dataBytes();
     bool rowsMayExceedShare();
 
     const std::filesystem::path path_;
     const std::vector<std::string> schema_;
     const std::vector<std::string> statementTexts_;
-    SqliteRetention retention_;  // writer thread only
-    bool logConfigured_ = false; // writer thread only: the log's bounds match retention_
-    std::optional<SqliteRetention> newRetention_;
+    const std::shared_ptr<SqliteWriter> writer_;
+
+    // Writer thread only.
+    SqliteRetention retention_;
+    bool logConfigured_ = false;                      // the log's bounds match retention_
+    int checkpointPages_ = kUnboundedCheckpointPages; // the log's mark
+    int logPages_ = 0;                                // in the log after the last commit
     Connection connection_;
-    std::vector<std::string> texts_; // writer thread only: each parameter's JSON text for the row at hand
+    std::vector<std::string> texts_; // each parameter's JSON text for the row at hand
     std::chrono::steady_clock::time_point lastPrune_{};
-    // Writer thread only: what the rows took when last asked (nothing: ask at once), and
-    // what the batches since bound and stepped.
+    // What the rows took when last asked (nothing: ask at once), and what the batches
+    // since bound and stepped.
     std::optional<std::uint64_t> measuredBytes_;
     std::uint64_t unmeasuredBytes_ = 0;
+    // The batch at hand, kept while it fails, and how its attempts went.
+    std::deque<SqliteWrite> batch_;
+    std::size_t queuedBehind_ = 0; // rows queued behind it when it was taken or retried
+    bool giveUp_ = false;          // the store closes: a second failure abandons the batch
+    std::uint64_t attempts_ = 0;
+    std::chrono::milliseconds retryDelay_ = kFirstRetry;
+    std::chrono::steady_clock::time_point retryAt_{};
+    std::chrono::steady_clock::time_point failingSince_{};
+    std::uint64_t roundWritten_ = 0;
+    std::uint64_t roundSettled_ = 0; // written or abandoned
+    std::uint64_t roundFailures_ = 0;
+    bool roundCheckpoint_ = false; // the log passed its mark
 
-    std::mutex mutex_;
-    std::condition_variable changed_;
+    // Under the writer's lock.
+    std::optional<SqliteRetention> newRetention_;
     std::deque<SqliteWrite> queue_;
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
+    std::uint64_t settled_ = 0; // committed, or abandoned by a store closing on a failing disk
     std::uint64_t failures_ = 0;
-    bool stopping_ = false;
-    bool flushing_ = false;      // a flush waits: the batch at hand goes now
-    bool writerWaiting_ = false; // for a first row
-    bool gathering_ = false;     // for the window to end or the batch to fill
-    std::thread writer_;
+    bool closing_ = false;
 };
 
 } // namespace mx

@@ -82,7 +82,8 @@ SqliteRetention eventsRetention(const StoreLimit& limit)
             limit.maxAge,
             {{"DELETE FROM events WHERE id IN (SELECT id FROM events WHERE time < ?1 ORDER BY id LIMIT ?2)"}},
             {{"DELETE FROM events WHERE id IN (SELECT id FROM events ORDER BY id LIMIT ?1)"}},
-            {}};
+            {},
+            "SELECT time FROM events ORDER BY id LIMIT 1"};
 }
 
 } // namespace mx

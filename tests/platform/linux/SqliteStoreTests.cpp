@@ -1,9 +1,11 @@
 #include "platform/linux/JsonDeviceProperties.h"
 #include "platform/linux/SpoolUplink.h"
+#include "platform/linux/SqliteStore.h"
 #include "platform/linux/SqliteTally.h"
 #include "platform/linux/StoreLimits.h"
 
 #include <fstream>
+#include <thread>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -70,6 +72,48 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
     EXPECT_EQ(count("SELECT count(*) FROM events"), events);
     EXPECT_EQ(count("SELECT count(*) FROM events WHERE payload = '{\"k\":\"v\",\"when\":\"1970-01-01T00:00:00Z\"}'"),
               events);
+}
+
+// Every store shares one writer thread: a store that cannot write must not hold up the
+// others, and once it can, it writes what it held. The first batch also prunes by age.
+TEST_F(SqliteStoreTest, AStoreThatCannotWriteHoldsUpNoOtherAndCatchesUp)
+{
+    const std::vector<std::string> schema = {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL)"};
+    const std::vector<std::string> insert = {"INSERT INTO events(time) VALUES (?1)"};
+    auto row = [](double time) {
+        return SqliteWrite{0, {time}};
+    };
+    std::string error;
+    auto failing = SqliteStore::open(directory / "joule.db", schema, insert, {}, error);
+    auto healthy =
+        SqliteStore::open(directory / "tally.db", schema, insert, eventsRetention({0, std::chrono::hours(24)}), error);
+    ASSERT_TRUE(failing && healthy) << error;
+
+    // Its file gives way to a directory: the store cannot make a new one there.
+    for (const char* suffix : {"", "-wal", "-shm"})
+        std::filesystem::remove(directory / ("joule.db" + std::string(suffix)));
+    std::filesystem::create_directory(directory / "joule.db");
+    failing->submit(row(secondsSinceEpoch()));
+    healthy->submit(row(1000.0)); // long past its age
+    healthy->submit(row(secondsSinceEpoch()));
+    healthy->flush();
+    EXPECT_EQ(count("SELECT count(*) FROM events"), 1);
+    EXPECT_EQ(count("SELECT count(*) FROM events WHERE time < 2000"), 0);
+
+    auto logged = [&](const std::string& text) {
+        return std::ranges::any_of(log.texts(), [&](const auto& line) { return line.find(text) != line.npos; });
+    };
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (!logged("joule.db: cannot write") && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    auto written = [&] {
+        return *failing->status().find("rows_written")->asUInt();
+    };
+    EXPECT_EQ(written(), 0u);
+    std::filesystem::remove(directory / "joule.db");
+    failing->flush();
+    EXPECT_EQ(written(), 1u);
+    EXPECT_TRUE(logged("joule.db: writing again after"));
 }
 
 TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)

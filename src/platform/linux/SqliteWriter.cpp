@@ -1,0 +1,209 @@
+#include "platform/linux/SqliteWriter.h"
+
+#include <algorithm>
+#include <pthread.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <sqlite3.h>
+
+#include "platform/linux/SqliteStore.h"
+
+namespace mx {
+
+namespace {
+
+// The writer yields the processor to request handling: a commit that takes the CPU a
+// client's request wakes on delays its reply by the length of the commit. Under
+// sustained load it still gets its share, and the bounded queues slow requests down
+// to the rate it commits at.
+constexpr int kWriterNiceness = 10;
+
+struct SharedWriter {
+    std::mutex mutex;
+    std::weak_ptr<SqliteWriter> writer;
+};
+
+SharedWriter& sharedWriter()
+{
+    static auto* shared = new SharedWriter; // outlives any store closed at exit
+    return *shared;
+}
+
+} // namespace
+
+std::shared_ptr<SqliteWriter> SqliteWriter::shared()
+{
+    auto& shared = sharedWriter();
+    std::lock_guard lock(shared.mutex);
+    auto writer = shared.writer.lock();
+    if (!writer) {
+        writer = std::make_shared<SqliteWriter>();
+        shared.writer = writer;
+    }
+    return writer;
+}
+
+SqliteWriter::SqliteWriter()
+{
+    thread_ = std::thread([this] {
+        pthread_setname_np(pthread_self(), "mx-store");
+        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
+        run();
+    });
+    checkpointer_ = std::thread([this] {
+        pthread_setname_np(pthread_self(), "mx-checkpoint");
+        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
+        runCheckpoints();
+    });
+}
+
+SqliteWriter::~SqliteWriter()
+{
+    {
+        std::lock_guard lock(mutex_);
+        closing_ = true;
+    }
+    changed_.notify_all();
+    checkpointsChanged_.notify_all();
+    thread_.join();
+    checkpointer_.join();
+}
+
+void SqliteWriter::attach(SqliteStore& store) { stores_.push_back(&store); }
+
+void SqliteWriter::detach(SqliteStore& store, std::unique_lock<std::mutex>& lock)
+{
+    changed_.wait(lock, [&] { return !inRound_; });
+    std::erase(stores_, &store);
+}
+
+void SqliteWriter::queued(std::size_t depth)
+{
+    if (waiting_ || (gathering_ && depth == SqliteStore::kBatchLimit))
+        changed_.notify_all();
+}
+
+void SqliteWriter::hurry()
+{
+    flushing_ = true;
+    changed_.notify_all();
+}
+
+void SqliteWriter::checkpoint(const std::filesystem::path& path)
+{
+    if (std::ranges::find(checkpoints_, path) != checkpoints_.end())
+        return;
+    checkpoints_.push_back(path);
+    checkpointsChanged_.notify_one();
+}
+
+bool SqliteWriter::anyWork() const
+{
+    return std::ranges::any_of(stores_, [](const SqliteStore* store) { return store->hasWork(); });
+}
+
+bool SqliteWriter::anyUrgent() const
+{
+    return flushing_ || closing_ ||
+        std::ranges::any_of(stores_, [](const SqliteStore* store) { return store->wantsRound(); });
+}
+
+std::chrono::steady_clock::time_point SqliteWriter::nextRetry() const
+{
+    auto next = std::chrono::steady_clock::time_point::max();
+    for (const auto* store : stores_)
+        if (auto retry = store->retryAt())
+            next = std::min(next, *retry);
+    return next;
+}
+
+void SqliteWriter::run()
+{
+    std::unique_lock lock(mutex_);
+    // While rows keep coming the writer gathers window after window on its own clock,
+    // and callers never wake it; a window that brings nothing makes it quiet, and then
+    // the next row wakes it.
+    bool active = false;
+    for (;;) {
+        if (!active && !anyWork()) {
+            if (closing_)
+                return;
+            cutBackLogs(lock);
+            waiting_ = true;
+            changed_.wait(lock, [&] { return anyWork() || closing_; });
+            waiting_ = false;
+            continue;
+        }
+        gathering_ = true;
+        auto windowEnd = std::chrono::steady_clock::now() + SqliteStore::kBatchWindow;
+        changed_.wait_until(lock, std::min(windowEnd, nextRetry()), [&] { return anyUrgent(); });
+        gathering_ = false;
+        active = writeRound(lock) || anyWork();
+    }
+}
+
+// Each store with rows, or with a failed batch whose retry is due, writes one batch.
+// False when none had any.
+bool SqliteWriter::writeRound(std::unique_lock<std::mutex>& lock)
+{
+    auto now = std::chrono::steady_clock::now();
+    std::vector<SqliteStore*> due;
+    for (auto* store : stores_)
+        if (store->takeBatch(now))
+            due.push_back(store);
+    // A flush waits on rows beyond a batch: the next round goes at once.
+    flushing_ =
+        flushing_ && std::ranges::any_of(due, [](const SqliteStore* store) { return store->queuedBeyondBatch(); });
+    if (due.empty())
+        return false;
+    inRound_ = true;
+    lock.unlock();
+    for (auto* store : due)
+        store->writeBatch();
+    lock.lock();
+    inRound_ = false;
+    for (auto* store : due)
+        store->endRound();
+    changed_.notify_all();
+    return true;
+}
+
+// A store gone quiet gives back what its log grew to in a burst.
+void SqliteWriter::cutBackLogs(std::unique_lock<std::mutex>& lock)
+{
+    inRound_ = true;
+    auto stores = stores_;
+    lock.unlock();
+    for (auto* store : stores)
+        store->cutBackLog();
+    lock.lock();
+    inRound_ = false;
+    changed_.notify_all();
+}
+
+} // namespace mx
+
+namespace mx {
+
+// On a connection of its own, opened for the one checkpoint: they are a few a second at
+// most. A store set aside meanwhile has no file to open, and a new one is not made here.
+void SqliteWriter::runCheckpoints()
+{
+    std::unique_lock lock(mutex_);
+    for (;;) {
+        checkpointsChanged_.wait(lock, [&] { return !checkpoints_.empty() || closing_; });
+        if (closing_)
+            return;
+        auto path = std::move(checkpoints_.front());
+        checkpoints_.pop_front();
+        lock.unlock();
+        sqlite3* database = nullptr;
+        if (sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr) == SQLITE_OK)
+            sqlite3_wal_checkpoint_v2(database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+        sqlite3_close(database);
+        lock.lock();
+    }
+}
+
+} // namespace mx
