@@ -7,17 +7,27 @@
 
 #include <sqlite3.h>
 
+#include "platform/UniqueFunction.h"
 #include "platform/linux/SqliteStore.h"
 
 namespace mx {
 
 namespace {
 
-// The writer yields the processor to request handling: a commit that takes the CPU a
-// client's request wakes on delays its reply by the length of the commit. Under
-// sustained load it still gets its share, and the bounded queues slow requests down
-// to the rate it commits at.
+// The writer and the checkpoints yield the processor to request handling: a commit
+// that takes the CPU a client's request wakes on delays its reply by the length of the
+// commit. Under sustained load they still get their share, and the bounded queues slow
+// requests down to the rate the writer commits at.
 constexpr int kWriterNiceness = 10;
+
+std::thread startYielding(const char* name, UniqueFunction<void()> body)
+{
+    return std::thread([name, body = std::move(body)]() mutable {
+        pthread_setname_np(pthread_self(), name);
+        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
+        body();
+    });
+}
 
 struct SharedWriter {
     std::mutex mutex;
@@ -45,17 +55,9 @@ std::shared_ptr<SqliteWriter> SqliteWriter::shared()
 }
 
 SqliteWriter::SqliteWriter()
+    : thread_(startYielding("mx-store", [this] { run(); })),
+      checkpointer_(startYielding("mx-checkpoint", [this] { runCheckpoints(); }))
 {
-    thread_ = std::thread([this] {
-        pthread_setname_np(pthread_self(), "mx-store");
-        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
-        run();
-    });
-    checkpointer_ = std::thread([this] {
-        pthread_setname_np(pthread_self(), "mx-checkpoint");
-        setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), kWriterNiceness);
-        runCheckpoints();
-    });
 }
 
 SqliteWriter::~SqliteWriter()
