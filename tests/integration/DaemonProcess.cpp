@@ -120,7 +120,14 @@ void DaemonProcess::start()
     waitForLog("listening on");
 }
 
-void DaemonProcess::signal(int signal) const { ::kill(pid_, signal); }
+void DaemonProcess::signal(int signal) const
+{
+    ::kill(pid_, signal);
+    // kill() returns before every thread has stopped: one may still take a request.
+    int status = 0;
+    if (signal == SIGSTOP)
+        waitpid(pid_, &status, WUNTRACED);
+}
 
 std::optional<int> DaemonProcess::waitForExit()
 {

@@ -29,6 +29,7 @@ public:
     // Starts the daemon and waits until it accepts connections.
     void start();
     pid_t pid() const { return pid_; }
+    // SIGSTOP returns once the daemon has stopped.
     void signal(int signal) const;
     // The exit status, or the signal as 128+N; nothing when it did not end in time.
     std::optional<int> waitForExit();
