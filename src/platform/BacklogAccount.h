@@ -63,6 +63,9 @@ public:
     BacklogDebt(const BacklogDebt&) = delete;
     BacklogDebt& operator=(const BacklogDebt&) = delete;
 
+    // Its account is past its bound: its client waits for what it owes to be done.
+    bool overdrawn() const { return account_ && account_->overdrawn(); }
+
 private:
     friend class ScopedBacklogAccount;
     BacklogDebt(std::shared_ptr<BacklogAccount> account, std::size_t weight, std::size_t bytes);

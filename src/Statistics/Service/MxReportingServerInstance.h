@@ -40,9 +40,11 @@ public:
     // nothing, answers true like any create that makes nothing, and says so in the log.
     static constexpr std::size_t kMaximumSessions = 1024;
     // What a client may owe the stores and their queues before its requests wait
-    // (BacklogAccount): a few milliseconds of the stores' work, enough to keep them
-    // busy while it is the only client.
-    static constexpr std::size_t kBacklogBound = std::size_t{2} << 20;
+    // (BacklogAccount): what it sends while its deliveries gather (20 ms) and its rows
+    // fill a batch, about 460 KiB at 10 000 reports a second, with room to spare. Each
+    // busy client may hold this much of the daemon's memory, and about twice as much
+    // again in the decoded reports it stands for.
+    static constexpr std::size_t kBacklogBound = std::size_t{1} << 20;
     // Steps of one client's requests run in a turn before the others' turns come.
     static constexpr int kStepsPerTurn = 16;
     // Sessions a message reaches in one step.

@@ -199,10 +199,15 @@ SqliteStore::~SqliteStore()
 void SqliteStore::submit(SqliteWrite write)
 {
     write.debt = BacklogDebt::incur();
+    // A client held back waits on its rows: they go now, not at the window's end.
+    bool urgent = write.debt.overdrawn();
     std::lock_guard lock(writer_->mutex());
     queue_.push_back(std::move(write));
     ++submitted_;
-    writer_->queued(queue_.size());
+    if (urgent)
+        writer_->hurry();
+    else
+        writer_->queued(queue_.size());
 }
 
 void SqliteStore::flush()
@@ -260,8 +265,16 @@ void SqliteStore::endRound()
     failures_ += std::exchange(roundFailures_, 0);
 }
 
-// One attempt at the batch at hand. Committed, its rows' debts settle here: a client
-// held back by them is resumed from this thread.
+// A batch is bounded by its own limit, so its rows need not stay on their clients'
+// accounts: what a client owes covers what waits behind the batches, and its room
+// comes back as soon as the writer takes its rows, not a commit later.
+void SqliteStore::settleTaken()
+{
+    for (auto& write : batch_)
+        write.debt = {};
+}
+
+// One attempt at the batch at hand.
 void SqliteStore::writeBatch()
 {
     auto now = std::chrono::steady_clock::now();

@@ -2,10 +2,11 @@
 // An embedded SQLite store written in batches by the process's one store writer
 // (SqliteWriter). Callers hand over rows and go on, never waiting: each row is a debt
 // on the account of the client whose request made it (BacklogAccount), settled once
-// the row is committed, and a client whose rows wait unwritten past its bound is taken
-// no further request from. So the queue is bounded by what its clients may owe,
-// nothing is ever dropped, and a slow store holds back the clients that fill it and
-// no other.
+// the writer takes the row into a batch (bounded by its own limit), and a client whose
+// rows wait past its bound is taken no further request from, and has its rows taken
+// at once rather than at the window's end. So the queue is bounded by what its
+// clients may owe, nothing is ever dropped, and a slow store holds back the clients
+// that fill it and no other.
 // WAL journaling keeps every committed batch across a crash; destruction commits
 // everything handed over before.
 // Failure policy: a batch that cannot be written (full or read-only disk, the file
@@ -171,6 +172,7 @@ private:
     bool queuedBeyondBatch() const { return !queue_.empty(); }
     void endRound();
     // Without it:
+    void settleTaken();
     void writeBatch();
     void cutBackLog();
 

@@ -162,6 +162,8 @@ bool SqliteWriter::writeRound(std::unique_lock<std::mutex>& lock)
     inRound_ = true;
     lock.unlock();
     for (auto* store : due)
+        store->settleTaken();
+    for (auto* store : due)
         store->writeBatch();
     lock.lock();
     inRound_ = false;

@@ -43,7 +43,8 @@ public:
     // writer is woken by the first row, a gathering one by the row that fills a batch;
     // the rows between wait for the window to end.
     void queued(std::size_t depth);
-    // Under the lock: a flush or a closing store wants its rows now, not at the window's end.
+    // Under the lock: a flush, a closing store or a client held back wants its rows now,
+    // not at the window's end.
     void hurry();
     // Under the lock: the store at `path` has a log past its mark.
     void checkpoint(const std::filesystem::path& path);
