@@ -23,8 +23,10 @@ namespace mx::bench {
 pid_t spawnDaemon(const std::filesystem::path& root)
 {
     std::vector<std::string> environment = {"MXREPORTING_ROOT=" + root.string()};
-    if (const char* path = std::getenv("PATH"))
-        environment.push_back(std::string("PATH=") + path);
+    // PATH, and MALLOC_CONF so the daemon's heap can be profiled under load.
+    for (const char* name : {"PATH", "MALLOC_CONF"})
+        if (const char* value = std::getenv(name))
+            environment.push_back(std::string(name) + "=" + value);
     std::vector<char*> pointers;
     pointers.reserve(environment.size() + 1);
     for (auto& entry : environment)

@@ -9,6 +9,7 @@
 // wire, and decoded only when read. The period's two stores share one arena, so a
 // report that both keep (the nested one under its identifier) is kept once.
 
+#include <deque>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -58,7 +59,7 @@ private:
 
     mutable std::recursive_mutex monitor_;
     const std::shared_ptr<MxReportingEncodedArena> arena_;
-    std::vector<Entry> entries_;
+    std::deque<Entry> entries_;
 };
 
 } // namespace mx

@@ -49,9 +49,13 @@ using namespace mx;
 #ifdef MXREPORTING_WITH_JEMALLOC
 // The allocator gives memory back to the system by itself, a few seconds after it is
 // freed: a daemon idle after a busy session would otherwise keep its peak for good.
+// Blocks of 64 KiB and more come from an arena of their own that gives them back as
+// soon as they are freed: they are few (a session's summary at its stop, the rows and
+// buffers that carry it), and kept for seconds they would not be used again, since the
+// next ones are larger or fall among the small blocks left by the period just dropped.
 extern "C" {
 // NOLINTNEXTLINE(bugprone-reserved-identifier, cppcoreguidelines-avoid-non-const-global-variables)
-const char* malloc_conf = "background_thread:true,dirty_decay_ms:5000,muzzy_decay_ms:5000";
+const char* malloc_conf = "background_thread:true,dirty_decay_ms:5000,muzzy_decay_ms:5000,oversize_threshold:65536";
 }
 #endif
 
