@@ -203,7 +203,11 @@ void SqliteWriter::runCheckpoints()
         checkpoints_.pop_front();
         lock.unlock();
         sqlite3* database = nullptr;
-        if (sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr) == SQLITE_OK)
+        // A connection learns that the file has a log only when it first reads it: a
+        // checkpoint before that finds nothing to do.
+        if (sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr) ==
+                SQLITE_OK &&
+            sqlite3_exec(database, "SELECT 1 FROM sqlite_schema LIMIT 1", nullptr, nullptr, nullptr) == SQLITE_OK)
             sqlite3_wal_checkpoint_v2(database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
         sqlite3_close(database);
         lock.lock();

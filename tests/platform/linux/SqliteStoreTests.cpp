@@ -58,7 +58,7 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
     };
     tally->sendEventLazy("com.kestrel.harmonia.DriverStats.Generic", build);
     tally->sendEventLazy("exact.name", build);
-    // Each row is owed by the client whose request made it, until it is committed.
+    // Each row is owed by the client whose request made it, until the writer takes it.
     auto account = std::make_shared<BacklogAccount>(std::size_t{1} << 20);
     const int events = 70000;
     {
@@ -164,6 +164,33 @@ TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)
     ASSERT_TRUE(backends) << "an absent file is the spool alone";
     EXPECT_TRUE(backends->spool);
     EXPECT_TRUE(errors.empty());
+}
+
+// The log is moved into the file beside the writer once it passes its mark, with no
+// further commit to set it off.
+TEST_F(SqliteStoreTest, ALogPastItsMarkIsMovedIntoTheFileBesideTheWriter)
+{
+    const std::uint64_t bound = 1 << 20;
+    std::string error;
+    auto store = SqliteStore::open(directory / "tally.db",
+                                   {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL)"},
+                                   {"INSERT INTO events(time) VALUES (?1)"}, eventsRetention({bound, {}}), error);
+    ASSERT_TRUE(store) << error;
+    auto size = [&](const std::string& suffix) {
+        return std::filesystem::file_size(directory / ("tally.db" + suffix));
+    };
+    const auto before = size("");
+    // Half of the log's share (a quarter of the bound) beside its index, in pages.
+    const std::uint64_t markPages = (bound / 4 - SqliteStore::kIndexBytes) / 2 / SqliteStore::kPageBytes;
+    const std::uint64_t frameHeaderBytes = 24;
+    while (size("-wal") < markPages * (SqliteStore::kPageBytes + frameHeaderBytes)) {
+        store->submit({0, {secondsSinceEpoch()}});
+        store->flush();
+    }
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (size("") == before && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    EXPECT_GT(size(""), before);
 }
 
 } // namespace
