@@ -296,7 +296,7 @@ void SqliteStore::writeBatch()
         batch_.clear();
         // Age is looked at now and then; size after any batch that may have taken the
         // rows past their share, so that a burst never takes the store far past its bound.
-        if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval || rowsMayExceedShare())
+        if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval || pruneUnfinished_ || rowsMayExceedShare())
             prune();
         return;
     }
@@ -445,14 +445,15 @@ void SqliteStore::prune()
     lastPrune_ = std::chrono::steady_clock::now();
     if (!connection_.database)
         return;
+    std::int64_t budget = kPruneRowsPerRound;
     std::int64_t pruned = 0;
-    std::int64_t unexported = 0;
     auto run = [&](const SqliteRetention::Step& step, std::int64_t cutoff) {
         std::int64_t removed = pruneStep(step, cutoff);
         if (removed > 0) {
             pruned += removed;
+            budget -= removed;
             if (step.unexported)
-                unexported += removed;
+                prunedUnexported_ += removed;
         }
         return removed;
     };
@@ -460,10 +461,10 @@ void SqliteStore::prune()
         auto cutoff = static_cast<std::int64_t>(secondsSinceEpoch()) - retention_.maxAge.count();
         if (anyOlderThan(cutoff))
             for (const auto& step : retention_.olderThan)
-                while (run(step, cutoff) == kAgeChunk) {}
+                while (budget > 0 && run(step, cutoff) == kAgeChunk) {}
     }
     if (retention_.maxBytes > 0)
-        while (static_cast<double>(dataBytes()) > kSizeLowWater * static_cast<double>(rowsShare())) {
+        while (budget > 0 && static_cast<double>(dataBytes()) > kSizeLowWater * static_cast<double>(rowsShare())) {
             bool removedAny = false;
             for (const auto& step : retention_.oldest)
                 if (run(step, 0) > 0) {
@@ -473,16 +474,20 @@ void SqliteStore::prune()
             if (!removedAny)
                 break;
         }
+    pruneUnfinished_ = budget <= 0;
     if (pruned == 0)
         return;
+    prunedRows_ += pruned;
     for (const auto& sql : retention_.tidy)
         sqlite3_exec(connection_.database, sql.c_str(), nullptr, nullptr, nullptr);
     // The pages the rows gave up go back to the file system, and the log that holds the
-    // deletions goes into the file at once, to be cut back when it starts again.
+    // deletions goes into the file beside the writer, to be cut back when it starts again.
     sqlite3_exec(connection_.database, "PRAGMA incremental_vacuum", nullptr, nullptr, nullptr);
-    sqlite3_wal_checkpoint_v2(connection_.database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
-    MXLOG(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(), pruned);
-    if (unexported > 0)
+    roundCheckpoint_ = true;
+    if (pruneUnfinished_)
+        return;
+    MXLOG(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(), std::exchange(prunedRows_, 0));
+    if (auto unexported = std::exchange(prunedUnexported_, 0); unexported > 0)
         MXLOG(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(), unexported);
 }
 

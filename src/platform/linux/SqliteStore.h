@@ -97,6 +97,9 @@ public:
     static constexpr std::chrono::seconds kPruneInterval{10};
     static constexpr std::int64_t kAgeChunk = 2000;
     static constexpr std::int64_t kSizeChunk = 100;
+    // A store far past its limits is pruned over several rounds, this many rows a round
+    // (a few milliseconds), so every store's rows wait at most that long for it.
+    static constexpr std::int64_t kPruneRowsPerRound = 2000;
     // What a stored row takes beyond its parameters' bytes, and how much more its pages
     // and indexes take than that, at most: the size is asked for only when what the
     // rows may take by this reckoning could pass their share.
@@ -201,6 +204,9 @@ private:
     Connection connection_;
     std::vector<std::string> texts_; // each parameter's JSON text for the row at hand
     std::chrono::steady_clock::time_point lastPrune_{};
+    bool pruneUnfinished_ = false; // the last pruning stopped at its budget
+    std::int64_t prunedRows_ = 0;  // since the pruning began, logged when it ends
+    std::int64_t prunedUnexported_ = 0;
     // What the rows took when last asked (nothing: ask at once), and what the batches
     // since bound and stepped.
     std::optional<std::uint64_t> measuredBytes_;
