@@ -10,10 +10,10 @@
 // WAL journaling keeps every committed batch across a crash; destruction commits
 // everything handed over before.
 // Failure policy: a batch that cannot be written (full or read-only disk, the file
-// removed) is held and retried with backoff until it commits, while its clients'
-// debts stay and the other stores go on; the failure is logged when it starts and
-// when it clears. A file removed while open is noticed and made anew; a corrupt file
-// found at open is set aside and a fresh store made.
+// removed) is held and retried with backoff until it commits, while the rows queued
+// behind it stay on their clients' accounts and the other stores go on; the failure
+// is logged when it starts and when it clears. A file removed while open is noticed
+// and made anew; a corrupt file found at open is set aside and a fresh store made.
 // Thread-safe: any thread may submit.
 
 #include <chrono>
