@@ -295,7 +295,8 @@ void SqliteStore::writeBatch()
         roundCheckpoint_ = logPages_ >= checkpointPages_;
         batch_.clear();
         // Age is looked at now and then; size after any batch that may have taken the
-        // rows past their share, so that a burst never takes the store far past its bound.
+        // rows past their share, so that a burst never takes the store far past its bound;
+        // and a pruning cut short at its budget goes on.
         if (std::chrono::steady_clock::now() - lastPrune_ >= kPruneInterval || pruneUnfinished_ || rowsMayExceedShare())
             prune();
         return;

@@ -186,10 +186,6 @@ void SqliteWriter::cutBackLogs(std::unique_lock<std::mutex>& lock)
     changed_.notify_all();
 }
 
-} // namespace mx
-
-namespace mx {
-
 // On a connection of its own, opened for the one checkpoint: they are a few a second at
 // most. A store set aside meanwhile has no file to open, and a new one is not made here.
 void SqliteWriter::runCheckpoints()

@@ -63,7 +63,7 @@ private:
     std::vector<SqliteStore*> stores_;
     bool waiting_ = false;   // quiet, for a first row
     bool gathering_ = false; // for the window to end or a batch to fill
-    bool flushing_ = false;  // a flush or a close waits: the batches at hand go now
+    bool flushing_ = false;  // hurried (a flush, a close, a client held back): the batches at hand go now
     bool inRound_ = false;   // working on stores without the lock
     bool closing_ = false;
     std::deque<std::filesystem::path> checkpoints_;
