@@ -15,6 +15,7 @@
 #include <filesystem>
 #include <memory>
 #include <mutex>
+#include <sys/types.h>
 #include <thread>
 #include <vector>
 
@@ -44,7 +45,7 @@ public:
     // the rows between wait for the window to end.
     void queued(std::size_t depth);
     // Under the lock: a flush, a closing store or a client held back wants its rows now,
-    // not at the window's end.
+    // not at the window's end, and the writer comes out of the background until none does.
     void hurry();
     // Under the lock: the store at `path` has a log past its mark.
     void checkpoint(const std::filesystem::path& path);
@@ -56,6 +57,7 @@ private:
     std::chrono::steady_clock::time_point nextRetry() const;
     bool writeRound(std::unique_lock<std::mutex>& lock);
     void cutBackLogs(std::unique_lock<std::mutex>& lock);
+    void comeForward(bool forward);
     void runCheckpoints();
 
     std::mutex mutex_;
@@ -66,6 +68,9 @@ private:
     bool flushing_ = false;  // hurried (a flush, a close, a client held back): the batches at hand go now
     bool inRound_ = false;   // working on stores without the lock
     bool closing_ = false;
+    pid_t writerThread_ = 0;
+    bool forward_ = false;        // at nice 10 rather than in the background
+    bool forwardRefused_ = false; // not permitted to come forward
     std::deque<std::filesystem::path> checkpoints_;
     std::condition_variable checkpointsChanged_;
     std::thread thread_;
