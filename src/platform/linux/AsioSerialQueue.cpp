@@ -1,7 +1,10 @@
 #include "platform/linux/AsioSerialQueue.h"
 
+#include <asio/dispatch.hpp>
 #include <asio/post.hpp>
 #include <asio/steady_timer.hpp>
+
+#include "platform/linux/AsioHandOver.h"
 
 namespace mx {
 
@@ -14,9 +17,24 @@ AsioSerialQueue::AsioSerialQueue(std::string label, const asio::io_context::exec
 void AsioSerialQueue::dispatch(UniqueFunction<void()> work)
 {
     work_.begin();
-    asio::post(strand_, [&outstanding = work_, work = std::move(work)]() mutable {
-        work();
+    auto job = [&outstanding = work_, owner = static_cast<const void*>(this), work = std::move(work)]() mutable {
+        {
+            AsioHandOver handOver(owner);
+            work();
+        }
         outstanding.end();
+    };
+    auto* handOver = AsioHandOver::current();
+    if (handOver == nullptr || handOver->isFor(this)) {
+        asio::post(strand_, std::move(job));
+        return;
+    }
+    handOver->add([strand = strand_, job = std::move(job)]() mutable {
+        // A queue whose work is further up this thread's stack keeps its order too.
+        if (strand.running_in_this_thread())
+            asio::post(strand, std::move(job));
+        else
+            asio::dispatch(strand, std::move(job));
     });
 }
 

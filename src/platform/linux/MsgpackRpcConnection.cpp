@@ -6,11 +6,13 @@
 #include <sys/socket.h>
 
 #include <asio/buffer.hpp>
+#include <asio/dispatch.hpp>
 #include <asio/post.hpp>
 #include <asio/write.hpp>
 #include <fmt/format.h>
 
 #include "platform/MxLog.h"
+#include "platform/linux/AsioHandOver.h"
 #include "wire/MsgpackRpcMessage.h"
 
 namespace mx {
@@ -81,6 +83,9 @@ private:
 MsgpackRpcConnection::MsgpackRpcConnection(asio::local::stream_protocol::socket socket, std::uint64_t number)
     : socket_(std::move(socket)), number_(number)
 {
+    // Writes are tried at once and must not wait for room (see writeMore).
+    std::error_code ignored;
+    socket_.non_blocking(true, ignored);
     ucred credentials{};
     socklen_t length = sizeof(credentials);
     if (getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) == 0) {
@@ -143,6 +148,7 @@ void MsgpackRpcConnection::readMore()
                                     self->close({});
                                     return;
                                 }
+                                AsioHandOver handOver(self.get());
                                 self->handleRead(bytes);
                             });
 }
@@ -257,15 +263,27 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
 {
     if (closed_)
         return;
-    // Encoded on the replying thread, so the strand only writes.
-    std::lock_guard lock(repliesMutex_);
-    if (!replies_)
-        replies_ = std::make_shared<msgpack::sbuffer>(kReplyBufferBytes);
-    encodeRpcResponse(*replies_, msgid, error, result);
-    if (flushScheduled_)
+    {
+        // Encoded on the replying thread, so the strand only writes.
+        std::lock_guard lock(repliesMutex_);
+        if (!replies_)
+            replies_ = std::make_shared<msgpack::sbuffer>(kReplyBufferBytes);
+        encodeRpcResponse(*replies_, msgid, error, result);
+        if (std::exchange(flushScheduled_, true))
+            return;
+    }
+    // A handler's replies go together when it returns: a turn's steps, one write.
+    auto flush = [self = shared_from_this()] {
+        self->flushReplies();
+    };
+    auto* handOver = AsioHandOver::current();
+    if (handOver == nullptr || handOver->isFor(this)) {
+        asio::post(socket_.get_executor(), std::move(flush));
         return;
-    flushScheduled_ = true;
-    asio::post(socket_.get_executor(), [self = shared_from_this()] { self->flushReplies(); });
+    }
+    handOver->add([executor = socket_.get_executor(), flush = std::move(flush)]() mutable {
+        asio::dispatch(executor, std::move(flush));
+    });
 }
 
 void MsgpackRpcConnection::flushReplies()
@@ -299,32 +317,60 @@ void MsgpackRpcConnection::enqueue(std::shared_ptr<msgpack::sbuffer> bytes)
     writeMore();
 }
 
+// Everything queued goes out in one gathered write, at once when the socket takes it
+// (the usual case: no pass through the event loop), and what it does not take goes in
+// the background.
 void MsgpackRpcConnection::writeMore()
 {
     if (writing_ || closed_ || outbox_.empty())
         return;
+    std::error_code refused;
+    std::size_t taken = socket_.write_some(unsent(), refused);
+    if (refused && refused != asio::error::would_block) {
+        close({});
+        return;
+    }
+    drop(taken);
+    if (outbox_.empty()) {
+        resumeIfPaused();
+        return;
+    }
     writing_ = true;
-    // Everything queued goes out in one gathered write.
-    std::vector<asio::const_buffer> buffers;
-    buffers.reserve(outbox_.size());
-    for (const auto& bytes : outbox_)
-        buffers.emplace_back(bytes->data(), bytes->size());
     writingBuffers_ = outbox_.size();
-    asio::async_write(socket_, buffers, [self = shared_from_this()](const std::error_code& error, std::size_t) {
+    asio::async_write(socket_, unsent(), [self = shared_from_this()](const std::error_code& error, std::size_t sent) {
         self->writing_ = false;
+        self->writingBuffers_ = 0;
         if (self->closed_)
             return;
         if (error) {
             self->close({});
             return;
         }
-        for (; self->writingBuffers_ > 0; --self->writingBuffers_) {
-            self->outboxBytes_ -= self->outbox_.front()->size();
-            self->outbox_.pop_front();
-        }
+        self->drop(sent);
         self->writeMore();
         self->resumeIfPaused();
     });
+}
+
+std::vector<asio::const_buffer> MsgpackRpcConnection::unsent() const
+{
+    std::vector<asio::const_buffer> buffers;
+    buffers.reserve(outbox_.size());
+    for (const auto& bytes : outbox_)
+        buffers.emplace_back(bytes->data(), bytes->size());
+    buffers.front() += sentOfFront_;
+    return buffers;
+}
+
+void MsgpackRpcConnection::drop(std::size_t sent)
+{
+    outboxBytes_ -= sent;
+    sent += sentOfFront_;
+    while (!outbox_.empty() && sent >= outbox_.front()->size()) {
+        sent -= outbox_.front()->size();
+        outbox_.pop_front();
+    }
+    sentOfFront_ = sent;
 }
 
 void MsgpackRpcConnection::close(const std::string& reason)

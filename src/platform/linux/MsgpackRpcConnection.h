@@ -14,6 +14,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include <asio/io_context.hpp>
 #include <asio/local/stream_protocol.hpp>
@@ -70,6 +71,8 @@ private:
     void flushReplies();
     void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
     void writeMore();
+    std::vector<asio::const_buffer> unsent() const;
+    void drop(std::size_t sent);
     void close(const std::string& reason);
 
     asio::local::stream_protocol::socket socket_;
@@ -85,6 +88,7 @@ private:
     std::deque<std::shared_ptr<msgpack::sbuffer>> outbox_;
     std::size_t outboxBytes_ = 0;
     std::size_t writingBuffers_ = 0; // the front of the outbox that a write in progress covers
+    std::size_t sentOfFront_ = 0;    // of the outbox's first buffer, written already
     bool reading_ = false;
     bool writing_ = false;
     bool resumed_ = false;

@@ -3,6 +3,7 @@
 #include <condition_variable>
 #include <future>
 #include <mutex>
+#include <string>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -36,6 +37,31 @@ TEST(AsioDispatchTest, SerialQueueRunsInSubmissionOrderOneAtATime)
     for (int i = 0; i < 1000; ++i)
         EXPECT_EQ(order[i], i);
     EXPECT_FALSE(queue->isCurrent());
+}
+
+// A job's hand-over to another queue runs once the job has returned (at once, if that
+// queue is idle); what it gives its own queue waits behind what was there already.
+TEST(AsioDispatchTest, WorkAJobGivesRunsAfterItAndItsOwnQueueKeepsItsOrder)
+{
+    AsioDispatch dispatch(1);
+    auto server = dispatch.makeSerialQueue("test.server", QueuePriority::UserInteractive);
+    auto connection = dispatch.makeSerialQueue("test.connection", QueuePriority::UserInteractive);
+    std::vector<std::string> order;
+    std::promise<void> queuedBefore;
+    std::promise<void> done;
+    server->dispatch([&] {
+        queuedBefore.get_future().wait();
+        connection->dispatch([&] { order.emplace_back("handed over"); });
+        server->dispatch([&] {
+            order.emplace_back("own, given");
+            done.set_value();
+        });
+        order.emplace_back("giver returns");
+    });
+    server->dispatch([&] { order.emplace_back("own, queued before"); });
+    queuedBefore.set_value();
+    ASSERT_EQ(done.get_future().wait_for(kBound), std::future_status::ready);
+    EXPECT_EQ(order, (std::vector<std::string>{"giver returns", "handed over", "own, queued before", "own, given"}));
 }
 
 TEST(AsioDispatchTest, QueuesBlockedInAWaitDoNotHoldUpOtherQueues)

@@ -1,0 +1,27 @@
+#include "platform/linux/AsioHandOver.h"
+
+namespace mx {
+
+namespace {
+
+thread_local AsioHandOver* innermost = nullptr;
+
+} // namespace
+
+AsioHandOver::AsioHandOver(const void* owner) : outer_(innermost), owner_(owner) { innermost = this; }
+
+AsioHandOver::~AsioHandOver()
+{
+    // By index: a hand-over that runs its work inline may add more.
+    for (std::size_t next = 0; next < handOvers_.size(); ++next) {
+        auto handOver = std::move(handOvers_[next]);
+        handOver();
+    }
+    innermost = outer_;
+}
+
+AsioHandOver* AsioHandOver::current() { return innermost; }
+
+void AsioHandOver::add(UniqueFunction<void()> handOver) { handOvers_.push_back(std::move(handOver)); }
+
+} // namespace mx
