@@ -2,10 +2,10 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstring>
 #include <pthread.h>
 #include <sched.h>
 #include <sys/resource.h>
+#include <system_error>
 #include <unistd.h>
 
 #include <sqlite3.h>
@@ -122,7 +122,7 @@ void SqliteWriter::comeForward(bool forward)
     forwardRefused_ = true;
     MXLOG(nullptr, Default,
           "the store writer cannot come forward when clients wait on it ({}): it stays in the background",
-          std::strerror(errno));
+          std::generic_category().message(errno));
 }
 
 void SqliteWriter::checkpoint(const std::filesystem::path& path)
