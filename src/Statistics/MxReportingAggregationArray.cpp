@@ -28,7 +28,66 @@ MxReportingEncodedArena::Range storeScratch(MxReportingEncodedArena& arena, msgp
     return stored;
 }
 
+void appendNumber(std::uint32_t number, std::uint8_t*& out)
+{
+    for (; number >= 0x80; number >>= 7)
+        *out++ = static_cast<std::uint8_t>(number | 0x80);
+    *out++ = static_cast<std::uint8_t>(number);
+}
+
+std::uint32_t readNumber(const std::deque<std::uint8_t>& bytes, std::size_t& position)
+{
+    std::uint32_t number = 0;
+    for (int shift = 0;; shift += 7) {
+        std::uint8_t byte = bytes[position++];
+        number |= std::uint32_t(byte & 0x7f) << shift;
+        if ((byte & 0x80) == 0)
+            return number;
+    }
+}
+
 } // namespace
+
+// The body's chunk carries, in its lowest bit, whether a lead comes first.
+std::size_t MxReportingAggregationArray::encode(const Entry& entry, EncodedBytes& bytes)
+{
+    std::uint8_t* out = bytes.data();
+    bool led = entry.lead.size != 0;
+    appendNumber(entry.body.chunk << 1 | std::uint32_t(led), out);
+    appendNumber(entry.body.offset, out);
+    appendNumber(entry.body.size, out);
+    if (led) {
+        appendNumber(entry.lead.chunk, out);
+        appendNumber(entry.lead.offset, out);
+        appendNumber(entry.lead.size, out);
+    }
+    return static_cast<std::size_t>(out - bytes.data());
+}
+
+MxReportingAggregationArray::Entry MxReportingAggregationArray::decode(std::size_t& position) const
+{
+    Entry entry;
+    std::uint32_t chunk = readNumber(entries_, position);
+    entry.body = {chunk >> 1, readNumber(entries_, position), readNumber(entries_, position)};
+    if ((chunk & 1) != 0)
+        entry.lead = {readNumber(entries_, position), readNumber(entries_, position), readNumber(entries_, position)};
+    return entry;
+}
+
+void MxReportingAggregationArray::add(std::size_t index, const Entry& entry)
+{
+    EncodedBytes bytes;
+    std::size_t length = encode(entry, bytes);
+    std::size_t position = entries_.size();
+    if (index < count_) {
+        position = 0;
+        for (std::size_t skipped = 0; skipped < index; ++skipped)
+            decode(position);
+    }
+    entries_.insert(entries_.begin() + static_cast<std::ptrdiff_t>(position), bytes.begin(),
+                    bytes.begin() + static_cast<std::ptrdiff_t>(length));
+    ++count_;
+}
 
 MxReportingAggregationArray::MxReportingAggregationArray(std::shared_ptr<MxReportingEncodedArena> arena)
     : arena_(std::move(arena))
@@ -48,11 +107,10 @@ void MxReportingAggregationArray::append(const Value& value) { appendStored(stor
 
 void MxReportingAggregationArray::insert(std::size_t index, const Value& value)
 {
-    Entry entry{{}, store(*arena_, value)};
-    entries_.insert(entries_.begin() + static_cast<std::ptrdiff_t>(std::min(index, entries_.size())), entry);
+    add(index, {{}, store(*arena_, value)});
 }
 
-void MxReportingAggregationArray::appendStored(Range stored) { entries_.push_back({{}, stored}); }
+void MxReportingAggregationArray::appendStored(Range stored) { add(count_, {{}, stored}); }
 
 void MxReportingAggregationArray::appendStoredUnder(const std::string& key, Range stored)
 {
@@ -60,13 +118,14 @@ void MxReportingAggregationArray::appendStoredUnder(const std::string& key, Rang
     msgpack::packer<msgpack::sbuffer> packer(buffer);
     packer.pack_map(1);
     packer.pack(key);
-    entries_.push_back({storeScratch(*arena_, buffer), stored});
+    add(count_, {storeScratch(*arena_, buffer), stored});
 }
 
 void MxReportingAggregationArray::forEach(const std::function<void(const Value&)>& visit) const
 {
     std::string bytes;
-    for (const auto& entry : entries_) {
+    for (std::size_t position = 0; position < entries_.size();) {
+        Entry entry = decode(position);
         bytes.clear();
         arena_->read({entry.lead, entry.body}, [&](std::string_view part) { bytes += part; });
         auto handle = msgpack::unpack(bytes.data(), bytes.size());
@@ -80,7 +139,7 @@ void MxReportingAggregationArray::forEach(const std::function<void(const Value&)
 std::vector<Value> MxReportingAggregationArray::items() const
 {
     std::vector<Value> values;
-    values.reserve(entries_.size());
+    values.reserve(count_);
     forEach([&](const Value& value) { values.push_back(value); });
     return values;
 }

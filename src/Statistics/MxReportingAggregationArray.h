@@ -9,6 +9,8 @@
 // wire, and decoded only when read. The period's two stores share one arena, so a
 // report that both keep (the nested one under its identifier) is kept once.
 
+#include <array>
+#include <cstdint>
 #include <deque>
 #include <functional>
 #include <memory>
@@ -40,8 +42,8 @@ public:
     // An entry already in this array's arena, as it is or as {key: entry}.
     void appendStored(Range stored);
     void appendStoredUnder(const std::string& key, Range stored);
-    std::size_t size() const { return entries_.size(); }
-    bool empty() const { return entries_.empty(); }
+    std::size_t size() const { return count_; }
+    bool empty() const { return count_ == 0; }
     // Each entry decoded in turn, in order: one at a time, however many there are.
     void forEach(const std::function<void(const Value&)>& visit) const;
     // The entries decoded, in order.
@@ -57,9 +59,19 @@ private:
         Range body;
     };
 
+    // Six numbers of at most five bytes each.
+    using EncodedBytes = std::array<std::uint8_t, 30>;
+    static std::size_t encode(const Entry& entry, EncodedBytes& bytes);
+    // The entry whose bytes begin at `position`, which moves past them.
+    Entry decode(std::size_t& position) const;
+    void add(std::size_t index, const Entry& entry);
+
     mutable std::recursive_mutex monitor_;
     const std::shared_ptr<MxReportingEncodedArena> arena_;
-    std::deque<Entry> entries_;
+    // The entries' ranges as variable-length integers, back to back: a few bytes an
+    // entry rather than 24, and a busy period keeps hundreds of thousands of them.
+    std::deque<std::uint8_t> entries_;
+    std::size_t count_ = 0;
 };
 
 } // namespace mx
