@@ -5,9 +5,11 @@
 // store's rows in turn, with SQLite's code still warm from the store before.
 // A store that cannot write holds its batch and is retried on its own schedule while
 // the others go on. A second thread checkpoints the stores' logs into their files: a
-// checkpoint waits on the disk, and no store's rows wait with it. Stores attach while
-// they are open and the threads run while any is; one lock guards every attached
-// store's queue.
+// checkpoint waits on the disk, and no store's rows wait with it. Both threads run in
+// the background (SCHED_IDLE), so request handling takes the processor from them at
+// once; the writer comes forward while clients wait on it. Stores attach while they
+// are open and the threads run while any is; one lock guards every attached store's
+// queue.
 
 #include <chrono>
 #include <condition_variable>
@@ -68,7 +70,7 @@ private:
     bool flushing_ = false;  // hurried (a flush, a close, a client held back): the batches at hand go now
     bool inRound_ = false;   // working on stores without the lock
     bool closing_ = false;
-    pid_t writerThread_ = 0;
+    pid_t writerThread_ = 0;      // the writer's thread, to move it
     bool forward_ = false;        // at nice 10 rather than in the background
     bool forwardRefused_ = false; // not permitted to come forward
     std::deque<std::filesystem::path> checkpoints_;
