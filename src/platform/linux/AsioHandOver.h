@@ -6,7 +6,10 @@
 // everyday rates cost more than the hop's work. Handing over at the handler's end keeps
 // what a strand promises: the strand's work runs one at a time, in the order given, and
 // never inside the code that gave it (no lock of the giver is held then). What a handler
-// gives its own strand is posted, behind the work already waiting there.
+// gives its own strand is posted, behind the work already waiting there. Work run this
+// way runs inside the giver's strand: work that waits (a declared blocking wait) would
+// hold that strand meanwhile. Only the queues of one pool hand over in place, and the
+// waits are all on the utility pool's session queues, which give each other nothing.
 // One per running handler, on its thread; nested handlers nest.
 
 #include <vector>
