@@ -20,7 +20,10 @@ AsioHandOver::~AsioHandOver()
     innermost = outer_;
 }
 
-AsioHandOver* AsioHandOver::current() { return innermost; }
+AsioHandOver* AsioHandOver::takingFrom(const void* giver)
+{
+    return innermost != nullptr && innermost->owner_ != giver ? innermost : nullptr;
+}
 
 void AsioHandOver::add(UniqueFunction<void()> handOver) { handOvers_.push_back(std::move(handOver)); }
 

@@ -28,9 +28,9 @@ public:
     AsioHandOver(const AsioHandOver&) = delete;
     AsioHandOver& operator=(const AsioHandOver&) = delete;
 
-    // The hand-over of the innermost handler running on this thread, if any.
-    static AsioHandOver* current();
-    bool isFor(const void* owner) const { return owner == owner_; }
+    // The hand-over of the innermost handler running on this thread, for what `giver`
+    // gives: none when no handler is open or it is the giver's own (which posts).
+    static AsioHandOver* takingFrom(const void* giver);
     // `handOver` dispatches the work to its strand.
     void add(UniqueFunction<void()> handOver);
 

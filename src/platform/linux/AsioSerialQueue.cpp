@@ -24,8 +24,8 @@ void AsioSerialQueue::dispatch(UniqueFunction<void()> work)
         }
         outstanding.end();
     };
-    auto* handOver = AsioHandOver::current();
-    if (handOver == nullptr || handOver->isFor(this)) {
+    auto* handOver = AsioHandOver::takingFrom(this);
+    if (handOver == nullptr) {
         asio::post(strand_, std::move(job));
         return;
     }

@@ -276,8 +276,8 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
     auto flush = [self = shared_from_this()] {
         self->flushReplies();
     };
-    auto* handOver = AsioHandOver::current();
-    if (handOver == nullptr || handOver->isFor(this)) {
+    auto* handOver = AsioHandOver::takingFrom(this);
+    if (handOver == nullptr) {
         asio::post(socket_.get_executor(), std::move(flush));
         return;
     }
