@@ -20,9 +20,11 @@ AsioHandOver::~AsioHandOver()
     innermost = outer_;
 }
 
-AsioHandOver* AsioHandOver::takingFrom(const void* giver)
+AsioHandOver* AsioHandOver::takingFrom(const void* giver, asio::io_context& target)
 {
-    return innermost != nullptr && innermost->owner_ != giver ? innermost : nullptr;
+    if (innermost == nullptr || innermost->owner_ == giver || !target.get_executor().running_in_this_thread())
+        return nullptr;
+    return innermost;
 }
 
 void AsioHandOver::add(UniqueFunction<void()> handOver) { handOvers_.push_back(std::move(handOver)); }

@@ -14,6 +14,8 @@
 
 #include <vector>
 
+#include <asio/io_context.hpp>
+
 #include "platform/UniqueFunction.h"
 
 namespace mx {
@@ -29,8 +31,10 @@ public:
     AsioHandOver& operator=(const AsioHandOver&) = delete;
 
     // The hand-over of the innermost handler running on this thread, for what `giver`
-    // gives: none when no handler is open or it is the giver's own (which posts).
-    static AsioHandOver* takingFrom(const void* giver);
+    // gives to a strand of `target`: none when no handler is open, when it is the giver's
+    // own, or when this thread does not run `target` (the work could not run in place,
+    // and held back it could fall behind work given later, a timer's). Then it posts.
+    static AsioHandOver* takingFrom(const void* giver, asio::io_context& target);
     // `handOver` dispatches the work to its strand.
     void add(UniqueFunction<void()> handOver);
 

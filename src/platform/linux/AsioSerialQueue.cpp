@@ -24,7 +24,7 @@ void AsioSerialQueue::dispatch(UniqueFunction<void()> work)
         }
         outstanding.end();
     };
-    auto* handOver = AsioHandOver::takingFrom(this);
+    auto* handOver = AsioHandOver::takingFrom(this, strand_.get_inner_executor().context());
     if (handOver == nullptr) {
         asio::post(strand_, std::move(job));
         return;

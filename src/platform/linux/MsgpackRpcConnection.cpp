@@ -276,7 +276,7 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
     auto flush = [self = shared_from_this()] {
         self->flushReplies();
     };
-    auto* handOver = AsioHandOver::takingFrom(this);
+    auto* handOver = AsioHandOver::takingFrom(this, static_cast<asio::io_context&>(socket_.get_executor().context()));
     if (handOver == nullptr) {
         asio::post(socket_.get_executor(), std::move(flush));
         return;
