@@ -6,28 +6,16 @@
 
 namespace mx {
 
-namespace {
-
-// What follows the first byte of a header before its payload, and what that is.
-enum class Kind { Scalar, Payload, Array, Map };
-
-struct Layout {
-    Kind kind = Kind::Scalar;
-    std::size_t lengthBytes = 0; // big-endian length or count after the first byte
-    std::size_t fixedBytes = 0;  // further header bytes (an extension's type), or a scalar's value
-    std::uint64_t fixedLength = 0;
-};
-
-Layout layoutOf(std::uint8_t first)
+MsgpackSizeGuard::Layout MsgpackSizeGuard::layoutOf(std::uint8_t first)
 {
     if (first <= 0x7f || first >= 0xe0)
         return {};
     if (first <= 0x8f)
-        return {Kind::Map, 0, 0, first & 0x0fu};
+        return {Kind::Map, 0, 0, static_cast<std::uint8_t>(first & 0x0fu)};
     if (first <= 0x9f)
-        return {Kind::Array, 0, 0, first & 0x0fu};
+        return {Kind::Array, 0, 0, static_cast<std::uint8_t>(first & 0x0fu)};
     if (first <= 0xbf)
-        return {Kind::Payload, 0, 0, first & 0x1fu};
+        return {Kind::Payload, 0, 0, static_cast<std::uint8_t>(first & 0x1fu)};
     switch (first) {
     case 0xc4:
         return {Kind::Payload, 1};
@@ -86,8 +74,6 @@ Layout layoutOf(std::uint8_t first)
     }
 }
 
-} // namespace
-
 MsgpackSizeGuard::MsgpackSizeGuard(std::size_t maximumMessageBytes, std::size_t maximumDepth)
     : maximumMessageBytes_(maximumMessageBytes), maximumDepth_(maximumDepth)
 {
@@ -127,20 +113,18 @@ bool MsgpackSizeGuard::check(std::span<const char> bytes, std::string& reason)
 
 bool MsgpackSizeGuard::startElement(std::uint8_t first, std::string& reason)
 {
-    first_ = first;
-    Layout layout = layoutOf(first);
+    layout_ = layoutOf(first);
     headerHave_ = 0;
-    headerNeed_ = layout.lengthBytes + layout.fixedBytes;
+    headerNeed_ = std::size_t{layout_.lengthBytes} + layout_.fixedBytes;
     return headerNeed_ > 0 || finishHeader(reason);
 }
 
 std::uint64_t MsgpackSizeGuard::headerValue() const
 {
-    Layout layout = layoutOf(first_);
-    if (layout.lengthBytes == 0)
-        return layout.fixedLength;
+    if (layout_.lengthBytes == 0)
+        return layout_.fixedLength;
     std::uint64_t value = 0;
-    for (std::size_t i = 0; i < layout.lengthBytes; ++i)
+    for (std::size_t i = 0; i < layout_.lengthBytes; ++i)
         value = (value << 8) | header_[i];
     return value;
 }
@@ -148,7 +132,7 @@ std::uint64_t MsgpackSizeGuard::headerValue() const
 bool MsgpackSizeGuard::finishHeader(std::string& reason)
 {
     headerNeed_ = 0;
-    switch (layoutOf(first_).kind) {
+    switch (layout_.kind) {
     case Kind::Scalar:
         elementDone();
         return true;

@@ -22,6 +22,16 @@ public:
     bool check(std::span<const char> bytes, std::string& reason);
 
 private:
+    // What follows the first byte of a header before its payload, and what that is.
+    enum class Kind : std::uint8_t { Scalar, Payload, Array, Map };
+    struct Layout {
+        Kind kind = Kind::Scalar;
+        std::uint8_t lengthBytes = 0; // big-endian length or count after the first byte
+        std::uint8_t fixedBytes = 0;  // further header bytes (an extension's type), or a scalar's value
+        std::uint8_t fixedLength = 0;
+    };
+    static Layout layoutOf(std::uint8_t first);
+
     bool startElement(std::uint8_t first, std::string& reason);
     bool finishHeader(std::string& reason);
     bool expectPayload(std::uint64_t length, std::string& reason);
@@ -35,7 +45,7 @@ private:
     // Elements still to come in each open container, outermost first.
     std::vector<std::uint64_t> remaining_;
     // A header whose length or count bytes are still arriving.
-    std::uint8_t first_ = 0;
+    Layout layout_;
     std::uint8_t header_[8] = {};
     std::size_t headerHave_ = 0;
     std::size_t headerNeed_ = 0;
