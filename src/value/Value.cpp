@@ -160,6 +160,12 @@ void Dictionary::set(std::string key, Value value)
         storage.index.emplace(storage.entries.back().first, storage.entries.size() - 1);
 }
 
+void Dictionary::reserve(std::size_t entries)
+{
+    if (entries > size())
+        mutableStorage().entries.reserve(entries);
+}
+
 void Dictionary::erase(std::string_view key)
 {
     if (!find(key))

@@ -64,6 +64,8 @@ public:
     // Replaces the value of an existing key in place (its position is kept), else
     // appends the entry.
     void set(std::string key, Value value);
+    // Room for `entries` in all, so that a dictionary built key by key moves none.
+    void reserve(std::size_t entries);
     void erase(std::string_view key);
     // Copies every entry of `other` into this one, later entries replacing earlier.
     void merge(const Dictionary& other);

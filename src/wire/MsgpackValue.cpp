@@ -97,6 +97,7 @@ std::optional<Value> decode(const msgpack::object& object, std::size_t depth, st
     }
     case msgpack::type::MAP: {
         Dictionary dictionary;
+        dictionary.reserve(object.via.map.size);
         for (std::uint32_t i = 0; i < object.via.map.size; ++i) {
             const auto& entry = object.via.map.ptr[i];
             if (entry.key.type != msgpack::type::STR) {

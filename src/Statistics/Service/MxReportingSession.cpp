@@ -36,6 +36,7 @@ Dictionary MxReportingCleanKeys(const Dictionary& message)
     if (!hasSpacedKey(message))
         return message;
     Dictionary cleaned;
+    cleaned.reserve(message.size());
     for (const auto& [key, value] : message) {
         std::string cleanedKey = key;
         for (char& c : cleanedKey)
@@ -152,10 +153,13 @@ void MxReportingSession::completeTransaction()
 
 std::string MxReportingSession::messageIdForCategory(MessageCategory category, MessageType type)
 {
-    std::string base = fmt::format("{}_{}", MxReportingCategoryName(category), MxReportingMessageTypeName(type));
-    auto& count = messageTypeCounts_[base];
-    ++count;
-    return fmt::format("{}_{}", base, count);
+    std::string identifier = MxReportingCategoryName(category);
+    identifier += '_';
+    identifier += MxReportingMessageTypeName(type);
+    auto count = ++messageTypeCounts_[identifier];
+    identifier += '_';
+    identifier += std::to_string(count);
+    return identifier;
 }
 
 void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory category, MessageType type,
