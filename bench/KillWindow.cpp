@@ -122,6 +122,11 @@ KillWindowFigures measureKillWindow(const std::filesystem::path& root, double ra
         ::close(fd);
 
         std::size_t acknowledged = round.acknowledged.load();
+        // What the next start writes in from the rows it finds pending counts as kept.
+        pid_t restarted = spawnDaemon(root);
+        if (!waitForSocket(daemonSocket(root)))
+            throw std::runtime_error("kill window: the daemon did not come up again");
+        endProcess(restarted, SIGTERM);
         std::string bySeq = fmt::format("json_extract(payload, '$.seq') BETWEEN {} AND {}", base,
                                         base + static_cast<int>(kMostReports) - 1);
         auto stores = root / "var/lib/harmonia";

@@ -13,7 +13,8 @@
 //   mxreporting_load --idle S
 //     What the daemon costs with no client: wake-ups and CPU a second.
 //   mxreporting_load --kill-window R [--rounds N]
-//     Acknowledged reports a SIGKILL takes with it at R reports a second (5 rounds).
+//     Acknowledged reports a SIGKILL takes with it at R reports a second, counted once
+//     the next start has written in what it found pending (5 rounds).
 //   mxreporting_load --beside-a-flood [--in-flight K] [--seconds S]
 //     One client's round trips while another floods.
 //

@@ -40,8 +40,8 @@ public:
     // nothing, answers true like any create that makes nothing, and says so in the log.
     static constexpr std::size_t kMaximumSessions = 1024;
     // What a client may owe the stores and their queues before its requests wait
-    // (BacklogAccount): what it sends while its deliveries gather (20 ms) and its rows
-    // fill a batch, about 460 KiB at 10 000 reports a second, with room to spare. Each
+    // (BacklogAccount): what it sends while its deliveries gather (40 ms) and its rows
+    // fill a batch, about 560 KiB at 10 000 reports a second, with room to spare. Each
     // busy client may hold this much of the daemon's memory, and about twice as much
     // again in the decoded reports it stands for.
     static constexpr std::size_t kBacklogBound = std::size_t{1} << 20;

@@ -55,9 +55,11 @@ public:
         BacklogDebt debt;
     };
 
-    // How long a run of deliveries gathers after the first of it is held. Short beside
-    // the stores' own gathering: together they stay within what a SIGKILL may take.
-    static constexpr std::chrono::milliseconds kDeliveryGathering{20};
+    // How long a run of deliveries gathers after the first of it is held: what a SIGKILL
+    // may take of them, for the store keeps what it is handed (SqliteStore). Beside the
+    // store's short window, for a row it found no room to keep, the two stay within
+    // what a SIGKILL may take.
+    static constexpr std::chrono::milliseconds kDeliveryGathering{40};
 
     explicit MxReportingSessionUplink(ReporterID reporterID);
     MxReportingSessionUplink(const MxReportingSessionUplink&) = delete;

@@ -28,6 +28,23 @@ std::string errnoText(int error) { return std::generic_category().message(error)
 
 bool isCorruption(int code) { return code == SQLITE_CORRUPT || code == SQLITE_NOTADB; }
 
+// Every store says up to which of its pending rows it has committed, in the
+// transaction that commits them.
+constexpr const char* kPendingTable =
+    "CREATE TABLE IF NOT EXISTS pending_committed(id INTEGER PRIMARY KEY CHECK (id = 1), sequence INTEGER NOT NULL)";
+
+// The first column of the first row as an integer, 0 when there is none.
+std::int64_t firstInteger(sqlite3* database, const std::string& sql)
+{
+    sqlite3_stmt* statement = nullptr;
+    std::int64_t result = 0;
+    if (sqlite3_prepare_v2(database, sql.c_str(), -1, &statement, nullptr) == SQLITE_OK &&
+        sqlite3_step(statement) == SQLITE_ROW)
+        result = sqlite3_column_int64(statement, 0);
+    sqlite3_finalize(statement);
+    return result;
+}
+
 // "tally.db" -> "tally.db.corrupt-20261123T041500", with its journal files beside it.
 std::filesystem::path setAside(const std::filesystem::path& path)
 {
@@ -91,7 +108,42 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
         if (!connect(path, schema, statements, connection, error, code))
             return nullptr;
     }
-    return std::unique_ptr<SqliteStore>(new SqliteStore(path, schema, statements, std::move(retention), connection));
+    std::unique_ptr<SqliteStore> store(new SqliteStore(path, schema, statements, std::move(retention), connection));
+    if (!store->replayPending(error))
+        return nullptr;
+    std::lock_guard lock(store->writer_->mutex());
+    store->writer_->attach(*store);
+    return store;
+}
+
+// Rows answered but not committed when the process last ended are written before any
+// other. Should they not go in, the store does not open: they stay kept for the next try.
+bool SqliteStore::replayPending(std::string& error)
+{
+    auto path = path_.native() + "-pending";
+    std::string why;
+    pending_ = SqlitePendingRows::open(path, why);
+    if (!pending_) {
+        MXLOG(nullptr, Error, "{}: {}; its rows are committed within {} ms instead", path, why, kBatchWindow.count());
+        return true;
+    }
+    auto committed =
+        static_cast<std::uint64_t>(firstInteger(connection_.database, "SELECT sequence FROM pending_committed"));
+    auto replayed = pending_->rowsAfter(committed, statementTexts_.size());
+    committedPending_ = committed;
+    if (replayed.empty())
+        return true;
+    std::deque<SqliteWrite> rows(std::make_move_iterator(replayed.begin()), std::make_move_iterator(replayed.end()));
+    std::string failure;
+    if (!commit(rows, failure, true)) {
+        error = fmt::format("{}: cannot write the {} answered rows kept in {}: {}", path_.string(), rows.size(), path,
+                            failure);
+        return false;
+    }
+    MXLOG(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run", path_.string(), rows.size(),
+          path);
+    pending_->release(committedPending_);
+    return true;
 }
 
 bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<std::string>& schema,
@@ -116,7 +168,7 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
     // The last step proves that the store can be written, not just read.
     // A new store gives pruned pages back to the file system; an older one reuses them.
     std::vector<std::string> setup = {"PRAGMA auto_vacuum=INCREMENTAL", "PRAGMA journal_mode=WAL",
-                                      "PRAGMA synchronous=NORMAL", "PRAGMA cache_size=-512"};
+                                      "PRAGMA synchronous=NORMAL", "PRAGMA cache_size=-512", kPendingTable};
     setup.insert(setup.end(), schema.begin(), schema.end());
     setup.insert(setup.end(), {"BEGIN IMMEDIATE", "COMMIT"});
     for (const auto& sql : setup) {
@@ -144,11 +196,13 @@ bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<s
                            "FROM pragma_page_count(), pragma_freelist_count(), pragma_page_size()",
                            -1, SQLITE_PREPARE_PERSISTENT, &connection.dataSize, nullptr) != SQLITE_OK)
         return fail(std::string(sqlite3_errmsg(connection.database)) + " in the size query");
-    // Every batch begins and commits: parsed once.
-    if (sqlite3_prepare_v3(connection.database, "BEGIN", -1, SQLITE_PREPARE_PERSISTENT, &connection.begin, nullptr) !=
-            SQLITE_OK ||
-        sqlite3_prepare_v3(connection.database, "COMMIT", -1, SQLITE_PREPARE_PERSISTENT, &connection.commit, nullptr) !=
-            SQLITE_OK)
+    // Every batch begins and commits, and most say which pending rows they took: parsed once.
+    auto prepare = [&](const char* sql, sqlite3_stmt** statement) {
+        return sqlite3_prepare_v3(connection.database, sql, -1, SQLITE_PREPARE_PERSISTENT, statement, nullptr) ==
+            SQLITE_OK;
+    };
+    if (!prepare("BEGIN", &connection.begin) || !prepare("COMMIT", &connection.commit) ||
+        !prepare("REPLACE INTO pending_committed(id, sequence) VALUES(1, ?)", &connection.markCommitted))
         return fail(std::string(sqlite3_errmsg(connection.database)) + " in preparing a transaction");
     struct stat status {};
     if (::stat(path.c_str(), &status) != 0)
@@ -163,7 +217,7 @@ void SqliteStore::disconnect(Connection& connection)
     for (auto* statement : connection.statements)
         sqlite3_finalize(statement);
     connection.statements.clear();
-    for (auto** statement : {&connection.dataSize, &connection.begin, &connection.commit}) {
+    for (auto** statement : {&connection.dataSize, &connection.begin, &connection.commit, &connection.markCommitted}) {
         sqlite3_finalize(*statement);
         *statement = nullptr;
     }
@@ -180,8 +234,6 @@ SqliteStore::SqliteStore(std::filesystem::path path, std::vector<std::string> sc
       retention_(std::move(retention)),
       connection_(std::move(connection))
 {
-    std::lock_guard lock(writer_->mutex());
-    writer_->attach(*this);
 }
 
 SqliteStore::~SqliteStore()
@@ -201,13 +253,21 @@ void SqliteStore::submit(SqliteWrite write)
     write.debt = BacklogDebt::incur();
     // A client held back waits on its rows: they go now, not at the window's end.
     bool urgent = write.debt.overdrawn();
+    // Encoded before the lock is taken; a full file of pending rows is not tried.
+    std::string_view encoded;
+    if (pending_ && pending_->mayHaveRoom())
+        encoded = SqlitePendingRows::encode(write);
     std::lock_guard lock(writer_->mutex());
+    if (!encoded.empty())
+        write.pending = pending_->keep(encoded);
+    bool kept = write.pending != 0;
+    unkept_ += kept ? 0 : 1;
     queue_.push_back(std::move(write));
     ++submitted_;
     if (urgent)
         writer_->hurry();
     else
-        writer_->queued(queue_.size());
+        writer_->queued(queue_.size(), kept);
 }
 
 void SqliteStore::flush()
@@ -245,6 +305,7 @@ bool SqliteStore::takeBatch(std::chrono::steady_clock::time_point now)
             logConfigured_ = false;
         }
         while (!queue_.empty() && batch_.size() < kBatchLimit) {
+            unkept_ -= queue_.front().pending == 0 ? 1 : 0;
             batch_.push_back(std::move(queue_.front()));
             queue_.pop_front();
         }
@@ -260,6 +321,8 @@ void SqliteStore::endRound()
 {
     if (std::exchange(roundCheckpoint_, false))
         writer_->checkpoint(path_);
+    if (auto committed = std::exchange(roundPending_, 0); committed != 0 && pending_)
+        pending_->release(committed);
     committed_ += std::exchange(roundWritten_, 0);
     settled_ += std::exchange(roundSettled_, 0);
     failures_ += std::exchange(roundFailures_, 0);
@@ -292,6 +355,7 @@ void SqliteStore::writeBatch()
         retryDelay_ = kFirstRetry;
         roundWritten_ = batch_.size();
         roundSettled_ = batch_.size();
+        roundPending_ = committedPending_;
         roundCheckpoint_ = logPages_ >= checkpointPages_;
         batch_.clear();
         // Age is looked at now and then; size after any batch that may have taken the
@@ -535,8 +599,53 @@ bool SqliteStore::stillOnDisk(std::string& error)
     return false;
 }
 
-// All or nothing: a batch that fails anywhere is rolled back whole and kept.
-bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
+// Binds the row's parameters and steps its statement: SQLite's result.
+int SqliteStore::insert(SqliteWrite& write, std::uint64_t& bytes)
+{
+    bytes += kRowOverheadBytes;
+    sqlite3_stmt* statement = connection_.statements[write.statement];
+    if (texts_.size() < write.parameters.size())
+        texts_.resize(write.parameters.size());
+    for (std::size_t i = 0; i < write.parameters.size(); ++i) {
+        int index = static_cast<int>(i) + 1;
+        std::visit(
+            [&](const auto& value) {
+                using T = std::decay_t<decltype(value)>;
+                if constexpr (std::is_same_v<T, std::nullptr_t>) {
+                    sqlite3_bind_null(statement, index);
+                } else if constexpr (std::is_same_v<T, std::int64_t>) {
+                    sqlite3_bind_int64(statement, index, value);
+                    bytes += sizeof value;
+                } else if constexpr (std::is_same_v<T, double>) {
+                    sqlite3_bind_double(statement, index, value);
+                    bytes += sizeof value;
+                } else if constexpr (std::is_same_v<T, std::string>) {
+                    sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()), SQLITE_STATIC);
+                    bytes += value.size();
+                } else {
+                    // The text stays in its buffer until the row is stepped.
+                    std::string& text = texts_[i];
+                    text.clear();
+                    if constexpr (std::is_same_v<T, Dictionary>)
+                        appendJsonText(text, value);
+                    else
+                        appendJsonText(text, (*value)());
+                    sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+                    bytes += text.size();
+                }
+            },
+            write.parameters[i]);
+    }
+    int stepped = sqlite3_step(statement);
+    sqlite3_reset(statement);
+    sqlite3_clear_bindings(statement);
+    return stepped;
+}
+
+// All or nothing: a batch that fails anywhere is rolled back whole and kept. Rows
+// written again from the pending rows may be there already (`skipPresent`): a row
+// refused as a duplicate is passed over.
+bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error, bool skipPresent)
 {
     sqlite3* database = connection_.database;
     auto failed = [&](const char* what) {
@@ -559,54 +668,25 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
     if (!stepOnce(connection_.begin))
         return failed("begin");
     std::uint64_t bytes = 0;
+    std::uint64_t newestPending = committedPending_;
     for (auto& write : batch) {
-        bytes += kRowOverheadBytes;
-        sqlite3_stmt* statement = connection_.statements[write.statement];
-        if (texts_.size() < write.parameters.size())
-            texts_.resize(write.parameters.size());
-        for (std::size_t i = 0; i < write.parameters.size(); ++i) {
-            int index = static_cast<int>(i) + 1;
-            std::visit(
-                [&](const auto& value) {
-                    using T = std::decay_t<decltype(value)>;
-                    if constexpr (std::is_same_v<T, std::nullptr_t>) {
-                        sqlite3_bind_null(statement, index);
-                    } else if constexpr (std::is_same_v<T, std::int64_t>) {
-                        sqlite3_bind_int64(statement, index, value);
-                        bytes += sizeof value;
-                    } else if constexpr (std::is_same_v<T, double>) {
-                        sqlite3_bind_double(statement, index, value);
-                        bytes += sizeof value;
-                    } else if constexpr (std::is_same_v<T, std::string>) {
-                        sqlite3_bind_text(statement, index, value.data(), static_cast<int>(value.size()),
-                                          SQLITE_STATIC);
-                        bytes += value.size();
-                    } else {
-                        // The text stays in its buffer until the row is stepped.
-                        std::string& text = texts_[i];
-                        text.clear();
-                        if constexpr (std::is_same_v<T, Dictionary>)
-                            appendJsonText(text, value);
-                        else
-                            appendJsonText(text, (*value)());
-                        sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
-                        bytes += text.size();
-                    }
-                },
-                write.parameters[i]);
-        }
-        int stepped = sqlite3_step(statement);
-        sqlite3_reset(statement);
-        sqlite3_clear_bindings(statement);
-        if (stepped != SQLITE_DONE)
+        int stepped = insert(write, bytes);
+        if (stepped != SQLITE_DONE && !(skipPresent && (stepped & 0xff) == SQLITE_CONSTRAINT))
             return failed("insert");
+        newestPending = std::max(newestPending, write.pending);
     }
     // A buffer that grew for one large row (a summary event) is given back.
     for (auto& text : texts_)
         if (text.capacity() > kTextKeptBytes)
             std::string().swap(text);
+    if (newestPending != committedPending_) {
+        sqlite3_bind_int64(connection_.markCommitted, 1, static_cast<std::int64_t>(newestPending));
+        if (!stepOnce(connection_.markCommitted))
+            return failed("insert");
+    }
     if (!stepOnce(connection_.commit))
         return failed("commit");
+    committedPending_ = newestPending;
     unmeasuredBytes_ += bytes;
     return true;
 }
@@ -615,13 +695,8 @@ std::int64_t SqliteStore::queryInteger(const std::string& sql)
 {
     sqlite3* reader = nullptr;
     std::int64_t result = 0;
-    if (sqlite3_open_v2(path_.c_str(), &reader, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
-        sqlite3_stmt* statement = nullptr;
-        if (sqlite3_prepare_v2(reader, sql.c_str(), -1, &statement, nullptr) == SQLITE_OK &&
-            sqlite3_step(statement) == SQLITE_ROW)
-            result = sqlite3_column_int64(statement, 0);
-        sqlite3_finalize(statement);
-    }
+    if (sqlite3_open_v2(path_.c_str(), &reader, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK)
+        result = firstInteger(reader, sql);
     sqlite3_close(reader);
     return result;
 }

@@ -28,8 +28,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/BacklogAccount.h"
-#include "platform/UniqueFunction.h"
+#include "platform/linux/SqlitePendingRows.h"
+#include "platform/linux/SqliteWrite.h"
 #include "platform/linux/SqliteWriter.h"
 #include "value/Value.h"
 
@@ -40,12 +40,6 @@ namespace mx {
 
 // The time columns' unit: seconds since the Unix epoch.
 double secondsSinceEpoch();
-
-// A Dictionary parameter is written as its JSON text, and a deferred one is built
-// first: both happen on the writer thread, off the caller's path.
-using SqliteDeferredDictionary = std::shared_ptr<UniqueFunction<Dictionary()>>;
-using SqliteValue =
-    std::variant<std::nullptr_t, std::int64_t, double, std::string, Dictionary, SqliteDeferredDictionary>;
 
 // How much a store keeps. Rows older than `maxAge` go, and while the rows take more
 // than `maxBytes`, the oldest go; pruning runs on the writer thread between batches.
@@ -68,12 +62,6 @@ struct SqliteRetention {
     std::string firstTime;
 };
 
-struct SqliteWrite {
-    std::size_t statement; // index into the statements given at open
-    std::vector<SqliteValue> parameters;
-    BacklogDebt debt = {}; // owed by the client whose request made the row, until committed
-};
-
 class SqliteStore {
 public:
     // A batch stays short enough that a client held back by its rows gets room back
@@ -82,10 +70,14 @@ public:
     // How long the writer lets a batch gather, from its first row or from the last
     // commit while rows keep coming, unless the batch fills first: at everyday rates a
     // transaction and its wake-ups cost far more than a row, so one commit a window
-    // carries what a few hundred reports left. It is also what a SIGKILL may take of
-    // rows whose reports were answered, with the commit's own time on top, and for a
-    // backend message the delivery's gathering before it: the three stay under 100 ms.
-    static constexpr std::chrono::milliseconds kBatchWindow{70};
+    // carries what the reports of the window left. Rows kept among the store's pending
+    // rows (SqlitePendingRows) survive a SIGKILL, and gather for the long window: it
+    // only bounds how late a reader sees them. A row that found no room there gathers
+    // for the short one, which is what a SIGKILL may take of it, with the commit's own
+    // time on top, and for a backend message the delivery's gathering before it: the
+    // three stay under 100 ms.
+    static constexpr std::chrono::milliseconds kBatchWindow{50};
+    static constexpr std::chrono::milliseconds kKeptWindow{1000};
     // A row's JSON text is built in a buffer kept from row to row, unless it grew
     // past this.
     static constexpr std::size_t kTextKeptBytes = std::size_t{64} << 10;
@@ -130,7 +122,8 @@ public:
     SqliteStore(const SqliteStore&) = delete;
     SqliteStore& operator=(const SqliteStore&) = delete;
 
-    // Charges the row to the account named on this thread (BacklogAccount).
+    // Charges the row to the account named on this thread (BacklogAccount), and keeps
+    // it among the pending rows when there is room, before the caller answers anyone.
     void submit(SqliteWrite write);
     // Waits until everything submitted before the call is committed.
     void flush();
@@ -157,6 +150,7 @@ private:
         sqlite3_stmt* dataSize = nullptr; // the bytes the rows take
         sqlite3_stmt* begin = nullptr;
         sqlite3_stmt* commit = nullptr;
+        sqlite3_stmt* markCommitted = nullptr; // the newest pending row committed
         dev_t device = 0;
         ino_t inode = 0;
     };
@@ -167,9 +161,11 @@ private:
                         const std::vector<std::string>& statements, Connection& connection, std::string& error,
                         int& code);
     static void disconnect(Connection& connection);
+    bool replayPending(std::string& error);
 
     // The writer's side. Under its lock:
     bool hasWork() const { return !queue_.empty() || !batch_.empty(); }
+    bool allQueuedKept() const { return unkept_ == 0; }
     bool wantsRound() const;
     std::optional<std::chrono::steady_clock::time_point> retryAt() const;
     bool takeBatch(std::chrono::steady_clock::time_point now);
@@ -181,7 +177,8 @@ private:
     void cutBackLog();
 
     bool stillOnDisk(std::string& error);
-    bool commit(std::deque<SqliteWrite>& batch, std::string& error);
+    bool commit(std::deque<SqliteWrite>& batch, std::string& error, bool skipPresent = false);
+    int insert(SqliteWrite& write, std::uint64_t& bytes);
     void prune();
     std::uint64_t logShare() const;
     std::uint64_t rowsShare() const;
@@ -220,14 +217,18 @@ private:
     std::chrono::milliseconds retryDelay_ = kFirstRetry;
     std::chrono::steady_clock::time_point retryAt_{};
     std::chrono::steady_clock::time_point failingSince_{};
+    std::uint64_t committedPending_ = 0; // the newest pending row committed
+    std::uint64_t roundPending_ = 0;     // the same, once the round ends
     std::uint64_t roundWritten_ = 0;
     std::uint64_t roundSettled_ = 0; // written or abandoned
     std::uint64_t roundFailures_ = 0;
     bool roundCheckpoint_ = false; // the log passed its mark
 
     // Under the writer's lock.
+    std::unique_ptr<SqlitePendingRows> pending_; // nothing: no row is kept
     std::optional<SqliteRetention> newRetention_;
     std::deque<SqliteWrite> queue_;
+    std::size_t unkept_ = 0; // rows in the queue not kept among the pending rows
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
     std::uint64_t settled_ = 0; // committed, or abandoned by a store closing on a failing disk

@@ -96,10 +96,19 @@ void SqliteWriter::detach(SqliteStore& store, std::unique_lock<std::mutex>& lock
     std::erase(stores_, &store);
 }
 
-void SqliteWriter::queued(std::size_t depth)
+void SqliteWriter::queued(std::size_t depth, bool kept)
 {
-    if (waiting_ || (gathering_ && depth == SqliteStore::kBatchLimit))
+    if (waiting_ || (gathering_ && depth == SqliteStore::kBatchLimit)) {
         changed_.notify_all();
+        return;
+    }
+    if (kept || !gathering_)
+        return;
+    auto shortEnd = std::chrono::steady_clock::now() + SqliteStore::kBatchWindow;
+    if (shortEnd < windowEnd_) {
+        windowEnd_ = shortEnd;
+        changed_.notify_all();
+    }
 }
 
 void SqliteWriter::hurry()
@@ -138,6 +147,11 @@ bool SqliteWriter::anyWork() const
     return std::ranges::any_of(stores_, [](const SqliteStore* store) { return store->hasWork(); });
 }
 
+bool SqliteWriter::allQueuedKept() const
+{
+    return std::ranges::all_of(stores_, [](const SqliteStore* store) { return store->allQueuedKept(); });
+}
+
 bool SqliteWriter::anyUrgent() const
 {
     return flushing_ || closing_ ||
@@ -172,13 +186,27 @@ void SqliteWriter::run()
             waiting_ = false;
             continue;
         }
-        gathering_ = true;
-        auto windowEnd = std::chrono::steady_clock::now() + SqliteStore::kBatchWindow;
-        changed_.wait_until(lock, std::min(windowEnd, nextRetry()), [&] { return anyUrgent(); });
-        gathering_ = false;
+        gather(lock);
         active = writeRound(lock) || anyWork();
         comeForward(flushing_);
     }
+}
+
+// Until the window ends, a batch fills, or a retry is due. The window is the long one
+// while every queued row is kept among its store's pending rows, and a row that is
+// not cuts it short (queued).
+void SqliteWriter::gather(std::unique_lock<std::mutex>& lock)
+{
+    gathering_ = true;
+    windowEnd_ = std::chrono::steady_clock::now() +
+        (allQueuedKept() ? std::chrono::milliseconds(SqliteStore::kKeptWindow) : SqliteStore::kBatchWindow);
+    while (!anyUrgent()) {
+        auto until = std::min(windowEnd_, nextRetry());
+        if (std::chrono::steady_clock::now() >= until)
+            break;
+        changed_.wait_until(lock, until);
+    }
+    gathering_ = false;
 }
 
 // Each store with rows, or with a failed batch whose retry is due, writes one batch.

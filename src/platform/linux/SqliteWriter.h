@@ -44,8 +44,9 @@ public:
     void detach(SqliteStore& store, std::unique_lock<std::mutex>& lock);
     // Under the lock, after a row was queued on a store that now holds `depth`: a quiet
     // writer is woken by the first row, a gathering one by the row that fills a batch;
-    // the rows between wait for the window to end.
-    void queued(std::size_t depth);
+    // the rows between wait for the window to end. A row not `kept` among its store's
+    // pending rows cuts a long window short.
+    void queued(std::size_t depth, bool kept);
     // Under the lock: a flush, a closing store or a client held back wants its rows now,
     // not at the window's end, and the writer comes out of the background until none does.
     void hurry();
@@ -56,6 +57,8 @@ private:
     void run();
     bool anyWork() const;
     bool anyUrgent() const;
+    bool allQueuedKept() const;
+    void gather(std::unique_lock<std::mutex>& lock);
     std::chrono::steady_clock::time_point nextRetry() const;
     bool writeRound(std::unique_lock<std::mutex>& lock);
     void cutBackLogs(std::unique_lock<std::mutex>& lock);
@@ -67,8 +70,9 @@ private:
     std::vector<SqliteStore*> stores_;
     bool waiting_ = false;   // quiet, for a first row
     bool gathering_ = false; // for the window to end or a batch to fill
-    bool flushing_ = false;  // hurried (a flush, a close, a client held back): the batches at hand go now
-    bool inRound_ = false;   // working on stores without the lock
+    std::chrono::steady_clock::time_point windowEnd_{};
+    bool flushing_ = false; // hurried (a flush, a close, a client held back): the batches at hand go now
+    bool inRound_ = false;  // working on stores without the lock
     bool closing_ = false;
     pid_t writerThread_ = 0;      // the writer's thread, to move it
     bool forward_ = false;        // at nice 10 rather than in the background

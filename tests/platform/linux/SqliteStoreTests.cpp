@@ -51,7 +51,7 @@ TEST_F(SqliteStoreTest, UnwantedEventsAreNeverBuiltAndWantedOnesAreAllKept)
     std::string error;
     auto tally = SqliteTally::open(directory / "tally.db", *disabled, StoreLimit{}, error);
     ASSERT_TRUE(tally) << error;
-    int built = 0;
+    std::atomic<int> built = 0; // built where the row is kept, or on the writer
     auto build = [&] {
         ++built;
         return Dictionary{{"k", "v"}, {"when", Date(std::chrono::seconds(0))}};
