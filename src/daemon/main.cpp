@@ -79,7 +79,8 @@ constexpr HelpSection kHelpSections[] = {
   run/harmonia/reporting.sock       the service endpoint (unless systemd passes one)
   run/harmonia/notify.sock          the notification endpoint
   run/harmonia/orientation.sock     the orientation feed ("device N", "ui N")
-  var/lib/harmonia/                 tally.db, joule.db, uplink.db, preferences/
+  var/lib/harmonia/                 tally.db, joule.db, uplink.db (each with its rows not
+                                    yet committed in a -pending file beside it), preferences/
   var/lib/harmonia/metrics/         mxreportingd.prom, the status counters for Prometheus
   etc/harmonia/                     device.json, tally.json, uplink.json, stores.json:
                                     see mxreportingd.conf(5) and the examples in

@@ -233,7 +233,8 @@ TEST_F(SqliteStoreTest, PendingRowsADeadProcessLeftAreReadBackInOrderUpToADamage
 
     std::ifstream file(path, std::ios::binary);
     std::string bytes((std::istreambuf_iterator<char>(file)), {});
-    std::fstream(path, std::ios::in | std::ios::out | std::ios::binary).seekp(bytes.find("row-002995") + 20).put('!');
+    auto damaged = static_cast<std::streamoff>(bytes.find("row-002995") + 20);
+    std::fstream(path, std::ios::in | std::ios::out | std::ios::binary).seekp(damaged).put('!');
     auto reopened = SqlitePendingRows::open(path, error);
     // From where the last start left off (2991) up to the damaged row.
     EXPECT_EQ(reopened->rowsAfter(released, 1).size(), 4u);
