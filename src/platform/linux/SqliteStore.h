@@ -7,8 +7,9 @@
 // at once rather than at the window's end. So the queue is bounded by what its
 // clients may owe, nothing is ever dropped, and a slow store holds back the clients
 // that fill it and no other.
-// WAL journaling keeps every committed batch across a crash; destruction commits
-// everything handed over before.
+// WAL journaling keeps every committed batch across a crash, and the rows not yet
+// committed are kept in a file beside the store (SqlitePendingRows) that open writes in
+// after a crash; destruction commits everything handed over before.
 // Failure policy: a batch that cannot be written (full or read-only disk, the file
 // removed) is held and retried with backoff until it commits, while the rows queued
 // behind it stay on their clients' accounts and the other stores go on; the failure
