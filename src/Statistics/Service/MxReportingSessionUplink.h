@@ -55,10 +55,10 @@ public:
         BacklogDebt debt;
     };
 
-    // How long a run of deliveries gathers after the first of it is held: what a SIGKILL
-    // may take of them, for the store keeps what it is handed (SqliteStore). Beside the
-    // store's short window, for a row it found no room to keep, the two stay within
-    // what a SIGKILL may take.
+    // How long a run of deliveries gathers after the first of it is held. It is what a
+    // SIGKILL may take of them, for the store keeps each row it is handed (SqliteStore);
+    // with the store's short window, for a row it finds no room to keep, it stays
+    // under 100 ms.
     static constexpr std::chrono::milliseconds kDeliveryGathering{40};
 
     explicit MxReportingSessionUplink(ReporterID reporterID);

@@ -98,32 +98,25 @@ bool looksKept(const char* base)
         tail + kTerminatorRoom <= SqlitePendingRows::kFileBytes && tail % 8 == 0;
 }
 
+// A parameter goes through the wire's own decoder; a row holds only the kinds a
+// parameter can be.
 std::optional<SqliteValue> decodeParameter(const msgpack::object& object)
 {
-    switch (object.type) {
-    case msgpack::type::NIL:
-        return SqliteValue(nullptr);
-    case msgpack::type::POSITIVE_INTEGER:
-        if (object.via.u64 > std::uint64_t(INT64_MAX))
-            return std::nullopt;
-        return SqliteValue(static_cast<std::int64_t>(object.via.u64));
-    case msgpack::type::NEGATIVE_INTEGER:
-        return SqliteValue(object.via.i64);
-    case msgpack::type::FLOAT32:
-    case msgpack::type::FLOAT64:
-        return SqliteValue(object.via.f64);
-    case msgpack::type::STR:
-        return SqliteValue(std::string(object.via.str.ptr, object.via.str.size));
-    case msgpack::type::MAP: {
-        std::string reason;
-        auto value = decodeMsgpack(object, reason, kMaximumDepth);
-        if (!value)
-            return std::nullopt;
-        return SqliteValue(*value->asDictionary());
-    }
-    default:
+    std::string reason;
+    auto value = decodeMsgpack(object, reason, kMaximumDepth);
+    if (!value)
         return std::nullopt;
-    }
+    if (value->isNil())
+        return SqliteValue(nullptr);
+    if (const auto* integer = value->asInt())
+        return SqliteValue(*integer);
+    if (const auto* real = value->asDouble())
+        return SqliteValue(*real);
+    if (const auto* text = value->asString())
+        return SqliteValue(*text);
+    if (const auto* dictionary = value->asDictionary())
+        return SqliteValue(*dictionary);
+    return std::nullopt;
 }
 
 std::optional<SqliteWrite> decodeRow(std::string_view bytes, std::size_t statements)
@@ -160,19 +153,14 @@ std::unique_ptr<SqlitePendingRows> SqlitePendingRows::open(const std::filesystem
     }
     struct stat status {};
     bool sized = ::fstat(fd, &status) == 0 && static_cast<std::uint64_t>(status.st_size) == kFileBytes;
-    void* mapping = MAP_FAILED;
-    if (sized) {
-        mapping = ::mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-        if (mapping != MAP_FAILED && !looksKept(static_cast<const char*>(mapping))) {
-            MXLOG(nullptr, Error, "{} is not a file of pending rows: starting it afresh", path.string());
-            ::munmap(mapping, kFileBytes);
-            mapping = MAP_FAILED;
-            sized = false;
-        }
-    } else if (status.st_size > 0) {
+    void* mapping = sized ? ::mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0) : MAP_FAILED;
+    bool foreign = sized ? mapping != MAP_FAILED && !looksKept(static_cast<const char*>(mapping)) : status.st_size > 0;
+    if (foreign) {
         MXLOG(nullptr, Error, "{} is not a file of pending rows: starting it afresh", path.string());
+        ::munmap(mapping, kFileBytes);
+        mapping = MAP_FAILED;
     }
-    if (!sized && makeAfresh(fd, error)) {
+    if ((!sized || foreign) && makeAfresh(fd, error)) {
         ::fchmod(fd, SqliteStore::kFileMode);
         mapping = ::mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
     }

@@ -261,7 +261,8 @@ void SqliteStore::submit(SqliteWrite write)
     if (!encoded.empty())
         write.pending = pending_->keep(encoded);
     bool kept = write.pending != 0;
-    unkept_ += kept ? 0 : 1;
+    if (!kept)
+        ++unkept_;
     queue_.push_back(std::move(write));
     ++submitted_;
     if (urgent)
@@ -305,7 +306,8 @@ bool SqliteStore::takeBatch(std::chrono::steady_clock::time_point now)
             logConfigured_ = false;
         }
         while (!queue_.empty() && batch_.size() < kBatchLimit) {
-            unkept_ -= queue_.front().pending == 0 ? 1 : 0;
+            if (queue_.front().pending == 0)
+                --unkept_;
             batch_.push_back(std::move(queue_.front()));
             queue_.pop_front();
         }

@@ -226,7 +226,7 @@ private:
     bool roundCheckpoint_ = false; // the log passed its mark
 
     // Under the writer's lock.
-    std::unique_ptr<SqlitePendingRows> pending_; // nothing: no row is kept
+    std::unique_ptr<SqlitePendingRows> pending_; // set at open, nothing: no row is kept
     std::optional<SqliteRetention> newRetention_;
     std::deque<SqliteWrite> queue_;
     std::size_t unkept_ = 0; // rows in the queue not kept among the pending rows

@@ -198,8 +198,8 @@ void SqliteWriter::run()
 void SqliteWriter::gather(std::unique_lock<std::mutex>& lock)
 {
     gathering_ = true;
-    windowEnd_ = std::chrono::steady_clock::now() +
-        (allQueuedKept() ? std::chrono::milliseconds(SqliteStore::kKeptWindow) : SqliteStore::kBatchWindow);
+    windowEnd_ =
+        std::chrono::steady_clock::now() + (allQueuedKept() ? SqliteStore::kKeptWindow : SqliteStore::kBatchWindow);
     while (!anyUrgent()) {
         auto until = std::min(windowEnd_, nextRetry());
         if (std::chrono::steady_clock::now() >= until)

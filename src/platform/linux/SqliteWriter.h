@@ -68,9 +68,9 @@ private:
     std::mutex mutex_;
     std::condition_variable changed_;
     std::vector<SqliteStore*> stores_;
-    bool waiting_ = false;   // quiet, for a first row
-    bool gathering_ = false; // for the window to end or a batch to fill
-    std::chrono::steady_clock::time_point windowEnd_{};
+    bool waiting_ = false;                              // quiet, for a first row
+    bool gathering_ = false;                            // for the window to end or a batch to fill
+    std::chrono::steady_clock::time_point windowEnd_{}; // brought forward by a row not kept
     bool flushing_ = false; // hurried (a flush, a close, a client held back): the batches at hand go now
     bool inRound_ = false;  // working on stores without the lock
     bool closing_ = false;
