@@ -103,7 +103,7 @@ void MxReportingSession::start()
 
     MxReportingSessionUplink::Configuration configuration{userInfo_, serviceName(), serviceType(),
                                                           uplinkSessionStarted()};
-    uplinkQueue()->dispatch(
+    uplink_.run(
         [self = shared_from_this(), earlier = uplink_.takeHeld(), configuration = std::move(configuration)]() mutable {
             self->deliver(std::move(earlier));
             self->uplink_.configure(self->serviceType(), configuration);
@@ -129,7 +129,7 @@ void MxReportingSession::stop()
     }
     writeSummaryJson();
 
-    uplinkQueue()->dispatch([self = shared_from_this(), earlier = uplink_.takeHeld()]() mutable {
+    uplink_.run([self = shared_from_this(), earlier = uplink_.takeHeld()]() mutable {
         self->deliver(std::move(earlier));
         self->uplink_.flush(self->serviceType());
     });
@@ -178,18 +178,23 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
     MxTrace(kTraceMessageQueued);
 
     // Whether the message goes in-session or alone is decided now, not at delivery.
-    bool wasStarted = started();
-    // Owed by the client that sent it until delivered, and so is what the delivery writes.
-    if (uplink_.hold({std::move(cleaned), message, wasStarted, category, type, BacklogDebt::incur()}))
-        queueHeldDeliveries();
+    MxReportingSessionUplink::Delivery delivery{std::move(cleaned), message, started(), category, type, {}};
+    if (delivery.wasStarted && uplink_.idle()) {
+        uplink_.deliver(serviceType(), delivery, *userInfo_);
+    } else {
+        // Owed by the client that sent it until delivered, and so is what the delivery writes.
+        delivery.debt = BacklogDebt::incur();
+        if (uplink_.hold(std::move(delivery)))
+            queueHeldDeliveries();
+    }
     if (reply)
         reply(std::nullopt);
 }
 
 void MxReportingSession::queueHeldDeliveries()
 {
-    uplinkQueue()->dispatchAfter(MxReportingSessionUplink::kDeliveryGathering,
-                                 [self = shared_from_this()] { self->deliver(self->uplink_.takeHeld()); });
+    uplink_.runAfter(MxReportingSessionUplink::kDeliveryGathering,
+                     [self = shared_from_this()] { self->deliver(self->uplink_.takeHeld()); });
 }
 
 void MxReportingSession::deliver(std::vector<MxReportingSessionUplink::Delivery> deliveries)
@@ -198,8 +203,7 @@ void MxReportingSession::deliver(std::vector<MxReportingSessionUplink::Delivery>
         // Each delivery's debt settles as soon as it is delivered.
         auto debt = std::move(delivery.debt);
         ScopedBacklogAccount charging(debt);
-        uplink_.deliver(serviceType(), delivery.cleaned, delivery.message, delivery.wasStarted, delivery.category,
-                        delivery.type, *userInfo_);
+        uplink_.deliver(serviceType(), delivery, *userInfo_);
     }
 }
 

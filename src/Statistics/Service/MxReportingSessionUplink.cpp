@@ -47,6 +47,24 @@ MxReportingSessionUplink::MxReportingSessionUplink(ReporterID reporterID)
 {
 }
 
+void MxReportingSessionUplink::run(UniqueFunction<void()> job)
+{
+    queuedJobs_.fetch_add(1, std::memory_order_relaxed);
+    queue_->dispatch([this, job = std::move(job)]() mutable {
+        job();
+        queuedJobs_.fetch_sub(1, std::memory_order_release);
+    });
+}
+
+void MxReportingSessionUplink::runAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> job)
+{
+    queuedJobs_.fetch_add(1, std::memory_order_relaxed);
+    queue_->dispatchAfter(delay, [this, job = std::move(job)]() mutable {
+        job();
+        queuedJobs_.fetch_sub(1, std::memory_order_release);
+    });
+}
+
 bool MxReportingSessionUplink::hold(Delivery delivery)
 {
     std::lock_guard lock(heldMutex_);
@@ -108,15 +126,14 @@ void MxReportingSessionUplink::configure(ServiceType currentType, const Configur
     }
 }
 
-void MxReportingSessionUplink::deliver(ServiceType currentType, const Dictionary& cleaned, const Dictionary& message,
-                                       bool wasStarted, MessageCategory category, MessageType type,
+void MxReportingSessionUplink::deliver(ServiceType currentType, const Delivery& delivery,
                                        const MxLockedDictionary& userInfo)
 {
-    assert(queue_->isCurrent());
-    if (!wasStarted) {
+    assert(queue_->isCurrent() || idle());
+    if (!delivery.wasStarted) {
         MXLOG_VERBOSE(logScope(), "session not started, will send as a single message");
         Dictionary snapshot = userInfo.snapshot();
-        sendSingleMessage(cleaned, category, type, currentType, &snapshot, nullptr);
+        sendSingleMessage(delivery.cleaned, delivery.category, delivery.type, currentType, &snapshot, nullptr);
         return;
     }
     if (currentType == service_type::kTest) {
@@ -131,9 +148,11 @@ void MxReportingSessionUplink::deliver(ServiceType currentType, const Dictionary
     }
     // Intended: a refused send is silent; the backend's error is not logged.
     std::optional<UplinkError> error;
-    if (session->sendMessage(static_cast<std::uint16_t>(category & 0xFFFF), type, cleaned, error))
+    if (session->sendMessage(static_cast<std::uint16_t>(delivery.category & 0xFFFF), delivery.type, delivery.cleaned,
+                             error))
         MXLOG_VERBOSE(logScope(), "UplinkAgent {} : message {} : category {} : type {}", session->description(),
-                      Value(message).description(), static_cast<std::int32_t>(category), type);
+                      Value(delivery.message).description(), static_cast<std::int32_t>(delivery.category),
+                      delivery.type);
 }
 
 void MxReportingSessionUplink::flush(ServiceType currentType)

@@ -2,10 +2,15 @@
 // A session's side of the reporting backend: its backend session and token, and the
 // work that runs on the session's own serial uplink queue, in submission order:
 // backend configuration with the discovery wait, in-session deliveries, the flush.
-// Deliveries are held and go in gathered runs: at everyday rates a queue hop per
-// report costs more than the delivery, so a run a few milliseconds after the first
-// held one takes all that came since. Configuration and flush take what is held
-// before they are queued, so nothing is delivered out of its order with them.
+// A started session's delivery is made at once, on the server queue, while the uplink
+// queue has nothing to do: the server queue alone gives the uplink queue work, so it
+// stays idle meanwhile, and the delivery keeps its order. It then costs no hop and no
+// wake-up of the utility thread, and its row is kept (SqliteStore) before the report
+// is answered. Otherwise (a configuration waiting for its backends, a flush, a session
+// not started) deliveries are held and go in gathered runs: a queue hop per report
+// costs more than the delivery, so a run a few milliseconds after the first held one
+// takes all that came since. Configuration and flush take what is held before they
+// are queued, so nothing is delivered out of its order with them.
 // Owned by its MxReportingSession, which queues that work holding itself, so the
 // session (and this object) outlives every queued job. Also sends single messages,
 // which go alone from the global utility queue.
@@ -55,10 +60,10 @@ public:
         BacklogDebt debt;
     };
 
-    // How long a run of deliveries gathers after the first of it is held. It is what a
-    // SIGKILL may take of them, for the store keeps each row it is handed (SqliteStore);
-    // with the store's short window, for a row it finds no room to keep, it stays
-    // under 100 ms.
+    // How long a run of held deliveries gathers after the first of it is held. It is
+    // what a SIGKILL may take of them, for the store keeps each row it is handed
+    // (SqliteStore); with the store's short window, for a row it finds no room to
+    // keep, it stays under 100 ms.
     static constexpr std::chrono::milliseconds kDeliveryGathering{40};
 
     explicit MxReportingSessionUplink(ReporterID reporterID);
@@ -72,16 +77,24 @@ public:
     std::shared_ptr<UplinkSession> uplinkSession() const { return uplinkSession_.get(); }
     std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplinkAgentToken_.get(); }
 
+    // Server queue only. Queues `job` on the uplink queue, counted until it has run.
+    void run(UniqueFunction<void()> job);
+    void runAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> job);
+    // Server queue only. Nothing is queued on the uplink queue or running there, and
+    // nothing can be until the caller returns: what it delivers now is in order.
+    bool idle() const { return queuedJobs_.load(std::memory_order_acquire) == 0; }
+
     // Any thread. Holds the delivery for the next run; true when nothing was held
     // before it, and the caller queues that run.
     bool hold(Delivery delivery);
     // Any thread. What is held, in order, for a job about to be queued.
     std::vector<Delivery> takeHeld();
 
-    // Uplink queue only. `currentType` is the session's service type as the job runs.
+    // Uplink queue only, or the server queue while idle. `currentType` is the
+    // session's service type as the delivery is made.
+    void deliver(ServiceType currentType, const Delivery& delivery, const MxLockedDictionary& userInfo);
+    // Uplink queue only.
     void configure(ServiceType currentType, const Configuration& configuration);
-    void deliver(ServiceType currentType, const Dictionary& cleaned, const Dictionary& message, bool wasStarted,
-                 MessageCategory category, MessageType type, const MxLockedDictionary& userInfo);
     void flush(ServiceType currentType);
 
     // One message with a throw-away backend session of its own, sent from the global
@@ -93,6 +106,7 @@ public:
 private:
     const ReporterID reporterID_;
     const std::shared_ptr<WorkQueue> queue_;
+    std::atomic<int> queuedJobs_{0};
     // Written on the uplink queue only; read from anywhere.
     std::atomic<bool> uplinkSessionStarted_{false};
     MxAtomicProperty<std::shared_ptr<UplinkSession>> uplinkSession_;
