@@ -673,6 +673,7 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonLosesNoAnsweredRowAndStartsCleanly)
 
     daemon.start();
     EXPECT_GE(committed("tally", "events"), 500 + answered);
+    EXPECT_GE(committed("uplink", "messages"), 500 + answered) << "a started session's deliveries are kept too";
     EXPECT_TRUE(daemon.waitForLog("tally.db: wrote the "));
     auto again = connect();
     ASSERT_EQ(again->createSession(4), 0);
