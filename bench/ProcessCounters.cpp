@@ -33,8 +33,10 @@ ProcessCounters ProcessCounters::of(pid_t pid)
             statusNumber(task.path() / "status", "nonvoluntary_ctxt_switches");
         std::string name;
         std::getline(std::ifstream(task.path() / "comm"), name);
+        thread.name = name;
         counters += thread;
         counters.byThreadName[name] += thread;
+        counters.byThread[static_cast<pid_t>(std::stol(task.path().filename().string()))] = thread;
     }
     return counters;
 }
@@ -42,13 +44,14 @@ ProcessCounters ProcessCounters::of(pid_t pid)
 ProcessCounters ProcessCounters::operator-(const ProcessCounters& earlier) const
 {
     ProcessCounters difference;
-    difference.cpuSeconds = cpuSeconds - earlier.cpuSeconds;
-    difference.switches = switches - earlier.switches;
-    difference.byThreadName = byThreadName;
-    for (const auto& [name, then] : earlier.byThreadName) {
-        auto& now = difference.byThreadName[name];
-        now.cpuSeconds -= then.cpuSeconds;
-        now.switches -= then.switches;
+    for (auto [id, now] : byThread) {
+        auto then = earlier.byThread.find(id);
+        if (then != earlier.byThread.end()) {
+            now.cpuSeconds -= then->second.cpuSeconds;
+            now.switches -= then->second.switches;
+        }
+        difference += now;
+        difference.byThreadName[now.name] += now;
     }
     return difference;
 }

@@ -12,6 +12,7 @@ namespace mx::bench {
 struct ThreadCounters {
     double cpuSeconds = 0;      // run time, to the nanosecond (schedstat)
     std::uint64_t switches = 0; // voluntary and involuntary context switches
+    std::string name;           // of the thread, when it is one
 
     ThreadCounters& operator+=(const ThreadCounters& other)
     {
@@ -23,9 +24,10 @@ struct ThreadCounters {
 
 struct ProcessCounters : ThreadCounters {
     std::map<std::string, ThreadCounters> byThreadName; // what the threads of each name cost
+    std::map<pid_t, ThreadCounters> byThread;
 
-    // The threads living now: a thread that ended since an earlier reading takes its
-    // share with it, so readings compare across a span in which no thread ends.
+    // The threads living now. A thread that ends takes its share with it: across a
+    // span, what a thread living at its end spent since it began, or since it started.
     static ProcessCounters of(pid_t pid);
     ProcessCounters operator-(const ProcessCounters& earlier) const;
 };
