@@ -7,6 +7,7 @@ records, and a repeated reading is no change."""
 
 import json
 import os
+import shutil
 import sqlite3
 import subprocess
 import sys
@@ -112,6 +113,7 @@ def main():
         proxy.wait(BOUND)
         bus.terminate()
         bus.wait(BOUND)
+        shutil.rmtree(scratch, ignore_errors=True)
         if daemon:
             daemon.close(checks.failed > 0)
     return checks.summary()
