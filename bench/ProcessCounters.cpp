@@ -34,8 +34,6 @@ ProcessCounters ProcessCounters::of(pid_t pid)
         std::string name;
         std::getline(std::ifstream(task.path() / "comm"), name);
         thread.name = name;
-        counters += thread;
-        counters.byThreadName[name] += thread;
         counters.byThread[static_cast<pid_t>(std::stol(task.path().filename().string()))] = thread;
     }
     return counters;

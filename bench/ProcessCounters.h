@@ -22,9 +22,11 @@ struct ThreadCounters {
     }
 };
 
+// A reading holds its threads; a span between two readings (`-`) also holds their sum
+// and what the threads of each name cost.
 struct ProcessCounters : ThreadCounters {
-    std::map<std::string, ThreadCounters> byThreadName; // what the threads of each name cost
     std::map<pid_t, ThreadCounters> byThread;
+    std::map<std::string, ThreadCounters> byThreadName;
 
     // The threads living now. A thread that ends takes its share with it: across a
     // span, what a thread living at its end spent since it began, or since it started.

@@ -47,22 +47,21 @@ MxReportingSessionUplink::MxReportingSessionUplink(ReporterID reporterID)
 {
 }
 
-void MxReportingSessionUplink::run(UniqueFunction<void()> job)
-{
-    queuedJobs_.fetch_add(1, std::memory_order_relaxed);
-    queue_->dispatch([this, job = std::move(job)]() mutable {
-        job();
-        queuedJobs_.fetch_sub(1, std::memory_order_release);
-    });
-}
+void MxReportingSessionUplink::run(UniqueFunction<void()> job) { queue_->dispatch(counted(std::move(job))); }
 
 void MxReportingSessionUplink::runAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> job)
 {
+    queue_->dispatchAfter(delay, counted(std::move(job)));
+}
+
+// The job holds its session, and so this object, until the count is down.
+UniqueFunction<void()> MxReportingSessionUplink::counted(UniqueFunction<void()> job)
+{
     queuedJobs_.fetch_add(1, std::memory_order_relaxed);
-    queue_->dispatchAfter(delay, [this, job = std::move(job)]() mutable {
+    return [this, job = std::move(job)]() mutable {
         job();
         queuedJobs_.fetch_sub(1, std::memory_order_release);
-    });
+    };
 }
 
 bool MxReportingSessionUplink::hold(Delivery delivery)

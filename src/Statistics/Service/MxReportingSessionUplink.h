@@ -104,6 +104,8 @@ public:
                                   ServiceType serviceType, const Dictionary* userInfo, SendReply reply);
 
 private:
+    UniqueFunction<void()> counted(UniqueFunction<void()> job);
+
     const ReporterID reporterID_;
     const std::shared_ptr<WorkQueue> queue_;
     std::atomic<int> queuedJobs_{0};
