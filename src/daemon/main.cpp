@@ -149,8 +149,8 @@ std::string joined(const std::vector<std::string>& errors)
 
 [[noreturn]] void fail(const std::string& message)
 {
-    MXLOG(nullptr, Error, "mxreportingd cannot start (running as user {}, group {}): {}", userName(geteuid()),
-          groupName(getegid()), message);
+    MXLOG_LIMITED(nullptr, Error, "mxreportingd cannot start (running as user {}, group {}): {}", userName(geteuid()),
+                  groupName(getegid()), message);
     // Worker threads already run: no static destructor may pull the world from under them.
     std::_Exit(1);
 }
@@ -162,8 +162,8 @@ void reconfigure(SqliteTally& tally, SqliteJoule& joule, SpoolUplink& uplink)
     auto configuration = DaemonConfiguration::read(errors);
     if (!configuration) {
         for (const auto& error : errors)
-            MXLOG(nullptr, Error, "configuration refused: {}", error);
-        MXLOG(nullptr, Error, "keeping the configuration in use");
+            MXLOG_LIMITED(nullptr, Error, "configuration refused: {}", error);
+        MXLOG_LIMITED(nullptr, Error, "keeping the configuration in use");
         return;
     }
     const auto& limits = configuration->limits;
@@ -171,8 +171,8 @@ void reconfigure(SqliteTally& tally, SqliteJoule& joule, SpoolUplink& uplink)
     joule.store().setRetention(eventsRetention(limits.joule));
     uplink.reconfigure(configuration->backends, limits.uplink);
     MxReportingSessionSummary::setRetention(limits.summaries.maxFiles, limits.summaries.maxBytes);
-    MXLOG(nullptr, Default, "configuration read again: {} collectors, {} disabled event names",
-          configuration->backends.collectors.size(), configuration->disabledEvents.size());
+    MXLOG_LIMITED(nullptr, Default, "configuration read again: {} collectors, {} disabled event names",
+                  configuration->backends.collectors.size(), configuration->disabledEvents.size());
 }
 
 int run(int argc, char** argv)
@@ -298,12 +298,13 @@ int run(int argc, char** argv)
     listener->resume();
     heartbeat.start();
     sd_notify(0, "READY=1");
-    MXLOG(nullptr, Default, "mxreportingd {} (pid {}) listening on {}; talk to it: MXREPORTING_ROOT={} mxreport demo",
-          MXREPORTING_VERSION, getpid(), listener->endpointDescription(), MxReportingRoot().string());
+    MXLOG_LIMITED(nullptr, Default,
+                  "mxreportingd {} (pid {}) listening on {}; talk to it: MXREPORTING_ROOT={} mxreport demo",
+                  MXREPORTING_VERSION, getpid(), listener->endpointDescription(), MxReportingRoot().string());
 
     int signal = terminated.get_future().get();
     sd_notify(0, "STOPPING=1");
-    MXLOG(nullptr, Default, "mxreportingd stopping on signal {}: taking no more requests", signal);
+    MXLOG_LIMITED(nullptr, Default, "mxreportingd stopping on signal {}: taking no more requests", signal);
     auto began = std::chrono::steady_clock::now();
     // Every request already taken runs to its end, and so does the work it queued
     // (deliveries, single messages, delayed ones at once), before the stores commit.
@@ -312,14 +313,15 @@ int run(int argc, char** argv)
     // Clients held back by what they owe run what they sent, too: no more comes.
     BacklogAccount::forgiveAll();
     if (!dispatch.drain(kDrainBound))
-        MXLOG(nullptr, Error, "queues still busy after {} s: committing what they handed over",
-              kDrainBound.count() / 1000);
+        MXLOG_LIMITED(nullptr, Error, "queues still busy after {} s: committing what they handed over",
+                      kDrainBound.count() / 1000);
     tally->store().flush();
     joule->store().flush();
     uplink->store().flush();
     MxReportingMetrics::remove();
-    MXLOG(nullptr, Default, "mxreportingd stopped: everything taken is committed ({} ms)",
-          std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - began).count());
+    MXLOG_LIMITED(
+        nullptr, Default, "mxreportingd stopped: everything taken is committed ({} ms)",
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - began).count());
     // Queues and connections are not torn down: the process simply ends.
     std::_Exit(0);
 }

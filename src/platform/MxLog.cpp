@@ -35,77 +35,67 @@ int verboseLevelFromEnvironment(const std::string& verboseSwitch)
     return end != value ? static_cast<int>(level) : 0;
 }
 
-// Bursts of lines, so that nothing a client sends can fill the log: within a window
-// a text repeated word for word passes a few times, and one place in the code writes
-// a bounded number of lines whatever their texts (one per datagram of a flood, each
-// quoting a different one). What is held back is counted, and the count rides on the
-// next line that place writes. Different texts under the bound never hold each other
-// back, so one reporter's errors cannot hide another's.
+// Bursts of the daemon's own lines, so that nothing a client or a file does can fill the
+// log: one place in the code writes a bounded number of lines a window, whatever their
+// texts (one per datagram of a flood, each quoting a different one). What it held back
+// is counted and said, on a line of its own, before the next line it writes.
 class LogBursts {
 public:
-    // Nothing: suppress the line. Else the number suppressed at its place since the
-    // last line shown from there.
     void reset()
     {
         std::lock_guard lock(mutex_);
-        texts_.clear();
         places_.clear();
     }
 
+    void endWindows()
+    {
+        std::lock_guard lock(mutex_);
+        for (auto& [place, burst] : places_)
+            burst.windowStart = {};
+    }
+
+    // Nothing: hold the line back. Else the number held back at its place since the
+    // last line written from there.
     std::optional<std::uint64_t> admit(const MxLogRecord& record)
     {
         auto now = std::chrono::steady_clock::now();
-        std::string key = record.message();
         std::lock_guard lock(mutex_);
-        if (texts_.size() >= kMostRemembered)
-            forgetQuiet(texts_, now);
         if (places_.size() >= kMostRemembered)
-            forgetQuiet(places_, now);
+            forgetQuiet(now);
         auto& place = places_[Place{record.file, record.line}];
-        auto& text = texts_[key];
-        restartIfOver(place, now);
-        restartIfOver(text, now);
-        if (place.shown >= kLinesPerPlace || text.shown >= kLinesPerText) {
-            ++place.suppressed;
+        if (now - place.windowStart >= kWindow) {
+            place.windowStart = now;
+            place.shown = 0;
+        }
+        if (place.shown >= kLinesPerPlace) {
+            ++place.heldBack;
             return std::nullopt;
         }
         ++place.shown;
-        ++text.shown;
-        return std::exchange(place.suppressed, 0);
+        return std::exchange(place.heldBack, 0);
     }
 
 private:
     static constexpr std::chrono::seconds kWindow{10};
-    static constexpr int kLinesPerText = 10;
     static constexpr int kLinesPerPlace = 100;
     static constexpr std::size_t kMostRemembered = 4096;
 
     struct Burst {
         std::chrono::steady_clock::time_point windowStart;
         int shown = 0;
-        std::uint64_t suppressed = 0;
+        std::uint64_t heldBack = 0;
     };
     using Place = std::pair<std::string, int>;
 
-    static void restartIfOver(Burst& burst, std::chrono::steady_clock::time_point now)
+    // Places whose window is over hold nothing worth keeping but an uncounted tail.
+    void forgetQuiet(std::chrono::steady_clock::time_point now)
     {
-        if (now - burst.windowStart >= kWindow) {
-            burst.windowStart = now;
-            burst.shown = 0;
-        }
-    }
-
-    // Bursts whose window is over hold nothing worth keeping but an uncounted tail.
-    template <class Map>
-    static void forgetQuiet(Map& bursts, std::chrono::steady_clock::time_point now)
-    {
-        std::erase_if(bursts, [&](const auto& entry) { return now - entry.second.windowStart >= kWindow; });
-        if (bursts.size() >= kMostRemembered)
-            bursts.clear();
+        std::erase_if(places_, [&](const auto& entry) { return now - entry.second.windowStart >= kWindow; });
+        if (places_.size() >= kMostRemembered)
+            places_.clear();
     }
 
     std::mutex mutex_;
-    std::map<std::string, Burst> texts_;
     std::map<Place, Burst> places_;
 };
 
@@ -118,6 +108,8 @@ LogBursts& logBursts()
 } // namespace
 
 void MxLogResetBurstsForTesting() { logBursts().reset(); }
+
+void MxLogEndBurstWindowsForTesting() { logBursts().endWindows(); }
 
 const MxLogScope* MxLogRegisterScope(int /*kind*/, std::uint32_t /*fourCharCode*/, const std::string& code,
                                      const std::string& subsystem, const std::string& verboseSwitch, int /*settings*/)
@@ -162,27 +154,38 @@ std::string_view MxLogFunctionName(std::string_view signature)
     return start == std::string_view::npos ? qualified : qualified.substr(start + 1);
 }
 
+namespace {
+
+void writeRecord(const MxLogRecord& record)
+{
+    if (ProcessWide<MxLogSink>::installed())
+        ProcessWide<MxLogSink>::get().write(record);
+    else
+        std::fprintf(stderr, "%s\n", record.message().c_str());
+}
+
+} // namespace
+
 void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, std::string_view signature,
-                std::string_view text)
+                std::string_view text, bool limited)
 {
     MxLogRecord record{scope, level, file, line, std::string(MxLogFunctionName(signature)), {}};
+    if (limited) {
+        auto heldBack = logBursts().admit(record);
+        if (!heldBack)
+            return;
+        if (*heldBack > 0) {
+            MxLogRecord count = record;
+            count.text = fmt::format("{} more lines from here were held back", *heldBack);
+            writeRecord(count);
+        }
+    }
     // Lines quote what clients send and call themselves: one line, nothing a terminal obeys.
     if (isPrintableText(text))
         record.text = text;
     else
         appendPrintableText(record.text, text);
-    // Verbose lines are asked for, and cut by nothing.
-    if (level != MxLogLevel::Debug) {
-        auto suppressed = logBursts().admit(record);
-        if (!suppressed)
-            return;
-        if (*suppressed > 0)
-            record.text += fmt::format(" ({} more like it suppressed)", *suppressed);
-    }
-    if (ProcessWide<MxLogSink>::installed())
-        ProcessWide<MxLogSink>::get().write(record);
-    else
-        std::fprintf(stderr, "%s\n", record.message().c_str());
+    writeRecord(record);
 }
 
 } // namespace mx

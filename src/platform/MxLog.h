@@ -61,11 +61,15 @@ bool MxLogEnabled(const MxLogScope* scope, int verboseLevel);
 
 // `signature` is the writing function's __PRETTY_FUNCTION__: the prefix names the
 // function it declares, or for a lambda the function the lambda is written in.
+// `limited`: one of the daemon's own lines, bounded per place.
 void MxLogWrite(const MxLogScope* scope, MxLogLevel level, const char* file, int line, std::string_view signature,
-                std::string_view text);
+                std::string_view text, bool limited = false);
 
 // Forgets every burst counted so far: each test starts with a log nothing held back.
 void MxLogResetBurstsForTesting();
+// Ends the window of every place now, what was held back still to be said: a test's
+// stand-in for the window's time passing.
+void MxLogEndBurstWindowsForTesting();
 
 // "start" of "void mx::MxReportingSession::start()", "configure" of the signature of a
 // lambda inside configure.
@@ -84,6 +88,11 @@ constexpr int kMxLogVerboseLevel = 5;
 #define MXLOG(scope, level, ...)                                                                                       \
     ::mx::MxLogWrite((scope), ::mx::MxLogLevel::level, __FILE_NAME__, __LINE__, __PRETTY_FUNCTION__,                   \
                      fmt::format(__VA_ARGS__))
+
+// One of the daemon's own lines, which something outside it may repeat at will.
+#define MXLOG_LIMITED(scope, level, ...)                                                                               \
+    ::mx::MxLogWrite((scope), ::mx::MxLogLevel::level, __FILE_NAME__, __LINE__, __PRETTY_FUNCTION__,                   \
+                     fmt::format(__VA_ARGS__), true)
 
 // A debug line written only while the scope's verbose switch is on; the arguments
 // are not even formatted otherwise.

@@ -209,9 +209,9 @@ void MxReportingBlockThrottle::runTimerLoop()
             loop_.run();
             return;
         } catch (const std::exception& error) {
-            MXLOG(nullptr, Error, "a held delivery failed: {}", error.what());
+            MXLOG_LIMITED(nullptr, Error, "a held delivery failed: {}", error.what());
         } catch (...) {
-            MXLOG(nullptr, Error, "a held delivery failed");
+            MXLOG_LIMITED(nullptr, Error, "a held delivery failed");
         }
     }
 }

@@ -133,9 +133,9 @@ void MxReportingMetrics::write(const Dictionary& status)
     if (!failure)
         failure = fileSystem.writeAtomically(path, prometheusText(status, now), kFileMode, Durability::Unsynced);
     if (failure && !std::exchange(failing, true))
-        MXLOG(nullptr, Error, "cannot write the metrics file {}: {}", path.string(), *failure);
+        MXLOG_LIMITED(nullptr, Error, "cannot write the metrics file {}: {}", path.string(), *failure);
     if (!failure && std::exchange(failing, false))
-        MXLOG(nullptr, Default, "metrics file {} written again", path.string());
+        MXLOG_LIMITED(nullptr, Default, "metrics file {} written again", path.string());
 }
 
 void MxReportingMetrics::remove()

@@ -154,7 +154,7 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
         return;
     }
     if (std::size_t removed = fileSystem.trimDirectory(directory, gMaximumFiles.load(), gMaximumBytes.load()))
-        MXLOG(logScope(), Info, "removed the {} oldest summary files beyond the limits", removed);
+        MXLOG_LIMITED(logScope(), Info, "removed the {} oldest summary files beyond the limits", removed);
 }
 
 } // namespace mx

@@ -47,7 +47,7 @@ void DatagramOrientation::receiveNext()
         } else if (!error) {
             std::string quoted;
             appendQuotedText(quoted, text.substr(0, 64));
-            MXLOG(nullptr, Error, "orientation feed: ignored {}: a change is \"device N\" or \"ui N\"", quoted);
+            MXLOG_LIMITED(nullptr, Error, "orientation feed: ignored {}: a change is \"device N\" or \"ui N\"", quoted);
         }
         receiveNext();
     });

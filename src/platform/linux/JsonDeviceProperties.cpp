@@ -18,7 +18,7 @@ nlohmann::json readProperty(const std::filesystem::path& file, std::string_view 
         return nullptr;
     auto properties = nlohmann::json::parse(stream, nullptr, /*allow_exceptions=*/false, /*ignore_comments=*/true);
     if (properties.is_discarded() || !properties.is_object()) {
-        MXLOG(nullptr, Error, "ignoring unreadable device properties in {}", file.string());
+        MXLOG_LIMITED(nullptr, Error, "ignoring unreadable device properties in {}", file.string());
         return nullptr;
     }
     auto found = properties.find(key);

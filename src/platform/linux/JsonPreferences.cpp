@@ -21,7 +21,7 @@ Dictionary JsonPreferences::copyDomain(const std::string& domain)
         return {};
     auto json = nlohmann::ordered_json::parse(stream, nullptr, /*allow_exceptions=*/false);
     if (json.is_discarded() || !json.is_object()) {
-        MXLOG(nullptr, Error, "ignoring preferences {}: not a JSON object", domainPath(domain).string());
+        MXLOG_LIMITED(nullptr, Error, "ignoring preferences {}: not a JSON object", domainPath(domain).string());
         return {};
     }
     return *fromJson(json).asDictionary();

@@ -91,7 +91,7 @@ void MsgpackRpcListener::acceptNext()
                     return;
                 // Out of descriptors and the like: say so, and try again shortly rather
                 // than spin on a failing accept.
-                MXLOG(nullptr, Error, "accept failed: {}", error.message());
+                MXLOG_LIMITED(nullptr, Error, "accept failed: {}", error.message());
                 retry_.expires_after(std::chrono::milliseconds(100));
                 retry_.async_wait([this](const std::error_code& cancelled) {
                     if (!cancelled)

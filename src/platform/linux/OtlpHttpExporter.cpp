@@ -267,8 +267,8 @@ bool OtlpHttpExporter::openSpool()
         return true;
     if (database_) {
         // The store set the file aside or made it anew: the rows to export are there now.
-        MXLOG(nullptr, Default, "otlp exporter to {}: {} was made anew, reading the new one", collector_.url,
-              spool_.string());
+        MXLOG_LIMITED(nullptr, Default, "otlp exporter to {}: {} was made anew, reading the new one", collector_.url,
+                      spool_.string());
         sqlite3_close(database_);
         database_ = nullptr;
     }
@@ -301,9 +301,10 @@ void OtlpHttpExporter::run()
             error_ = failure;
             ++passes_;
             if (failure && !wasFailing)
-                MXLOG(nullptr, Error, "otlp export failing, keeping messages in the spool: {}", failure->description);
+                MXLOG_LIMITED(nullptr, Error, "otlp export failing, keeping messages in the spool: {}",
+                              failure->description);
             if (!failure && wasFailing)
-                MXLOG(nullptr, Default, "otlp export to {} recovered", collector_.url);
+                MXLOG_LIMITED(nullptr, Default, "otlp export to {} recovered", collector_.url);
         }
         changed_.notify_all();
         measureLag();
@@ -393,8 +394,8 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
         // A collector that refuses the content itself will refuse it again: it is
         // logged and passed over rather than retried for ever.
         if (failure && failure->code >= 400 && failure->code < 500 && failure->code != 408 && failure->code != 429) {
-            MXLOG(nullptr, Error, "otlp collector rejected {} records, not retrying: {}", records.size(),
-                  failure->description);
+            MXLOG_LIMITED(nullptr, Error, "otlp collector rejected {} records, not retrying: {}", records.size(),
+                          failure->description);
             failure.reset();
         }
         return !failure;

@@ -55,8 +55,8 @@ bool SensorProxyListener::connect()
 {
     if (int failure = sd_bus_open_system(&bus_); failure < 0) {
         bus_ = nullptr;
-        MXLOG(nullptr, Info, "orientation: no system bus ({}); device orientation comes from the feed alone",
-              errorText(failure));
+        MXLOG_LIMITED(nullptr, Info, "orientation: no system bus ({}); device orientation comes from the feed alone",
+                      errorText(failure));
         return false;
     }
     std::string changes = std::string("type='signal',sender='") + kProxy + "',path='" + kProxyPath +
@@ -103,8 +103,8 @@ int SensorProxyListener::onClaimed(sd_bus_message* message, void* self, sd_bus_e
     listener.claiming_ = false;
     if (sd_bus_message_is_method_error(message, nullptr)) {
         // The usual case on a machine without the proxy: its appearance claims again.
-        MXLOG(nullptr, Info, "orientation: the sensor proxy cannot be claimed ({})",
-              errorText(sd_bus_message_get_error(message)));
+        MXLOG_LIMITED(nullptr, Info, "orientation: the sensor proxy cannot be claimed ({})",
+                      errorText(sd_bus_message_get_error(message)));
         return 0;
     }
     listener.claimed_ = true;
@@ -123,7 +123,7 @@ int SensorProxyListener::onFirstReading(sd_bus_message* message, void* self, sd_
     if (sd_bus_message_is_method_error(message, nullptr) || sd_bus_message_read(message, "v", "s", &text) <= 0)
         return 0;
     static_cast<SensorProxyListener*>(self)->observe(text);
-    MXLOG(nullptr, Info, "orientation: device orientation from the sensor proxy, {} now", text);
+    MXLOG_LIMITED(nullptr, Info, "orientation: device orientation from the sensor proxy, {} now", text);
     return 0;
 }
 
@@ -170,8 +170,8 @@ int SensorProxyListener::onOwnerChanged(sd_bus_message* message, void* self, sd_
 int SensorProxyListener::onMatchInstalled(sd_bus_message* message, void*, sd_bus_error*)
 {
     if (sd_bus_message_is_method_error(message, nullptr))
-        MXLOG(nullptr, Error, "orientation: cannot watch the sensor proxy ({})",
-              errorText(sd_bus_message_get_error(message)));
+        MXLOG_LIMITED(nullptr, Error, "orientation: cannot watch the sensor proxy ({})",
+                      errorText(sd_bus_message_get_error(message)));
     return 0;
 }
 
@@ -236,10 +236,10 @@ void SensorProxyListener::waitFor(asio::posix::descriptor_base::wait_type type, 
 
 void SensorProxyListener::disconnect(int failure)
 {
-    MXLOG(nullptr, Error,
-          "orientation: the system bus connection ended ({}); device orientation comes from the "
-          "feed alone",
-          errorText(failure));
+    MXLOG_LIMITED(nullptr, Error,
+                  "orientation: the system bus connection ended ({}); device orientation comes from the "
+                  "feed alone",
+                  errorText(failure));
     timer_.cancel();
     descriptor_.release();
     sd_bus_flush_close_unref(bus_);

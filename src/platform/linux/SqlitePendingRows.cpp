@@ -156,7 +156,7 @@ std::unique_ptr<SqlitePendingRows> SqlitePendingRows::open(const std::filesystem
     void* mapping = sized ? ::mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0) : MAP_FAILED;
     bool foreign = sized ? mapping != MAP_FAILED && !looksKept(static_cast<const char*>(mapping)) : status.st_size > 0;
     if (foreign) {
-        MXLOG(nullptr, Error, "{} is not a file of pending rows: starting it afresh", path.string());
+        MXLOG_LIMITED(nullptr, Error, "{} is not a file of pending rows: starting it afresh", path.string());
         ::munmap(mapping, kFileBytes);
         mapping = MAP_FAILED;
     }
@@ -209,7 +209,7 @@ std::vector<SqliteWrite> SqlitePendingRows::rowsAfter(std::uint64_t committed, s
                 row->pending = number;
                 rows.push_back(std::move(*row));
             } else {
-                MXLOG(nullptr, Error, "{}: row {} cannot be read back: left out", path_.string(), number);
+                MXLOG_LIMITED(nullptr, Error, "{}: row {} cannot be read back: left out", path_.string(), number);
             }
         }
         at += size;

@@ -103,8 +103,8 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
         if (!isCorruption(code))
             return nullptr;
         auto aside = setAside(path);
-        MXLOG(nullptr, Error, "{} is corrupt ({}): set aside as {}, starting a fresh store", path.string(), error,
-              aside.filename().string());
+        MXLOG_LIMITED(nullptr, Error, "{} is corrupt ({}): set aside as {}, starting a fresh store", path.string(),
+                      error, aside.filename().string());
         if (!connect(path, schema, statements, connection, error, code))
             return nullptr;
     }
@@ -124,7 +124,8 @@ bool SqliteStore::replayPending(std::string& error)
     std::string why;
     pending_ = SqlitePendingRows::open(path, why);
     if (!pending_) {
-        MXLOG(nullptr, Error, "{}: {}; its rows are committed within {} ms instead", path, why, kBatchWindow.count());
+        MXLOG_LIMITED(nullptr, Error, "{}: {}; its rows are committed within {} ms instead", path, why,
+                      kBatchWindow.count());
         return true;
     }
     auto committed =
@@ -140,8 +141,8 @@ bool SqliteStore::replayPending(std::string& error)
                             failure);
         return false;
     }
-    MXLOG(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run", path_.string(), rows.size(),
-          path);
+    MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run", path_.string(),
+                  rows.size(), path);
     pending_->release(committedPending_);
     return true;
 }
@@ -351,8 +352,8 @@ void SqliteStore::writeBatch()
         checkpointIfBehind();
     if (present && commit(batch_, error)) {
         if (attempts_ > 0)
-            MXLOG(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(), attempts_,
-                  describe(now - failingSince_));
+            MXLOG_LIMITED(nullptr, Default, "{}: writing again after {} failed attempts in {}", path_.string(),
+                          attempts_, describe(now - failingSince_));
         attempts_ = 0;
         retryDelay_ = kFirstRetry;
         roundWritten_ = batch_.size();
@@ -370,15 +371,15 @@ void SqliteStore::writeBatch()
     ++roundFailures_;
     if (attempts_++ == 0) {
         failingSince_ = now;
-        MXLOG(nullptr, Error,
-              "{}: cannot write ({}); holding {} rows and retrying: the clients that sent them wait until it "
-              "can write again",
-              path_.string(), error, batch_.size() + queuedBehind_);
+        MXLOG_LIMITED(nullptr, Error,
+                      "{}: cannot write ({}); holding {} rows and retrying: the clients that sent them wait until it "
+                      "can write again",
+                      path_.string(), error, batch_.size() + queuedBehind_);
     }
     // Only a store being closed gives up, and says what it could not keep.
     if (giveUp_ && attempts_ > 1) {
-        MXLOG(nullptr, Error, "{}: closing with {} rows that could not be written: {}", path_.string(),
-              batch_.size() + queuedBehind_, error);
+        MXLOG_LIMITED(nullptr, Error, "{}: closing with {} rows that could not be written: {}", path_.string(),
+                      batch_.size() + queuedBehind_, error);
         roundSettled_ = batch_.size();
         batch_.clear();
         attempts_ = 0;
@@ -479,7 +480,7 @@ std::int64_t SqliteStore::pruneStep(const SqliteRetention::Step& step, std::int6
 {
     sqlite3_stmt* statement = nullptr;
     if (sqlite3_prepare_v2(connection_.database, step.sql.c_str(), -1, &statement, nullptr) != SQLITE_OK) {
-        MXLOG(nullptr, Error, "{}: cannot prune: {}", path_.string(), sqlite3_errmsg(connection_.database));
+        MXLOG_LIMITED(nullptr, Error, "{}: cannot prune: {}", path_.string(), sqlite3_errmsg(connection_.database));
         return -1;
     }
     if (cutoff != 0) {
@@ -553,9 +554,11 @@ void SqliteStore::prune()
     roundCheckpoint_ = true;
     if (pruneUnfinished_)
         return;
-    MXLOG(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(), std::exchange(prunedRows_, 0));
+    MXLOG_LIMITED(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(),
+                  std::exchange(prunedRows_, 0));
     if (auto unexported = std::exchange(prunedUnexported_, 0); unexported > 0)
-        MXLOG(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(), unexported);
+        MXLOG_LIMITED(nullptr, Error, "{}: {} of them had not been exported to every collector", path_.string(),
+                      unexported);
 }
 
 void SqliteStore::setRetention(SqliteRetention retention)
@@ -587,7 +590,7 @@ bool SqliteStore::stillOnDisk(std::string& error)
     if (present && connection_.database)
         return true;
     if (connection_.database)
-        MXLOG(nullptr, Error, "{} was removed: making a new one", path_.string());
+        MXLOG_LIMITED(nullptr, Error, "{} was removed: making a new one", path_.string());
     disconnect(connection_);
     logConfigured_ = false;
     measuredBytes_.reset();
@@ -596,7 +599,8 @@ bool SqliteStore::stillOnDisk(std::string& error)
         return true;
     if (isCorruption(code)) {
         auto aside = setAside(path_);
-        MXLOG(nullptr, Error, "{} is corrupt ({}): set aside as {}", path_.string(), error, aside.filename().string());
+        MXLOG_LIMITED(nullptr, Error, "{} is corrupt ({}): set aside as {}", path_.string(), error,
+                      aside.filename().string());
     }
     return false;
 }
@@ -657,8 +661,8 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error, boo
         if (isCorruption(code)) {
             disconnect(connection_);
             auto aside = setAside(path_);
-            MXLOG(nullptr, Error, "{} turned corrupt ({}): set aside as {}, making a new one", path_.string(), error,
-                  aside.filename().string());
+            MXLOG_LIMITED(nullptr, Error, "{} turned corrupt ({}): set aside as {}, making a new one", path_.string(),
+                          error, aside.filename().string());
         }
         return false;
     };

@@ -129,9 +129,9 @@ void SqliteWriter::comeForward(bool forward)
         return;
     }
     forwardRefused_ = true;
-    MXLOG(nullptr, Default,
-          "the store writer cannot come forward when clients wait on it ({}): it stays in the background",
-          std::generic_category().message(errno));
+    MXLOG_LIMITED(nullptr, Default,
+                  "the store writer cannot come forward when clients wait on it ({}): it stays in the background",
+                  std::generic_category().message(errno));
 }
 
 void SqliteWriter::checkpoint(const std::filesystem::path& path)
