@@ -29,7 +29,8 @@ Values driverChannels()
         int error = 0;
         for (const auto& channel :
              files.find(driver.groupName(), driver.subGroupName(), error).value_or(std::vector<ChannelFile>{}))
-            if (auto value = ChannelFiles::readValue(channel.path, error))
+            if (auto value = ChannelFiles::readValue(channel.path, error,
+                                                     std::chrono::steady_clock::now() + ChannelFiles::kRereadTime))
                 values[driver.keyPrefix() + channel.name] = *value;
     }
     return values;

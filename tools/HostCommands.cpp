@@ -187,7 +187,8 @@ std::unique_ptr<MxReportCommand> channels(const Words& words)
                 std::fprintf(stderr, "mxreport: %s: %s\n", driver.description().c_str(), errnoText(error).c_str());
             for (const auto& channel : found.value_or(std::vector<ChannelFile>{})) {
                 std::string key = driver.keyPrefix() + channel.name;
-                auto value = ChannelFiles::readValue(channel.path, error);
+                auto value = ChannelFiles::readValue(channel.path, error,
+                                                     std::chrono::steady_clock::now() + ChannelFiles::kRereadTime);
                 std::string shown = value ? std::to_string(*value) : "(" + errnoText(error) + ")";
                 if (json)
                     std::puts(nlohmann::json{{"driver", driver.description()},

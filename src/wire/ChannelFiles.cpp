@@ -21,14 +21,15 @@ constexpr std::size_t kLongestText = 63;
 // writer is preempted between its truncation and its write: the first reads again
 // come at once, the later ones after growing pauses with a random part, so that a
 // reader and a writer woken by the same timer tick do not meet at the same moment
-// again (at most about 100 ms in all). A file that was not written lately is not
-// being rewritten: what it holds is final at once.
+// again; all of them within the time the whole sample has for reading again. A file
+// that was not written in the last second (a time in the future included: no writer
+// of this host gives one) is not being rewritten: what it holds is final at once.
 constexpr int kReadAttempts = 9;
 constexpr auto kRewriteWindow = std::chrono::seconds(1);
 constexpr int kImmediateAttempts = 2;
 constexpr auto kFirstPause = std::chrono::microseconds(25);
 
-void pauseBeforeAttempt(int attempt)
+void pauseBeforeAttempt(int attempt, std::chrono::steady_clock::time_point retryUntil)
 {
     if (attempt < kImmediateAttempts) {
         std::this_thread::yield();
@@ -36,7 +37,17 @@ void pauseBeforeAttempt(int attempt)
     }
     thread_local std::minstd_rand random(static_cast<unsigned>(std::random_device{}()));
     auto base = kFirstPause * (1 << (2 * (attempt - kImmediateAttempts)));
-    std::this_thread::sleep_for(base + base * (random() % 200) / 100);
+    auto pause = std::chrono::duration_cast<std::chrono::steady_clock::duration>(base + base * (random() % 200) / 100);
+    std::this_thread::sleep_for(std::min(pause, retryUntil - std::chrono::steady_clock::now()));
+}
+
+bool writtenInTheLastSecond(const timespec& modified)
+{
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME, &now);
+    auto age =
+        std::chrono::seconds(now.tv_sec - modified.tv_sec) + std::chrono::nanoseconds(now.tv_nsec - modified.tv_nsec);
+    return age >= std::chrono::nanoseconds(0) && age <= kRewriteWindow;
 }
 
 // The regular files directly in `directory`, added to `channels`. False, with the
@@ -89,9 +100,7 @@ bool readText(const std::string& path, std::string& text, bool& recentlyWritten,
         ::close(fd);
         return false;
     }
-    timespec now{};
-    ::clock_gettime(CLOCK_REALTIME, &now);
-    recentlyWritten = std::chrono::seconds(now.tv_sec - status.st_mtim.tv_sec) <= kRewriteWindow;
+    recentlyWritten = writtenInTheLastSecond(status.st_mtim);
     char buffer[kLongestText + 1];
     ssize_t length = ::read(fd, buffer, sizeof(buffer));
     error = length < 0 ? errno : 0;
@@ -159,12 +168,15 @@ std::optional<std::vector<ChannelFile>> ChannelFiles::find(const std::optional<s
 
 // The value of one channel file, or the errno of what went wrong. A writer that
 // rewrites the file in place (`echo N > file`) empties it before it writes, so a read
-// may find nothing, or the first part of a number: such a read is tried again, and a
-// value without its line end is taken once two reads agree on it.
-std::optional<std::int64_t> ChannelFiles::readValue(const std::string& path, int& error)
+// may find nothing, or the first part of a number: such a read is tried again while
+// there is time, and a value without its line end is taken once two reads agree on it.
+std::optional<std::int64_t> ChannelFiles::readValue(const std::string& path, int& error,
+                                                    std::chrono::steady_clock::time_point retryUntil)
 {
     std::optional<std::int64_t> previous;
     for (int attempt = 0; attempt < kReadAttempts; ++attempt) {
+        if (attempt > 0 && std::chrono::steady_clock::now() >= retryUntil)
+            break;
         std::string text;
         bool recentlyWritten = false;
         if (!readText(path, text, recentlyWritten, error))
@@ -176,7 +188,7 @@ std::optional<std::int64_t> ChannelFiles::readValue(const std::string& path, int
             break;
         previous = value;
         if (!value)
-            pauseBeforeAttempt(attempt);
+            pauseBeforeAttempt(attempt, retryUntil);
     }
     error = EINVAL;
     return std::nullopt;

@@ -5,6 +5,7 @@
 // 64-bit integer. Deeper files, and anything that is not a regular file, are not
 // channels. Reads go through descriptors nothing on the other end can block.
 
+#include <chrono>
 #include <cstdint>
 #include <filesystem>
 #include <optional>
@@ -20,6 +21,10 @@ struct ChannelFile {
 
 class ChannelFiles {
 public:
+    // What one reading of a set of channels (a driver's sample) may spend reading again
+    // files caught being rewritten.
+    static constexpr std::chrono::milliseconds kRereadTime{10};
+
     explicit ChannelFiles(std::filesystem::path directory);
 
     // The channel files of a group and subgroup (an absent name matches every one:
@@ -30,8 +35,11 @@ public:
                                                  const std::optional<std::string>& subgroup, int& error) const;
 
     // The value in one channel file, or nothing with the errno in `error` (EINVAL for a
-    // file that is not a regular file holding one integer).
-    static std::optional<std::int64_t> readValue(const std::string& path, int& error);
+    // file that is not a regular file holding one integer). A file caught being
+    // rewritten is read again until `retryUntil`: the time one sample has for that,
+    // shared by its files.
+    static std::optional<std::int64_t> readValue(const std::string& path, int& error,
+                                                 std::chrono::steady_clock::time_point retryUntil);
 
 private:
     std::filesystem::path directory_;

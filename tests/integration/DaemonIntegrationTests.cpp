@@ -557,7 +557,8 @@ TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)
     auto summary = std::filesystem::directory_iterator(daemon.path("var/log/harmonia/reporting"))->path();
     EXPECT_EQ(nlohmann::json::parse(std::ifstream(summary))[2]["DriverStats_Generic_1"]["Haptics_Stats_pulses"], 5);
 
-    // A second period, whose stop finds a channel gone: only that channel is lost.
+    // A second period, whose stop finds a channel gone: its driver's sample fails, the
+    // others count.
     client->startSession(6);
     std::uint16_t type = 0;
     ASSERT_EQ(client->isValid(6, type), 1) << "the start (and its snapshot) came first";
@@ -565,16 +566,26 @@ TEST(DaemonDriverStatisticsTest, AStopReportsEachDriversGrowthSinceTheStart)
     std::filesystem::remove(daemon.path("run/harmonia/chanstat/Speaker/Amp/level"));
     channel("Speaker/Amp/underruns", 20);
     ASSERT_EQ(client->stopSession(6), 0);
-    EXPECT_TRUE(daemon.waitForLog("Speaker/Amp/level left out of this sample: No such file or directory"));
+    EXPECT_TRUE(daemon.waitForLog("ChanstatCreateSamples error 2"));
+
+    // A third, whose start could not sample that driver: its stop reports the driver's
+    // absolute values.
+    client->startSession(6);
+    ASSERT_EQ(client->isValid(6, type), 1);
+    channel("Speaker/Amp/level", 30);
+    ASSERT_EQ(client->stopSession(6), 0);
+    EXPECT_TRUE(daemon.waitForLog("ChanstatCreateSamplesDelta error 2"));
 
     daemon.signal(SIGTERM);
     ASSERT_EQ(daemon.waitForExit(), 0);
     Dictionary expected{{"Speaker_underruns", 3}, {"MCA_late", 4}, {"Haptics_Stats_pulses", 5}};
     auto event = daemon.query(
         "tally", "SELECT payload FROM events WHERE name = 'com.kestrel.harmonia.DriverStats.Generic' ORDER BY id");
-    ASSERT_EQ(event.size(), 2u);
+    ASSERT_EQ(event.size(), 3u);
     EXPECT_EQ(nlohmann::json::parse(event[1][0]).dump(),
-              R"({"Haptics_Stats_pulses":2,"HostApplicationDisplayID":"Unknown","Speaker_underruns":7})");
+              R"({"Haptics_Stats_pulses":2,"HostApplicationDisplayID":"Unknown"})");
+    EXPECT_EQ(nlohmann::json::parse(event[2][0]).dump(),
+              R"({"HostApplicationDisplayID":"Unknown","Speaker_level":30,"Speaker_underruns":20})");
     auto payload = nlohmann::json::parse(event[0][0]);
     EXPECT_EQ(payload.size(), 4u) << payload.dump() << ": the statistics and the host";
     for (const auto& [key, value] : expected)

@@ -37,37 +37,32 @@ ChanstatSubscription FileChanstat::createSubscription(const ChanstatChannels& ch
     return ++subscriptions_;
 }
 
-// A channel that cannot be read is left out of the sample (and said so), not its
-// driver's others; only a driver none of whose channels can be read fails.
+// The first channel that cannot be read fails its driver's sample, with its errno.
 std::optional<ChanstatChannels> FileChanstat::createSamples(ChanstatSubscription,
                                                             const ChanstatChannels& subscribedChannels,
                                                             std::optional<ChanstatError>& error)
 {
+    auto retryUntil = std::chrono::steady_clock::now() + ChannelFiles::kRereadTime;
     ChanstatChannels samples;
     samples.reserve(subscribedChannels.size());
-    int firstFailure = 0;
     for (const auto& channel : subscribedChannels) {
         int failure = 0;
-        auto value = ChannelFiles::readValue(channel.path, failure);
+        auto value = ChannelFiles::readValue(channel.path, failure, retryUntil);
         if (!value) {
-            firstFailure = firstFailure != 0 ? firstFailure : failure;
-            MXLOG(nullptr, Error, "channel {} left out of this sample: {}", channel.path,
-                  failure == EINVAL ? std::string("not a regular file holding one integer")
-                                    : std::generic_category().message(failure));
-            continue;
+            MXLOG_LIMITED(nullptr, Error, "channel {} cannot be read, failing its driver's sample: {}", channel.path,
+                          failure == EINVAL ? std::string("not a regular file holding one integer")
+                                            : std::generic_category().message(failure));
+            error = ChanstatError{failure};
+            return std::nullopt;
         }
         samples.push_back(channel);
         samples.back().value = *value;
     }
-    if (samples.empty() && firstFailure != 0) {
-        error = ChanstatError{firstFailure};
-        return std::nullopt;
-    }
     return samples;
 }
 
-// Channels are matched by path: a channel the earlier sample lacks (it could not be
-// read then) has no growth to give and is left out.
+// Channels are matched by path: a later channel the earlier sample lacks has no growth
+// to give, and fails the delta.
 std::optional<ChanstatChannels> FileChanstat::createSamplesDelta(const ChanstatChannels* earlier,
                                                                  const ChanstatChannels& later,
                                                                  std::optional<ChanstatError>& error)
@@ -84,8 +79,10 @@ std::optional<ChanstatChannels> FileChanstat::createSamplesDelta(const ChanstatC
     delta.reserve(later.size());
     for (const auto& channel : later) {
         auto found = before.find(channel.path);
-        if (found == before.end())
-            continue;
+        if (found == before.end()) {
+            error = ChanstatError{ENOENT};
+            return std::nullopt;
+        }
         delta.push_back(channel);
         // A counter that wrapped around still gives its growth, without overflow.
         delta.back().value = static_cast<std::int64_t>(static_cast<std::uint64_t>(channel.value) -

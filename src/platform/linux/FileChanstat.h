@@ -1,8 +1,10 @@
 #pragma once
 // The driver channel library over the channel files (wire/ChannelFiles): a query walks
 // the directories once; a subscription is the files found then, and sampling reads
-// just those files, through descriptors nothing can block on. A channel that cannot be
-// read is left out of its sample rather than failing its driver's other channels.
+// just those files, through descriptors nothing can block on. The first channel that
+// cannot be read fails its driver's sample; a file caught being rewritten is read again
+// within a time the whole sample shares, so that a sample takes milliseconds however
+// its files are written.
 // Thread-safe: it holds no state but its directory.
 
 #include <atomic>

@@ -93,9 +93,9 @@ TEST_F(FileChanstatTest, SamplesAndDeltasReadTheSubscribedFilesAndFailWithTheirE
     EXPECT_EQ(error->code, ENOENT);
 }
 
-// A channel that cannot be read now (gone, garbled, a FIFO put in its place) is left
-// out of its sample, and so of the growth, while its driver's other channels count.
-TEST_F(FileChanstatTest, OneBadChannelLeavesTheOthersAndAFifoNeverBlocks)
+// The first channel that cannot be read now (gone, garbled, a FIFO put in its place)
+// fails its driver's sample, and a delta needs every channel in the earlier sample.
+TEST_F(FileChanstatTest, ABadChannelFailsItsDriversSampleAndAFifoNeverBlocks)
 {
     FileChanstat files(directory);
     std::optional<ChanstatError> error;
@@ -103,22 +103,37 @@ TEST_F(FileChanstatTest, OneBadChannelLeavesTheOthersAndAFifoNeverBlocks)
     write("Speaker/Amp/fifo", "0");
     files.createSubscription(*files.copyChannelsInGroup("Speaker", std::nullopt, error), subscribed);
     auto before = files.createSamples(1, subscribed, error);
+    ASSERT_TRUE(before);
     std::filesystem::remove(directory / "Speaker/Amp/fifo");
     ASSERT_EQ(mkfifo((directory / "Speaker/Amp/fifo").c_str(), 0644), 0);
-    write("Speaker/underruns", "not a number");
-    write("Speaker/Amp/clips", "5");
-    auto after = files.createSamples(1, subscribed, error);
-    EXPECT_FALSE(error);
-    EXPECT_EQ(names(after), std::vector<std::string>{"clips"});
-    write("Speaker/underruns", "20");
-    auto partial = files.createSamples(1, subscribed, error);
-    auto delta = files.createSamplesDelta(&*after, *partial, error);
-    EXPECT_EQ(names(delta), std::vector<std::string>{"clips"}) << "no growth for a channel missing before";
-    delta = files.createSamplesDelta(&*before, *partial, error);
-    ASSERT_EQ(names(delta), (std::vector<std::string>{"clips", "underruns"}));
-    EXPECT_EQ((*delta)[0].value, 8);
-    EXPECT_EQ((*delta)[1].value, 8);
-    EXPECT_FALSE(error);
+    EXPECT_FALSE(files.createSamples(1, subscribed, error));
+    EXPECT_EQ(error->code, EINVAL) << "a FIFO is no channel, and reading it waits for no writer";
+
+    ChanstatChannels fewer(before->begin() + 1, before->end());
+    error.reset();
+    EXPECT_FALSE(files.createSamplesDelta(&fewer, *before, error));
+    EXPECT_EQ(error->code, ENOENT) << "the earlier sample lacks a channel of the later one";
+}
+
+// Garbage written with a time in the future is not a file being rewritten: it is read
+// once, so that twenty such files cost a sample milliseconds, not seconds each.
+TEST_F(FileChanstatTest, GarbageFromTheFutureIsFinalAtOnce)
+{
+    ChanstatChannels subscribed;
+    for (int i = 0; i < 20; ++i) {
+        std::string name = "Haptics/Stats/garbage" + std::to_string(i);
+        write(name, "12x");
+        timespec times[2] = {{0, UTIME_OMIT}, {std::time(nullptr) + 3600, 0}};
+        ASSERT_EQ(::utimensat(AT_FDCWD, (directory / name).c_str(), times, 0), 0);
+        subscribed.push_back({"garbage", (directory / name).string(), 0});
+    }
+    FileChanstat files(directory);
+    std::optional<ChanstatError> error;
+    auto began = std::chrono::steady_clock::now();
+    for (int sample = 0; sample < 5; ++sample)
+        EXPECT_FALSE(files.createSamples(1, subscribed, error));
+    EXPECT_EQ(error->code, EINVAL);
+    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(2)) << "it took 27 s once";
 }
 
 // A writer that rewrites its file in place empties it first: a read between the two
