@@ -40,7 +40,13 @@ typedef struct mxr_payload mxr_payload;
  * (-ECONNREFUSED or -ENOENT from mxr_client_open: nobody listens on the socket):
  *   -EINVAL     an argument is wrong (NULL where something is needed, a key that is
  *               no text, JSON that does not parse), or the daemon refused the request
- *               as one it cannot take (such as more than 1024 reporter IDs);
+ *               as one it cannot take;
+ *   -EMFILE     mxr_session_create(): the daemon holds as many sessions as it takes
+ *               (4096 a connection, 16384 in all); none was made;
+ *   -E2BIG      mxr_send(): more reporter IDs than one message may name (4096);
+ *               nothing was sent;
+ *   -ENOSPC     mxr_send(): a session it reaches keeps as much of its period as it
+ *               may (64 MiB a session, 512 MiB in all); nothing was sent;
  *   -ENOMEM     out of memory;
  *   -ETIMEDOUT  no reply within the client's timeout;
  *   -ENOTCONN   the client is closing, or a request in flight could not be sent again

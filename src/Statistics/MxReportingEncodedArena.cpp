@@ -14,7 +14,13 @@ constexpr std::size_t kFirstChunk = 1024;
 constexpr std::size_t kLargestChunk = std::size_t{64} * 1024;
 constexpr int kCompressionLevel = 1;
 
+std::atomic<std::size_t> gKeptInAll{0};
+
 } // namespace
+
+MxReportingEncodedArena::~MxReportingEncodedArena() { gKeptInAll.fetch_sub(keptBytes(), std::memory_order_relaxed); }
+
+std::size_t MxReportingEncodedArena::keptInAll() { return gKeptInAll.load(std::memory_order_relaxed); }
 
 // The context is reused for every chunk a thread seals: making one costs more than
 // compressing a chunk.
@@ -67,6 +73,8 @@ MxReportingEncodedArena::Range MxReportingEncodedArena::store(std::string_view b
     Range range{static_cast<std::uint32_t>(chunks_.size() - 1), static_cast<std::uint32_t>(chunk.used),
                 static_cast<std::uint32_t>(bytes.size())};
     chunk.used += bytes.size();
+    kept_.fetch_add(bytes.size(), std::memory_order_relaxed);
+    gKeptInAll.fetch_add(bytes.size(), std::memory_order_relaxed);
     return range;
 }
 

@@ -5,8 +5,11 @@
 // is full is compressed (zstd, its fastest level): a period keeps every report until
 // its summary, and reports of one component repeat their keys and much of their
 // values, so a busy period holds a fraction of what it was sent. Reading undoes it.
+// What an arena keeps is counted as written, before compression, since that is what
+// reading it back at a summary costs; and so is what every arena of the process keeps.
 // Thread-safe: appends and reads take the arena's own lock.
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -25,9 +28,18 @@ public:
         std::uint32_t size = 0;
     };
 
+    MxReportingEncodedArena() = default;
+    ~MxReportingEncodedArena();
+    MxReportingEncodedArena(const MxReportingEncodedArena&) = delete;
+    MxReportingEncodedArena& operator=(const MxReportingEncodedArena&) = delete;
+
     Range store(std::string_view bytes);
     // `read` gets the bytes of each range in turn, under the arena's lock.
     void read(const std::vector<Range>& ranges, const std::function<void(std::string_view)>& read) const;
+
+    // Bytes stored in this arena, and in every arena alive in the process.
+    std::size_t keptBytes() const { return kept_.load(std::memory_order_relaxed); }
+    static std::size_t keptInAll();
 
 private:
     struct Chunk {
@@ -42,6 +54,7 @@ private:
     const char* bytesOf(std::uint32_t index) const;
 
     mutable std::mutex mutex_;
+    std::atomic<std::size_t> kept_{0};
     std::vector<Chunk> chunks_;
     // The last compressed chunk a read expanded, kept for the reads after it: entries
     // are read one by one, in the order they were written.

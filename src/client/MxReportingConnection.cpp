@@ -214,7 +214,26 @@ void MxReportingConnection::deliver(const Value& message)
     if (response->error.isNil())
         done(0, response->result);
     else
-        done(-EINVAL, response->error);
+        done(errorOf(response->error), response->error);
+}
+
+// The connection layer's refusals: a limit of the daemon's names itself in the
+// message its error carries, and each has an errno of its own.
+int MxReportingConnection::errorOf(const Value& error)
+{
+    const Dictionary* fields = error.asDictionary();
+    const Value* code = fields ? fields->find("code") : nullptr;
+    const Value* message = fields ? fields->find("message") : nullptr;
+    if (!code || code->int64Value() != kDaemonLimitCode || !message || !message->asString())
+        return -EINVAL;
+    const std::string& text = *message->asString();
+    if (text.starts_with("too many sessions"))
+        return -EMFILE;
+    if (text.starts_with("too many reporter IDs"))
+        return -E2BIG;
+    if (text.starts_with("the session keeps too much"))
+        return -ENOSPC;
+    return -EINVAL;
 }
 
 void MxReportingConnection::writeMore()

@@ -105,6 +105,9 @@ private:
     void send(Request request);
     void readMore();
     void deliver(const Value& message);
+    // The errno of an error the daemon's connection layer answered with.
+    static int errorOf(const Value& error);
+    static constexpr std::int64_t kDaemonLimitCode = 3;
     void writeMore();
     void lose(const std::string& why);
     void reconnectLater();

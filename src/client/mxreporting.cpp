@@ -211,6 +211,12 @@ const char* mxr_strerror(int error)
         return "The daemon's socket does not exist (is mxreportingd running?)";
     case EACCES:
         return "Permission denied on the daemon's socket (is the user in its group?)";
+    case EMFILE:
+        return "The daemon holds as many sessions as it takes: none was made";
+    case E2BIG:
+        return "More reporter IDs than one message may name: nothing was sent";
+    case ENOSPC:
+        return "A session the message reaches keeps as much as it may this period: nothing was sent";
     default: {
         const char* text = strerrordesc_np(-error);
         return text ? text : "Unknown error";

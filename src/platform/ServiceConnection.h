@@ -11,15 +11,18 @@
 #include <string>
 #include <sys/types.h>
 
+#include "platform/UniqueFunction.h"
 #include "value/Value.h"
 
 namespace mx {
 
 class ServiceListener;
 
-// Why a request could not be handed to the service. The connection stays usable.
+// Why a request could not be handed to the service, or was refused whole at one of
+// its limits (nothing of it was done). The connection stays usable.
 inline constexpr std::int64_t kServiceErrorUnknownMethod = 1;
 inline constexpr std::int64_t kServiceErrorBadArguments = 2;
+inline constexpr std::int64_t kServiceErrorLimit = 3;
 
 struct ServiceError {
     std::int64_t code = 0;
@@ -48,6 +51,12 @@ public:
     virtual ~ServiceExportedObject() = default;
     // `params` is nothing when the request's parameters are not an array.
     virtual void handleRequest(const std::string& method, const Array* params, std::shared_ptr<ServiceReply> reply) = 0;
+    // Whether the client owes the service so much (what its requests left to be written)
+    // that no further request of its should be read yet. Any thread; cheap.
+    virtual bool overdrawn() const = 0;
+    // Runs `resume` once the client may be read again: on the thread that settles
+    // enough of its debt, or here, at once, when it may already.
+    virtual void whenSettled(UniqueFunction<void()> resume) = 0;
 };
 
 class ServiceConnection {

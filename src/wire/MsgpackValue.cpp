@@ -195,4 +195,78 @@ void encodeMsgpack(msgpack::packer<msgpack::sbuffer>& packer, const Value& value
     }
 }
 
+namespace {
+
+// A string's, binary's or container's header: its length in the smallest form.
+std::size_t lengthHeaderBytes(std::size_t length, std::size_t fixedBelow)
+{
+    if (length < fixedBelow)
+        return 1;
+    if (length <= 0xFF && fixedBelow != 16)
+        return 2;
+    return length <= 0xFFFF ? 3 : 5;
+}
+
+std::size_t unsignedBytes(std::uint64_t number)
+{
+    if (number < 0x80)
+        return 1;
+    if (number <= 0xFF)
+        return 2;
+    if (number <= 0xFFFF)
+        return 3;
+    return number <= 0xFFFFFFFF ? 5 : 9;
+}
+
+std::size_t signedBytes(std::int64_t number)
+{
+    if (number >= 0)
+        return unsignedBytes(static_cast<std::uint64_t>(number));
+    if (number >= -32)
+        return 1;
+    if (number >= -0x80)
+        return 2;
+    if (number >= -0x8000)
+        return 3;
+    return number >= -0x80000000LL ? 5 : 9;
+}
+
+} // namespace
+
+std::size_t encodedMsgpackBytes(const Value& value)
+{
+    switch (value.kind()) {
+    case Value::Kind::Nil:
+    case Value::Kind::Bool:
+        return 1;
+    case Value::Kind::Int:
+        return signedBytes(*value.asInt());
+    case Value::Kind::UInt:
+        return unsignedBytes(*value.asUInt());
+    case Value::Kind::Double:
+        return 9;
+    case Value::Kind::String:
+        return lengthHeaderBytes(value.asString()->size(), 32) + value.asString()->size();
+    case Value::Kind::Date: {
+        auto seconds = std::chrono::floor<std::chrono::seconds>(value.asDate()->time_since_epoch()).count();
+        return seconds >= 0 && seconds < (std::int64_t(1) << 34) ? 10 : 15;
+    }
+    case Value::Kind::Data:
+        return lengthHeaderBytes(value.asData()->size(), 0) + value.asData()->size();
+    case Value::Kind::Array: {
+        std::size_t bytes = lengthHeaderBytes(value.asArray()->size(), 16);
+        for (const auto& item : *value.asArray())
+            bytes += encodedMsgpackBytes(item);
+        return bytes;
+    }
+    case Value::Kind::Dictionary: {
+        std::size_t bytes = lengthHeaderBytes(value.asDictionary()->size(), 16);
+        for (const auto& [key, item] : *value.asDictionary())
+            bytes += lengthHeaderBytes(key.size(), 32) + key.size() + encodedMsgpackBytes(item);
+        return bytes;
+    }
+    }
+    return 0;
+}
+
 } // namespace mx

@@ -21,5 +21,7 @@ std::optional<Value> decodeMsgpack(const msgpack::object& object, std::string& r
                                    std::size_t maximumDepth = kMsgpackMaximumDepth);
 
 void encodeMsgpack(msgpack::packer<msgpack::sbuffer>& packer, const Value& value);
+// The bytes encodeMsgpack writes for `value`, without writing them.
+std::size_t encodedMsgpackBytes(const Value& value);
 
 } // namespace mx

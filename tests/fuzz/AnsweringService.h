@@ -14,7 +14,7 @@ class AnsweringService final : public MxReportingServiceProtocol {
 public:
     explicit AnsweringService(bool likeTheService) : likeTheService_(likeTheService) {}
 
-    void createReportingSession(ReporterID, MxBoolReply reply) override { reply(true); }
+    void createReportingSession(ReporterID, MxCreateReply reply) override { reply(true); }
     void setServiceType(ServiceType, ReporterID, MxBoolReply reply) override { reply(true); }
     void getServiceNameForReporterID(ReporterID, MxServiceTypeReply reply) override
     {

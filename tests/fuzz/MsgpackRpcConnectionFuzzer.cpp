@@ -46,8 +46,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     bool invalidated = false;
     {
         auto connection = std::make_shared<MsgpackRpcConnection>(std::move(socket), 1);
-        connection->setExportedObject(
-            std::make_shared<MxReportingRequestDispatch>(std::make_shared<AnsweringService>(true), answerStatus));
+        connection->setExportedObject(std::make_shared<MxReportingRequestDispatch>(
+            std::make_shared<AnsweringService>(true), answerStatus, nullptr));
         connection->setInvalidationHandler([&] { invalidated = true; });
         connection->resume();
     }

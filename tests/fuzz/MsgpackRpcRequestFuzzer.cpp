@@ -34,7 +34,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     ++data;
     --size;
     MsgpackRpcDecoder decoder(1 << 16);
-    MxReportingRequestDispatch dispatch(std::make_shared<AnsweringService>(false), answerStatus);
+    MxReportingRequestDispatch dispatch(std::make_shared<AnsweringService>(false), answerStatus, nullptr);
     for (std::size_t offset = 0; offset < size; offset += chunk) {
         std::size_t count = std::min(chunk, size - offset);
         decoder.feed(reinterpret_cast<const char*>(data + offset), count);

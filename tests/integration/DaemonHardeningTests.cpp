@@ -14,6 +14,8 @@
 #include <gtest/gtest.h>
 
 #include "integration/IntegrationHelpers.h"
+#include "wire/MsgpackRpcMessage.h"
+#include "wire/MsgpackValue.h"
 
 namespace mx::testing {
 namespace {
@@ -26,50 +28,91 @@ protected:
     DaemonProcess daemon;
 };
 
-// A held start reply is no request waiting for work: a client holding hundreds is read
-// on, and stops them all. What bounds it instead is the number of its sessions.
-TEST_F(DaemonHardeningTest, HeldStartRepliesNeverStopAClientWhoseSessionsAreBounded)
+// Requests written in one go on a raw connection, and their responses read back in
+// the order of their msgids: what a pipelining client sees.
+std::vector<RpcResponse> exchange(RawConnection& connection, const std::vector<std::pair<std::string, Array>>& requests,
+                                  std::size_t responses)
 {
-    auto client = connect();
-    constexpr int kStarted = 600;
-    for (std::int64_t id = 1; id <= kStarted; ++id) {
-        ASSERT_EQ(client->createSession(id), 0);
-        ASSERT_EQ(client->startSession(id), 0);
+    msgpack::sbuffer bytes;
+    for (std::size_t i = 0; i < requests.size(); ++i)
+        encodeRpcRequest(bytes, static_cast<std::uint32_t>(i), requests[i].first, requests[i].second);
+    EXPECT_TRUE(connection.send(std::string(bytes.data(), bytes.size())));
+    std::vector<RpcResponse> answered(requests.size());
+    msgpack::unpacker unpacker;
+    for (std::size_t got = 0; got < responses;) {
+        unpacker.reserve_buffer(65536);
+        ssize_t length = ::recv(connection.fd(), unpacker.buffer(), 65536, 0);
+        if (length <= 0)
+            break;
+        unpacker.buffer_consumed(std::size_t(length));
+        for (msgpack::object_handle handle; unpacker.next(handle); ++got) {
+            std::string reason;
+            auto response = parseRpcResponse(*decodeMsgpack(handle.get(), reason), reason);
+            answered[response->msgid] = *response;
+        }
     }
-    for (std::int64_t id = 1; id <= kStarted; ++id)
-        ASSERT_EQ(client->stopSession(id), 0) << "stop " << id;
-
-    for (std::int64_t id = kStarted + 1; id <= 1100; ++id)
-        ASSERT_EQ(client->createSession(id), 0);
-    std::vector<std::int64_t> reporters;
-    ASSERT_EQ(client->reporters(reporters), 0);
-    EXPECT_EQ(reporters.size(), 1024u) << "a client holds at most 1024 sessions";
-    EXPECT_TRUE(daemon.waitForLog(fmt::format(
-        "session limit reached: client pid {} holds 1024 sessions, none made for reporter 1025", getpid())));
-    EXPECT_EQ(client->createSession(1), 0) << "one it holds may be made anew";
-    EXPECT_EQ(client->destroySession(2), 0);
-    EXPECT_EQ(client->createSession(5000), 0);
-    EXPECT_EQ(validity(*client, 5000), (Dictionary{{"reporterID", 5000}, {"serviceType", 65535}}));
-
-    auto other = connect();
-    EXPECT_EQ(other->createSession(7000), 0);
-    EXPECT_EQ(validity(*other, 7000), (Dictionary{{"reporterID", 7000}, {"serviceType", 65535}}))
-        << "the bound is each client's own";
+    return answered;
 }
 
-// One message reaches at most 1024 reporters: a list repeating one ID a million times
-// is refused as a bad argument, not turned into a million reports.
-TEST_F(DaemonHardeningTest, AMessageNamesAtMostAThousandAndTwentyFourReporters)
+std::vector<std::pair<std::string, Array>> creates(std::int64_t first, std::int64_t last)
+{
+    std::vector<std::pair<std::string, Array>> requests;
+    for (std::int64_t id = first; id <= last; ++id)
+        requests.push_back({"createReportingSession:reply:", Array{id}});
+    return requests;
+}
+
+// Sessions are bounded on each connection and in the whole service, and a create past
+// either is refused whole, with the limit named, never answered as if it made one. A
+// held start reply is no request waiting for work: a client holding hundreds is read on.
+TEST_F(DaemonHardeningTest, SessionsAreBoundedPerConnectionAndInAllAndACreatePastEitherIsRefused)
+{
+    RawConnection first(daemon.socketPath());
+    auto answered = exchange(first, creates(1, 4097), 4097);
+    EXPECT_EQ(answered[4095].result, Value(true));
+    EXPECT_EQ(answered[4096].error,
+              Value(Dictionary{{"code", 3}, {"message", "too many sessions on this connection (4096)"}}));
+    EXPECT_TRUE(daemon.waitForLog("no session made for reporter 4097"));
+
+    std::vector<std::pair<std::string, Array>> held;
+    for (std::int64_t id = 1; id <= 600; ++id)
+        held.push_back({"startReportingSessionForID:reply:", Array{id}});
+    held.push_back({"createReportingSession:reply:", Array{1}});
+    answered = exchange(first, held, 1);
+    EXPECT_EQ(answered[600].result, Value(true)) << "600 held replies, and a session made anew under its own ID";
+
+    std::vector<std::unique_ptr<RawConnection>> others;
+    for (std::int64_t connection = 1; connection <= 3; ++connection) {
+        others.push_back(std::make_unique<RawConnection>(daemon.socketPath()));
+        auto made = exchange(*others.back(), creates(connection * 10000, connection * 10000 + 4095), 4096);
+        ASSERT_EQ(made.back().result, Value(true)) << "connection " << connection;
+    }
+    auto client = connect();
+    EXPECT_EQ(client->createSession(99999), -EMFILE) << "16384 in the service";
+    std::vector<std::int64_t> reporters;
+    ASSERT_EQ(client->reporters(reporters), 0);
+    EXPECT_EQ(reporters.size(), 16384u);
+    EXPECT_EQ(validity(*client, 99999), (Dictionary{{"reporterID", 0}, {"serviceType", 65535}})) << "nothing made";
+    EXPECT_TRUE(daemon.waitForLog("too many sessions in the service (16384)"));
+
+    EXPECT_EQ(client->destroySession(1), 0) << "not its own: destroys nothing";
+    others.back().reset();
+    EXPECT_TRUE(waitUntil([&] { return client->createSession(99999) == 0; }))
+        << "a client that left frees its sessions";
+}
+
+// One message names at most 4096 reporters, each of which it reaches, repeats too;
+// past that it is refused whole.
+TEST_F(DaemonHardeningTest, AMessageNamesUpTo4096ReportersRepeatsIncluded)
 {
     auto client = connect();
     ASSERT_EQ(client->createSession(5), 0);
     mxr::Payload report;
     report.add("k", 1);
-    EXPECT_EQ(client->send(report, 3, 1, std::vector<std::int64_t>(1'000'000, 5)), -EINVAL)
-        << "refused as a bad argument";
-    EXPECT_EQ(client->send(report, 3, 1, std::vector<std::int64_t>(1024, 5)), 0);
+    EXPECT_EQ(client->send(report, 3, 1, std::vector<std::int64_t>(4097, 5)), -E2BIG);
+    EXPECT_EQ(client->send(report, 3, 1, std::vector<std::int64_t>(4096, 5)), 0);
     EXPECT_TRUE(waitUntil([&] {
-        return daemon.query("tally", "SELECT count(*) FROM events WHERE name LIKE '%Playback.Start'")[0][0] == "1024";
+        return daemon.query("tally", "SELECT count(*) FROM events WHERE name LIKE '%Playback.Start'")[0][0] == "4096";
     }));
 }
 

@@ -14,9 +14,9 @@ namespace mx {
 namespace {
 
 // The reporters one message may name: each costs the message its sinks' events and a
-// delivery, so a list repeating one ID a million times is no message but a flood.
-constexpr std::size_t kMaximumReporterIDs = 1024;
-constexpr const char* kReporterIDsBound = "an array of at most 1024 reporter IDs or nil";
+// delivery, so that no one request holds the server queue for long. Past it the
+// message is refused whole, as at every limit.
+constexpr std::size_t kMaximumReporterIDs = 4096;
 
 // Reads the arguments of one request, remembering the first that does not fit.
 class Arguments {
@@ -69,10 +69,13 @@ public:
         if (params_[index].isNil())
             return std::nullopt;
         const Array* array = params_[index].asArray();
-        if (array && array->size() <= kMaximumReporterIDs)
-            return *array;
-        refuse(index, array ? kReporterIDsBound : "an array of reporter IDs or nil");
-        return std::nullopt;
+        if (!array) {
+            refuse(index, "an array of reporter IDs or nil");
+            return std::nullopt;
+        }
+        if (array->size() > kMaximumReporterIDs && !error_)
+            error_ = ServiceError{kServiceErrorLimit, fmt::format("too many reporter IDs ({})", kMaximumReporterIDs)};
+        return *array;
     }
 
     const std::optional<ServiceError>& error() const { return error_; }
@@ -105,6 +108,14 @@ MxBoolReply boolReply(const Responder& responder)
     };
 }
 
+// A limit met is the connection layer's error: a reply of the protocol never says it.
+std::function<void(const std::string&)> limitRefusal(const Responder& responder)
+{
+    return [responder](const std::string& limit) {
+        responder->fail({kServiceErrorLimit, limit});
+    };
+}
+
 // The four operations that take a reporter ID and answer with a bool.
 Operation reporterOperation(void (MxReportingServiceProtocol::*call)(ReporterID, MxBoolReply))
 {
@@ -119,7 +130,12 @@ const std::map<std::string, Operation, std::less<>>& operations()
 {
     static const std::map<std::string, Operation, std::less<>> table = {
         {std::string(method::kCreateReportingSession),
-         reporterOperation(&MxReportingServiceProtocol::createReportingSession)},
+         {1,
+          [](auto& service, auto& args, const Responder& responder) {
+              auto id = args.reporterID(0);
+              if (!args.error())
+                  service.createReportingSession(id, MxCreateReply(boolReply(responder), limitRefusal(responder)));
+          }}},
         {std::string(method::kSetServiceType),
          {2,
           [](auto& service, auto& args, const Responder& responder) {
@@ -162,12 +178,14 @@ const std::map<std::string, Operation, std::less<>>& operations()
               if (!args.error())
                   service.sendMessage(
                       std::move(payload), category, type, std::move(ids),
-                      [responder](std::optional<MxReportingError> error) {
-                          if (!error)
-                              responder->respond(Value());
-                          else
-                              responder->respond(Dictionary{{"domain", error->domain}, {"code", error->code}});
-                      });
+                      MxErrorReply(
+                          [responder](std::optional<MxReportingError> error) {
+                              if (!error)
+                                  responder->respond(Value());
+                              else
+                                  responder->respond(Dictionary{{"domain", error->domain}, {"code", error->code}});
+                          },
+                          limitRefusal(responder)));
           }}},
         {std::string(method::kStopReportingSessionForID),
          reporterOperation(&MxReportingServiceProtocol::stopReportingSessionForID)},
@@ -199,9 +217,20 @@ const std::map<std::string, Operation, std::less<>>& operations()
 } // namespace
 
 MxReportingRequestDispatch::MxReportingRequestDispatch(std::shared_ptr<MxReportingServiceProtocol> service,
-                                                       StatusRequest status)
-    : service_(std::move(service)), status_(std::move(status))
+                                                       StatusRequest status, std::shared_ptr<BacklogAccount> backlog)
+    : service_(std::move(service)), status_(std::move(status)), backlog_(std::move(backlog))
 {
+}
+
+bool MxReportingRequestDispatch::overdrawn() const { return backlog_ && backlog_->overdrawn(); }
+
+void MxReportingRequestDispatch::whenSettled(UniqueFunction<void()> resume)
+{
+    if (!backlog_) {
+        resume();
+        return;
+    }
+    backlog_->whenSettled(std::move(resume));
 }
 
 void MxReportingRequestDispatch::handleRequest(const std::string& method, const Array* params,

@@ -1,5 +1,6 @@
 #include "Statistics/Service/MxReportingServerInstance.h"
 
+#include <algorithm>
 #include <cassert>
 #include <cstdlib>
 
@@ -21,19 +22,15 @@ constexpr std::uint32_t kTraceMessage = 0x21042824;
 
 constexpr int kKillServiceExitStatus = 2;
 
-// A broadcast's log lines name the sessions it reaches: the first few of them, so that
-// a line stays a line however many sessions there are.
-constexpr std::size_t kSessionsListed = 16;
-
+// The sessions a message reaches, in a log line: every one of them, as the listing
+// of a client's sessions gives them.
 std::string describeSessions(const std::vector<std::shared_ptr<MxReportingSession>>& sessions)
 {
     std::string text = "(";
-    for (std::size_t i = 0; i < sessions.size() && i < kSessionsListed; ++i) {
+    for (std::size_t i = 0; i < sessions.size(); ++i) {
         text += i == 0 ? "" : ", ";
         text += sessions[i]->description();
     }
-    if (sessions.size() > kSessionsListed)
-        text += fmt::format(", and {} more", sessions.size() - kSessionsListed);
     return text + ")";
 }
 
@@ -64,115 +61,27 @@ std::string MxReportingServerInstance::description() const
     return fmt::format("<MxReportingServerInstance pid={}>", processIdentifier_);
 }
 
-// A message on its way to its sessions, a step at a time.
+// A message on its way to its sessions.
 struct MxReportingServerInstance::FanOut {
     Dictionary payload;
     MessageCategory category;
     MessageType type;
     std::optional<Array> reportingIDs;
     MxErrorReply reply;
-    bool begun = false;
-    // Without an ID list: the sessions started when the message came.
-    std::vector<std::shared_ptr<MxReportingSession>> sessions;
-    std::size_t next = 0; // the next ID, or the next session
 };
 
-// A start or a stop, which reads the drivers' channels on the way.
-struct MxReportingServerInstance::Sampling {
-    ReporterID reporterID;
-    std::shared_ptr<MxReportingSession> session; // once found
-    std::shared_ptr<MxReportingDriverSnapShot> snapShot;
-    std::optional<Dictionary> statistics;
-};
-
+// The work holds the endpoint weakly: one that is gone before its request runs leaves
+// nothing to do, and nobody to answer.
+template <class Work>
 void MxReportingServerInstance::enqueue(Work work, std::size_t weight)
 {
-    {
-        std::lock_guard lock(pendingMutex_);
-        pending_.push_back({std::move(work), weight});
-        if (std::exchange(scheduled_, true))
+    serverQueue_->dispatch([weakSelf = weak_from_this(), work = std::move(work), weight]() mutable {
+        auto self = weakSelf.lock();
+        if (!self)
             return;
-    }
-    scheduleTurn();
-}
-
-template <class Handler>
-void MxReportingServerInstance::enqueueOnce(Handler handler)
-{
-    enqueue([handler = std::move(handler)](MxReportingServerInstance& self) mutable {
-        handler(self);
-        return Step::Done;
+        ScopedBacklogAccount charging(self->backlog_, weight);
+        work(*self);
     });
-}
-
-// A turn holds the endpoint weakly: one that is gone before its turn leaves nothing
-// to do, and nobody to answer.
-void MxReportingServerInstance::scheduleTurn()
-{
-    serverQueue_->dispatch([weakSelf = weak_from_this()] {
-        if (auto self = weakSelf.lock())
-            self->runTurn();
-    });
-}
-
-void MxReportingServerInstance::resume() { scheduleTurn(); }
-
-void MxReportingServerInstance::runTurn()
-{
-    assert(serverQueue_->isCurrent());
-    for (int steps = 0; steps < kStepsPerTurn; ++steps) {
-        if (backlog_->overdrawn()) {
-            // Its next turn comes once what it owes is written; the line stays
-            // scheduled meanwhile, so nothing else starts one.
-            heldBack_.store(true);
-            backlog_->whenSettled([weakSelf = weak_from_this()] {
-                if (auto self = weakSelf.lock()) {
-                    self->heldBack_.store(false);
-                    self->scheduleTurn();
-                }
-            });
-            return;
-        }
-        Pending* next = nullptr;
-        {
-            std::lock_guard lock(pendingMutex_);
-            if (pending_.empty()) {
-                scheduled_ = false;
-                return;
-            }
-            next = &pending_.front();
-        }
-        Step step = Step::Done;
-        {
-            ScopedBacklogAccount charging(backlog_, next->weight);
-            step = next->work(*this);
-        }
-        if (step == Step::Wait)
-            return;
-        if (step == Step::Done) {
-            Pending done;
-            std::lock_guard lock(pendingMutex_);
-            done = std::move(pending_.front());
-            pending_.pop_front();
-        }
-    }
-    scheduleTurn();
-}
-
-bool MxReportingServerInstance::sampleElsewhere(UniqueFunction<void()> sample)
-{
-    auto root = delegate_.lock();
-    auto queue = root ? root->driverSamplingQueue() : nullptr;
-    if (!queue) {
-        sample();
-        return false;
-    }
-    queue->dispatch([weakSelf = weak_from_this(), sample = std::move(sample)]() mutable {
-        sample();
-        if (auto self = weakSelf.lock())
-            self->resume();
-    });
-    return true;
 }
 
 std::shared_ptr<MxReportingSession> MxReportingServerInstance::findReportingSessionForID(ReporterID reporterID,
@@ -188,12 +97,45 @@ std::shared_ptr<MxReportingSession> MxReportingServerInstance::findReportingSess
     return root ? root->findReportingSessionForID(reporterID) : nullptr;
 }
 
+const std::string& MxReportingServerInstance::sessionListing()
+{
+    assert(serverQueue_->isCurrent());
+    if (!sessionListing_) {
+        std::vector<std::shared_ptr<MxReportingSession>> sessions;
+        sessions.reserve(clientReportingSessionMap_.size());
+        for (const auto& [id, session] : clientReportingSessionMap_)
+            sessions.push_back(session);
+        sessionListing_ = describeSessions(sessions);
+    }
+    return *sessionListing_;
+}
+
+void MxReportingServerInstance::sessionChanged(ReporterID reporterID, const MxReportingSession& session)
+{
+    assert(serverQueue_->isCurrent());
+    auto held = clientReportingSessionMap_.find(reporterID);
+    // A session replaced under its ID, or destroyed, is no longer this client's.
+    if (held == clientReportingSessionMap_.end() || held->second.get() != &session)
+        return;
+    sessionListing_.reset();
+    if (session.started())
+        startedSessions_[reporterID] = held->second;
+    else
+        startedSessions_.erase(reporterID);
+}
+
+void MxReportingServerInstance::forgetSession(ReporterID reporterID)
+{
+    startedSessions_.erase(reporterID);
+    sessionListing_.reset();
+}
+
 // ---- Entry points: connection layer threads. Log and queue, nothing else.
 
-void MxReportingServerInstance::createReportingSession(ReporterID reporterID, MxBoolReply reply)
+void MxReportingServerInstance::createReportingSession(ReporterID reporterID, MxCreateReply reply)
 {
     MXLOG_VERBOSE(logScope(), "creating session for reporter {}", reporterID);
-    enqueueOnce([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleCreate(reporterID, reply);
     });
 }
@@ -201,7 +143,7 @@ void MxReportingServerInstance::createReportingSession(ReporterID reporterID, Mx
 void MxReportingServerInstance::setServiceType(ServiceType serviceType, ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "setting service type {} for reporter {}", serviceType, reporterID);
-    enqueueOnce([serviceType, reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueue([serviceType, reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleSetServiceType(serviceType, reporterID, reply);
     });
 }
@@ -211,7 +153,7 @@ void MxReportingServerInstance::getServiceNameForReporterID(ReporterID reporterI
     // Intended: the log texts of this endpoint keep their spelling ("seviceType",
     // "returnning", the doubled space), which log searches rely on.
     MXLOG_VERBOSE(logScope(), "fetching seviceType");
-    enqueueOnce([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleGetServiceName(reporterID, reply);
     });
 }
@@ -220,17 +162,16 @@ void MxReportingServerInstance::setConfiguration(std::optional<Dictionary> confi
                                                  MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "setting configuration");
-    enqueueOnce([configuration = std::move(configuration), reporterID,
-                 reply = std::move(reply)](MxReportingServerInstance& self) {
-        self.handleSetConfiguration(configuration, reporterID, reply);
-    });
+    enqueue([configuration = std::move(configuration), reporterID, reply = std::move(reply)](
+                MxReportingServerInstance& self) { self.handleSetConfiguration(configuration, reporterID, reply); });
 }
 
 void MxReportingServerInstance::startReportingSessionForID(ReporterID reporterID, MxHeldReply reply)
 {
     MXLOG_VERBOSE(logScope(), "starting session for reporter {}", reporterID);
-    enqueue([start = std::make_shared<Sampling>(Sampling{reporterID, nullptr, nullptr, std::nullopt}),
-             reply = std::move(reply)](MxReportingServerInstance& self) { return self.handleStart(start, reply); });
+    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+        self.handleStart(reporterID, reply);
+    });
 }
 
 void MxReportingServerInstance::sendMessage(Dictionary payload, MessageCategory category, MessageType type,
@@ -241,21 +182,22 @@ void MxReportingServerInstance::sendMessage(Dictionary payload, MessageCategory 
     // What each row and delivery it leaves behind is charged: the payload they share.
     std::size_t weight = approximateBytes(Value(payload));
     enqueue([message = FanOut{std::move(payload), category, type, std::move(reportingIDs), std::move(reply)}](
-                MxReportingServerInstance& self) mutable { return self.handleSendMessage(message); },
+                MxReportingServerInstance& self) mutable { self.handleSendMessage(message); },
             weight);
 }
 
 void MxReportingServerInstance::stopReportingSessionForID(ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "stopping session for reporter {}", reporterID);
-    enqueue([stop = std::make_shared<Sampling>(Sampling{reporterID, nullptr, nullptr, std::nullopt}),
-             reply = std::move(reply)](MxReportingServerInstance& self) { return self.handleStop(stop, reply); });
+    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+        self.handleStop(reporterID, reply);
+    });
 }
 
 void MxReportingServerInstance::destroyReportingSession(ReporterID reporterID, MxBoolReply reply)
 {
     MXLOG_VERBOSE(logScope(), "destroying session for reporter {}", reporterID);
-    enqueueOnce([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
+    enqueue([reporterID, reply = std::move(reply)](MxReportingServerInstance& self) {
         self.handleDestroy(reporterID, reply);
     });
 }
@@ -263,14 +205,14 @@ void MxReportingServerInstance::destroyReportingSession(ReporterID reporterID, M
 void MxReportingServerInstance::reporterID(ReporterID reporterID, MxDictionaryReply valid)
 {
     MXLOG_VERBOSE(logScope(), "validating reporter {}", reporterID);
-    enqueueOnce([reporterID, valid = std::move(valid)](MxReportingServerInstance& self) {
+    enqueue([reporterID, valid = std::move(valid)](MxReportingServerInstance& self) {
         self.handleValid(reporterID, valid);
     });
 }
 
 void MxReportingServerInstance::getAllReporters(MxReportersReply reply)
 {
-    enqueueOnce([reply = std::move(reply)](MxReportingServerInstance& self) { self.handleGetAllReporters(reply); });
+    enqueue([reply = std::move(reply)](MxReportingServerInstance& self) { self.handleGetAllReporters(reply); });
 }
 
 void MxReportingServerInstance::killService(MxBoolReply)
@@ -281,23 +223,37 @@ void MxReportingServerInstance::killService(MxBoolReply)
 
 void MxReportingServerInstance::handleConnectionError()
 {
-    enqueueOnce([](MxReportingServerInstance& self) { self.handleDisconnection(); });
+    enqueue([](MxReportingServerInstance& self) { self.handleDisconnection(); });
 }
 
 // ---- Work: server queue.
 
-void MxReportingServerInstance::handleCreate(ReporterID reporterID, const MxBoolReply& reply)
+void MxReportingServerInstance::handleCreate(ReporterID reporterID, const MxCreateReply& reply)
 {
     MxTrace(kTraceCreate);
-    if (clientReportingSessionMap_.size() >= kMaximumSessions && !clientReportingSessionMap_.contains(reporterID)) {
-        MXLOG(logScope(), Error,
-              "session limit reached: client pid {} holds {} sessions, none made for reporter {} (destroy one first)",
-              processIdentifier_, clientReportingSessionMap_.size(), reporterID);
-        reply(true);
-        return;
+    // A session made anew under an ID this client holds replaces it: it counts against
+    // no limit.
+    if (!clientReportingSessionMap_.contains(reporterID)) {
+        auto root = delegate_.lock();
+        std::optional<std::string> limit;
+        if (clientReportingSessionMap_.size() >= kMaximumSessions)
+            limit = fmt::format("too many sessions on this connection ({})", kMaximumSessions);
+        else if (root && root->sessionsHeld() >= kMaximumSessionsInService)
+            limit = fmt::format("too many sessions in the service ({})", kMaximumSessionsInService);
+        if (limit) {
+            MXLOG_LIMITED(logScope(), Error, "no session made for reporter {} of client pid {}: {}", reporterID,
+                          processIdentifier_, *limit);
+            reply.refuse(*limit);
+            return;
+        }
     }
-    clientReportingSessionMap_[reporterID] =
-        std::make_shared<MxReportingSession>(reporterID, std::vector<std::int32_t>{processIdentifier_});
+    auto session = std::make_shared<MxReportingSession>(reporterID, std::vector<std::int32_t>{processIdentifier_});
+    session->setChangeObserver([weakSelf = weak_from_this(), reporterID](const MxReportingSession& changed) {
+        if (auto self = weakSelf.lock())
+            self->sessionChanged(reporterID, changed);
+    });
+    forgetSession(reporterID);
+    clientReportingSessionMap_[reporterID] = std::move(session);
     MXLOG(logScope(), Default, "session created for reporter {}", reporterID);
     reply(true);
 }
@@ -333,140 +289,158 @@ void MxReportingServerInstance::handleSetConfiguration(const std::optional<Dicti
     reply(true);
 }
 
-MxReportingServerInstance::Step MxReportingServerInstance::handleStart(const std::shared_ptr<Sampling>& start,
-                                                                       const MxHeldReply& reply)
+void MxReportingServerInstance::handleStart(ReporterID reporterID, const MxHeldReply& reply)
 {
-    if (!start->session) {
-        MxTrace(kTraceStart);
-        if (start->reporterID == 0) {
-            reply(true);
-            return Step::Done;
-        }
-        auto session = findReportingSessionForID(start->reporterID, true);
-        if (!session || session->started()) {
-            reply(true);
-            return Step::Done;
-        }
-        session->start();
-        start->session = session;
-        reply.hold();
-        // The snapshot is taken where reading the channels holds up no other client;
-        // this client's later requests wait for it, as they would have in place.
-        if (auto root = delegate_.lock()) {
-            root->noteSessionStarted();
-            if (sampleElsewhere([start, root] { start->snapShot = root->getSnapShot(); }))
-                return Step::Wait;
-        }
+    MxTrace(kTraceStart);
+    if (reporterID == 0) {
+        reply(true);
+        return;
     }
-    start->session->setDriverSnapShot(start->snapShot);
-    start->session->parkTransactionCompleteBlock(reply);
-    return Step::Done;
+    auto session = findReportingSessionForID(reporterID, true);
+    if (!session || session->started()) {
+        reply(true);
+        return;
+    }
+    session->start();
+    if (auto root = delegate_.lock()) {
+        root->noteSessionStarted();
+        session->setDriverSnapShot(root->getSnapShot());
+    }
+    reply.hold();
+    session->parkTransactionCompleteBlock(reply);
 }
 
-MxReportingServerInstance::Step MxReportingServerInstance::handleSendMessage(FanOut& message)
+void MxReportingServerInstance::handleSendMessage(FanOut& message)
 {
-    if (!message.begun && !beginSendMessage(message))
-        return Step::Done;
-    if (message.reportingIDs) {
-        const Array& ids = *message.reportingIDs;
-        for (std::size_t end = std::min(message.next + kSessionsPerStep, ids.size()); message.next < end;
-             ++message.next) {
-            ReporterID reporterID = ids[message.next].int64Value();
-            if (reporterID == 0)
-                continue;
-            auto session = findReportingSessionForID(reporterID, true);
-            if (!session)
-                continue;
-            Dictionary userInfo = session->userInfo()->snapshot();
-            MxReportingTallyBridge::handleEvent(message.payload, message.category, message.type, userInfo);
-            MxReportingJouleUtility::handleEvent(message.payload, message.category, message.type, userInfo);
-            session->sendMessage(message.payload, message.category, message.type, nullptr);
-        }
-        if (message.next < ids.size())
-            return Step::Again;
-    } else {
-        const auto& sessions = message.sessions;
-        for (std::size_t end = std::min(message.next + kSessionsPerStep, sessions.size()); message.next < end;
-             ++message.next) {
-            const auto& session = sessions[message.next];
-            // Stopped since the message came: it is as if the stop came first.
-            if (!session->started())
-                continue;
-            session->sendMessage(message.payload, message.category, message.type, nullptr);
-            Dictionary userInfo = session->userInfo()->snapshot();
-            MxReportingTallyBridge::handleEvent(message.payload, message.category, message.type, userInfo);
-            MxReportingJouleUtility::handleEvent(message.payload, message.category, message.type, userInfo);
-        }
-        if (message.next < sessions.size())
-            return Step::Again;
-    }
-    message.reply(std::nullopt);
-    return Step::Done;
-}
-
-bool MxReportingServerInstance::beginSendMessage(FanOut& message)
-{
-    message.begun = true;
     MxTrace(kTraceMessage);
     auto root = delegate_.lock();
     if (!root || !root->isReportingEnabled()) {
         message.reply(MxReportingError{kMxReportingErrorDomain, kMxReportingDisabledErrorCode});
-        return false;
+        return;
+    }
+    // Looked at before anything is done, without a trace in the log: a message past a
+    // limit is refused whole.
+    if (auto limit = keepingLimit(message, sessionsKeeping(message, *root), *root)) {
+        MXLOG_LIMITED(logScope(), Error, "message of client pid {} refused: {}", processIdentifier_, *limit);
+        message.reply.refuse(*limit);
+        return;
     }
     root->noteReportReceived();
     if (message.reportingIDs)
-        return true;
-    for (const auto& client : root->getAllClients()) {
-        std::vector<std::shared_ptr<MxReportingSession>> sessions;
-        for (const auto& [id, session] : client->clientReportingSessionMap())
-            sessions.push_back(session);
-        MXLOG(logScope(), Default, "sessions for client {} : {}", client->processIdentifier(),
-              describeSessions(sessions));
-        for (auto& session : sessions)
-            if (session->started())
-                message.sessions.push_back(std::move(session));
-    }
-    MXLOG(logScope(), Default, "active reporting sessions {} : {}", message.sessions.size(),
-          describeSessions(message.sessions));
-    if (!message.sessions.empty())
-        return true;
-    MXLOG(logScope(), Default, "no active reporting sessions found, sending as standalone");
-    auto defaults = root->getDefaults();
-    MxReportingSession::sendSingleMessage(message.payload, message.category, message.type, service_type::kStandalone,
-                                          defaults ? &*defaults : nullptr, nullptr);
+        sendToListedSessions(message);
+    else
+        sendToStartedSessions(message, *root);
     message.reply(std::nullopt);
-    return false;
 }
 
-MxReportingServerInstance::Step MxReportingServerInstance::handleStop(const std::shared_ptr<Sampling>& stop,
-                                                                      const MxBoolReply& reply)
+void MxReportingServerInstance::sendToListedSessions(const FanOut& message)
 {
-    if (!stop->session) {
-        MxTrace(kTraceStop);
-        if (stop->reporterID == 0) {
-            reply(true);
-            return Step::Done;
-        }
-        stop->session = findReportingSessionForID(stop->reporterID, false);
-        if (!stop->session) {
-            MXLOG(logScope(), Default, "stopping {}", stop->reporterID);
-            reply(true);
-            return Step::Done;
-        }
-        auto root = delegate_.lock();
-        if (root && sampleElsewhere([stop, root] {
-                stop->statistics = root->getDriverStatisticsRelativeToSnapShot(stop->session->driverSnapShot());
-            }))
-            return Step::Wait;
+    // Every ID in its order, repeats too; unknown ones and 0 reach nobody.
+    for (const auto& id : *message.reportingIDs) {
+        ReporterID reporterID = id.int64Value();
+        if (reporterID == 0)
+            continue;
+        auto session = findReportingSessionForID(reporterID, true);
+        if (!session)
+            continue;
+        // The session comes last here, first for a message without an ID list: both
+        // orders are intended.
+        Dictionary userInfo = session->userInfo()->snapshot();
+        MxReportingTallyBridge::handleEvent(message.payload, message.category, message.type, userInfo);
+        MxReportingJouleUtility::handleEvent(message.payload, message.category, message.type, userInfo);
+        session->sendMessage(message.payload, message.category, message.type, nullptr);
     }
-    auto& session = *stop->session;
-    sendDriverStatistics(session, stop->statistics);
-    session.setDriverSnapShot(nullptr);
-    session.stop();
-    session.completeTransaction();
-    MXLOG(logScope(), Default, "stopping {}", stop->reporterID);
+}
+
+void MxReportingServerInstance::sendToStartedSessions(const FanOut& message, MxReportingServiceDelegateProtocol& root)
+{
+    std::vector<std::shared_ptr<MxReportingSession>> sessions;
+    for (const auto& client : root.getAllClients()) {
+        MXLOG(logScope(), Default, "sessions for client {} : {}", client->processIdentifier(),
+              client->sessionListing());
+        for (const auto& [id, session] : client->startedSessions())
+            sessions.push_back(session);
+    }
+    MXLOG(logScope(), Default, "active reporting sessions {} : {}", sessions.size(), describeSessions(sessions));
+    if (sessions.empty()) {
+        MXLOG(logScope(), Default, "no active reporting sessions found, sending as standalone");
+        auto defaults = root.getDefaults();
+        MxReportingSession::sendSingleMessage(message.payload, message.category, message.type,
+                                              service_type::kStandalone, defaults ? &*defaults : nullptr, nullptr);
+        return;
+    }
+    for (const auto& session : sessions) {
+        session->sendMessage(message.payload, message.category, message.type, nullptr);
+        Dictionary userInfo = session->userInfo()->snapshot();
+        MxReportingTallyBridge::handleEvent(message.payload, message.category, message.type, userInfo);
+        MxReportingJouleUtility::handleEvent(message.payload, message.category, message.type, userInfo);
+    }
+}
+
+std::vector<std::shared_ptr<MxReportingSession>> MxReportingServerInstance::sessionsKeeping(
+    const FanOut& message, MxReportingServiceDelegateProtocol& root) const
+{
+    std::vector<std::shared_ptr<MxReportingSession>> sessions;
+    auto keep = [&](std::shared_ptr<MxReportingSession> session) {
+        if (session && session->keptBytes())
+            sessions.push_back(std::move(session));
+    };
+    if (!message.reportingIDs) {
+        for (const auto& client : root.getAllClients())
+            for (const auto& [id, session] : client->startedSessions())
+                keep(session);
+        return sessions;
+    }
+    for (const auto& id : *message.reportingIDs) {
+        ReporterID reporterID = id.int64Value();
+        if (reporterID == 0)
+            continue;
+        auto own = clientReportingSessionMap_.find(reporterID);
+        keep(own != clientReportingSessionMap_.end() ? own->second : root.lookUpSession(reporterID));
+    }
+    return sessions;
+}
+
+std::optional<std::string> MxReportingServerInstance::keepingLimit(
+    const FanOut& message, const std::vector<std::shared_ptr<MxReportingSession>>& sessions,
+    MxReportingServiceDelegateProtocol& root)
+{
+    if (sessions.empty())
+        return std::nullopt;
+    std::size_t bytes = MxReportingSession::keptBytesOf(message.payload);
+    std::map<const MxReportingSession*, std::size_t> added;
+    std::size_t total = 0;
+    for (const auto& session : sessions) {
+        std::size_t& more = added[session.get()];
+        more += bytes;
+        total += bytes;
+        if (session->keptBytes().value_or(0) + more > MxReportingSession::kMaximumKeptBytes)
+            return fmt::format("the session keeps too much: reporter {} would pass {} MiB this period",
+                               session->reporterID(), MxReportingSession::kMaximumKeptBytes >> 20);
+    }
+    if (root.keptBytesInService() + total > MxReportingSession::kMaximumKeptBytesInService)
+        return fmt::format("the session keeps too much: the service would pass {} MiB kept in all",
+                           MxReportingSession::kMaximumKeptBytesInService >> 20);
+    return std::nullopt;
+}
+
+void MxReportingServerInstance::handleStop(ReporterID reporterID, const MxBoolReply& reply)
+{
+    MxTrace(kTraceStop);
+    if (reporterID == 0) {
+        reply(true);
+        return;
+    }
+    if (auto session = findReportingSessionForID(reporterID, false)) {
+        auto root = delegate_.lock();
+        auto statistics = root ? root->getDriverStatisticsRelativeToSnapShot(session->driverSnapShot()) : std::nullopt;
+        sendDriverStatistics(*session, statistics);
+        session->setDriverSnapShot(nullptr);
+        session->stop();
+        session->completeTransaction();
+    }
+    MXLOG(logScope(), Default, "stopping {}", reporterID);
     reply(true);
-    return Step::Done;
 }
 
 // The drivers' growth goes to the session and to analytics, deliberately not to the
@@ -493,9 +467,11 @@ void MxReportingServerInstance::handleDestroy(ReporterID reporterID, const MxBoo
     }
     auto found = clientReportingSessionMap_.find(reporterID);
     if (found != clientReportingSessionMap_.end()) {
-        if (found->second->started())
-            found->second->stop();
+        auto session = found->second;
+        if (session->started())
+            session->stop();
         clientReportingSessionMap_.erase(found);
+        forgetSession(reporterID);
     }
     MXLOG(logScope(), Default, "destroying {}", reporterID);
     reply(true);

@@ -24,9 +24,6 @@ std::shared_ptr<MxReportingServiceDelegate> MxReportingServiceDelegate::make(Pre
         new MxReportingServiceDelegate(preferences, notifications, processTable));
     root->listenForDefaultsNotification();
     root->driverUtility_ = std::make_unique<MxReportingDriverUtility>(chanstat);
-    if (!root->driverUtility_->ioChannelSubscriptions().empty())
-        root->driverSamplingQueue_ = ProcessWide<Dispatch>::get().makeSerialQueue(
-            "com.kestrel.harmonia.reporting.drivers", QueuePriority::Utility);
     return root;
 }
 
@@ -53,10 +50,12 @@ bool MxReportingServiceDelegate::shouldAcceptNewConnection(ServiceListener&,
         std::lock_guard lock(lock_);
         client = std::make_shared<MxReportingServerInstance>(pid, weak_from_this(), serverQueue_);
         connection->setExportedObject(std::make_shared<MxReportingRequestDispatch>(
-            client, [weakSelf = weak_from_this()](std::function<void(Dictionary)> reply) {
+            client,
+            [weakSelf = weak_from_this()](std::function<void(Dictionary)> reply) {
                 if (auto self = weakSelf.lock())
                     self->requestStatus(std::move(reply));
-            }));
+            },
+            client->backlog()));
     }
 
     // Requests of the new client queue up behind its registration.
@@ -138,17 +137,48 @@ std::shared_ptr<MxReportingSession> MxReportingServiceDelegate::findReportingSes
     std::lock_guard lock(lock_);
     if (reporterID == 0 || !reportingEnabled_.load())
         return nullptr;
-    for (const auto& client : clients_) {
-        const auto& sessions = client->clientReportingSessionMap();
-        if (auto found = sessions.find(reporterID); found != sessions.end()) {
-            MXLOG(MxReportingServerInstance::logScope(), Info, "found reporting session {} for client {}", reporterID,
-                  client->processIdentifier());
-            return found->second;
-        }
+    const MxReportingServerInstance* owner = nullptr;
+    if (auto session = sessionOfAnyClient(reporterID, owner)) {
+        MXLOG(MxReportingServerInstance::logScope(), Info, "found reporting session {} for client {}", reporterID,
+              owner->processIdentifier());
+        return session;
     }
     MXLOG(MxReportingServerInstance::logScope(), Error, "failed to find reporting session {}", reporterID);
     return nullptr;
 }
+
+std::shared_ptr<MxReportingSession> MxReportingServiceDelegate::lookUpSession(ReporterID reporterID)
+{
+    std::lock_guard lock(lock_);
+    if (reporterID == 0 || !reportingEnabled_.load())
+        return nullptr;
+    const MxReportingServerInstance* owner = nullptr;
+    return sessionOfAnyClient(reporterID, owner);
+}
+
+std::shared_ptr<MxReportingSession> MxReportingServiceDelegate::sessionOfAnyClient(
+    ReporterID reporterID, const MxReportingServerInstance*& owner) const
+{
+    for (const auto& client : clients_) {
+        const auto& sessions = client->clientReportingSessionMap();
+        if (auto found = sessions.find(reporterID); found != sessions.end()) {
+            owner = client.get();
+            return found->second;
+        }
+    }
+    return nullptr;
+}
+
+std::size_t MxReportingServiceDelegate::sessionsHeld()
+{
+    assert(serverQueue_->isCurrent());
+    std::size_t held = 0;
+    for (const auto& client : clients_)
+        held += client->clientReportingSessionMap().size();
+    return held;
+}
+
+std::size_t MxReportingServiceDelegate::keptBytesInService() { return MxReportingSession::keptBytesInService(); }
 
 std::shared_ptr<MxReportingDriverSnapShot> MxReportingServiceDelegate::getSnapShot()
 {
@@ -168,8 +198,8 @@ Array MxReportingServiceDelegate::clientsStatus() const
         clients.emplace_back(Dictionary{{"pid", client->processIdentifier()},
                                         {"process", client->clientProcessName().value_or("")},
                                         {"sessions", client->clientReportingSessionMap().size()},
-                                        {"backlog_bytes", client->backlogBytes()},
-                                        {"held_back", client->heldBack()}});
+                                        {"backlog_bytes", client->backlog()->owed()},
+                                        {"held_back", client->backlog()->overdrawn()}});
     return Array(std::move(clients));
 }
 

@@ -45,11 +45,13 @@ public:
     const std::vector<std::shared_ptr<MxReportingServerInstance>>& getAllClients() override;
     bool isReportingEnabled() override { return reportingEnabled_.load(); }
     std::shared_ptr<MxReportingSession> findReportingSessionForID(ReporterID reporterID) override;
+    std::shared_ptr<MxReportingSession> lookUpSession(ReporterID reporterID) override;
     std::shared_ptr<MxReportingDriverSnapShot> getSnapShot() override;
-    std::shared_ptr<WorkQueue> driverSamplingQueue() override { return driverSamplingQueue_; }
     std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
         const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) override;
     void removeClient(const MxReportingServerInstance& client) override;
+    std::size_t sessionsHeld() override;
+    std::size_t keptBytesInService() override;
     void noteSessionStarted() override { sessionsStarted_.fetch_add(1, std::memory_order_relaxed); }
     void noteReportReceived() override { reportsReceived_.fetch_add(1, std::memory_order_relaxed); }
 
@@ -58,7 +60,7 @@ public:
     std::uint64_t sessionsStarted() const { return sessionsStarted_.load(std::memory_order_relaxed); }
     std::uint64_t reportsReceived() const { return reportsReceived_.load(std::memory_order_relaxed); }
     // Server queue only: {pid, process, sessions, backlog_bytes, held_back} of each
-    // connected client.
+    // connected client (held back: not read until it owes less).
     Array clientsStatus() const;
     void setStatusView(std::function<Dictionary()> view) { statusView_ = std::move(view); }
     // Answers `reply` with the status view, built on the server queue.
@@ -76,6 +78,9 @@ private:
     void listenForDefaultsNotification();
     void handleDefaultsNotification(int token);
     void registerClient(const std::shared_ptr<MxReportingServerInstance>& client, pid_t pid, Date accepted);
+    // Under the lock: the first session of that ID in connection order, and its client.
+    std::shared_ptr<MxReportingSession> sessionOfAnyClient(ReporterID reporterID,
+                                                           const MxReportingServerInstance*& owner) const;
 
     Preferences& preferences_;
     Notifications& notifications_;
@@ -83,7 +88,6 @@ private:
     std::shared_ptr<WorkQueue> serverQueue_;
     // Made last at start-up, after the notification registration; read-only after.
     std::unique_ptr<MxReportingDriverUtility> driverUtility_;
-    std::shared_ptr<WorkQueue> driverSamplingQueue_; // made with it, when it has channels
     std::recursive_mutex lock_;
 
     std::atomic<bool> reportingEnabled_{true};

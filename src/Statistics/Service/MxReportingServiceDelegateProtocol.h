@@ -30,14 +30,18 @@ public:
     virtual bool isReportingEnabled() = 0;
     // The first session of that ID in any client; nothing for ID 0 or while reporting is off.
     virtual std::shared_ptr<MxReportingSession> findReportingSessionForID(ReporterID reporterID) = 0;
+    // The same lookup without its lines in the log: for what a request looks at before
+    // it does anything (the limits it would pass).
+    virtual std::shared_ptr<MxReportingSession> lookUpSession(ReporterID reporterID) = 0;
     virtual std::shared_ptr<MxReportingDriverSnapShot> getSnapShot() = 0;
-    // Where the drivers' channel files are read: off the server queue, since reading
-    // takes as long as there are channels. Nothing when no driver has any (sampling
-    // then costs nothing, and is done in place).
-    virtual std::shared_ptr<WorkQueue> driverSamplingQueue() = 0;
     virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
         const std::shared_ptr<MxReportingDriverSnapShot>& snapShot) = 0;
     virtual void removeClient(const MxReportingServerInstance& client) = 0;
+
+    // What the whole service holds, for its limits: sessions of every client, and the
+    // bytes every session's period keeps.
+    virtual std::size_t sessionsHeld() = 0;
+    virtual std::size_t keptBytesInService() = 0;
 
     // The counters of the status view: a session went from stopped to started, a
     // report was taken (refused ones are not counted).

@@ -30,9 +30,51 @@ inline constexpr std::int64_t kMxReportingDisabledErrorCode = 1;
 
 using MxBoolReply = std::function<void(bool)>;
 using MxServiceTypeReply = std::function<void(ServiceType)>;
-using MxErrorReply = std::function<void(std::optional<MxReportingError>)>;
 using MxDictionaryReply = std::function<void(Dictionary)>;
 using MxReportersReply = std::function<void(std::vector<ReporterID>)>;
+
+// The reply of a request that the service may refuse whole at one of its limits (the
+// sessions it holds, what a period keeps): then nothing of the request is done, and
+// instead of a reply of the protocol the client hears which limit it met, from the
+// connection layer. No reply of the protocol ever says that.
+template <class Result>
+class MxRefusableReply {
+public:
+    using Refusal = std::function<void(const std::string&)>;
+
+    MxRefusableReply() = default;
+    // A reply whose refusals nobody needs to hear of.
+    template <class F>
+    requires(!std::is_same_v<std::decay_t<F>, MxRefusableReply> && std::is_invocable_v<F&, Result>)
+        MxRefusableReply(F reply) // NOLINT(bugprone-forwarding-reference-overload)
+        : reply_(std::move(reply))
+    {
+    }
+    MxRefusableReply(std::function<void(Result)> reply, Refusal refuse)
+        : reply_(std::move(reply)), refuse_(std::move(refuse))
+    {
+    }
+
+    void operator()(Result result) const
+    {
+        if (reply_)
+            reply_(std::move(result));
+    }
+    // `limit` says which limit, for the client and the log: "too many sessions on this
+    // connection (4096)".
+    void refuse(const std::string& limit) const
+    {
+        if (refuse_)
+            refuse_(limit);
+    }
+
+private:
+    std::function<void(Result)> reply_;
+    Refusal refuse_;
+};
+
+using MxCreateReply = MxRefusableReply<bool>;
+using MxErrorReply = MxRefusableReply<std::optional<MxReportingError>>;
 
 // The reply of a start request, which the session may keep until it is stopped.
 // hold() says it is kept: the request's work is done, and the connection no longer
@@ -69,13 +111,15 @@ class MxReportingServiceProtocol {
 public:
     virtual ~MxReportingServiceProtocol() = default;
 
-    virtual void createReportingSession(ReporterID reporterID, MxBoolReply reply) = 0;
+    virtual void createReportingSession(ReporterID reporterID, MxCreateReply reply) = 0;
     virtual void setServiceType(ServiceType serviceType, ReporterID reporterID, MxBoolReply reply) = 0;
     virtual void getServiceNameForReporterID(ReporterID reporterID, MxServiceTypeReply reply) = 0;
     virtual void setConfiguration(std::optional<Dictionary> configuration, ReporterID reporterID,
                                   MxBoolReply reply) = 0;
     virtual void startReportingSessionForID(ReporterID reporterID, MxHeldReply reply) = 0;
-    // `reportingIDs` absent: every started session of every client.
+    // `reportingIDs` absent: every started session of every client. Its reply waits
+    // until what the message left behind is kept, in the stores' pending rows or
+    // committed: once it says the message was taken, nothing loses it.
     virtual void sendMessage(Dictionary payload, MessageCategory category, MessageType type,
                              std::optional<Array> reportingIDs, MxErrorReply reply) = 0;
     virtual void stopReportingSessionForID(ReporterID reporterID, MxBoolReply reply) = 0;

@@ -9,6 +9,7 @@
 #include "platform/DeviceProperties.h"
 #include "platform/Orientation.h"
 #include "platform/TracePoints.h"
+#include "wire/MsgpackValue.h"
 
 namespace mx {
 
@@ -68,12 +69,19 @@ MxReportingSession::~MxReportingSession()
     MXLOG(logScope(), Info, "deallocing this session {}", reporterID_);
 }
 
+void MxReportingSession::changed() const
+{
+    if (changeObserver_)
+        changeObserver_(*this);
+}
+
 void MxReportingSession::setServiceType(ServiceType serviceType)
 {
     serviceType_.store(serviceType, std::memory_order_relaxed);
     std::string name = MxReportingServiceTypeName(serviceType);
     MXLOG(logScope(), Info, "setting service type {}", name);
     serviceName_.set(std::move(name));
+    changed();
 }
 
 void MxReportingSession::setConfiguration(const std::optional<Dictionary>& configuration)
@@ -98,6 +106,7 @@ void MxReportingSession::start()
     started_.store(true);
     makePeriodStores();
     MxTrace(kTraceSessionStarted);
+    changed();
     if (shouldReportOrientation())
         registerOrientation();
 
@@ -137,6 +146,7 @@ void MxReportingSession::stop()
     dropAggregated(aggregatedPayloadData_);
     dropAggregated(nestedAggregatedPayloadData_);
     started_.store(false);
+    changed();
 }
 
 void MxReportingSession::parkTransactionCompleteBlock(TransactionCompleteBlock block)
@@ -240,13 +250,6 @@ void MxReportingSession::unregisterOrientation()
 
 void MxReportingSession::recordOrientation(std::string_view mode, int orientation)
 {
-    // Callbacks come one at a time: the count needs no more than its own atomicity.
-    if (orientationRecords_.load() >= kMaximumOrientationRecords) {
-        if (!orientationBoundLogged_.exchange(true))
-            MXLOG(logScope(), Error, "reporter {} recorded {} orientation changes this period: later ones are not",
-                  reporterID_, kMaximumOrientationRecords);
-        return;
-    }
     std::string text = ProcessWide<Orientation>::get().orientationName(orientation);
     auto now = std::chrono::system_clock::now();
     auto backToStart = std::chrono::duration<double>(startDate_.get().value_or(now) - now).count();
@@ -260,8 +263,7 @@ void MxReportingSession::recordOrientation(std::string_view mode, int orientatio
     Dictionary record;
     record.set(fmt::format("{}_orientation", mode), std::move(text));
     record.set(fmt::format("{}_orientation_time", mode), seconds);
-    if (appendAggregated(aggregatedPayloadData_, [&](MxReportingAggregationArray& array) { array.append(record); }))
-        orientationRecords_.fetch_add(1);
+    appendAggregated(aggregatedPayloadData_, [&](MxReportingAggregationArray& array) { array.append(record); });
 }
 
 std::optional<Dictionary> MxReportingSession::createSummaryEventForSession()
@@ -281,10 +283,21 @@ std::string MxReportingSession::summaryFileName(std::time_t now) const
     return MxReportingSessionSummary::summaryFileName(now, userInfo_->snapshot(), serviceType());
 }
 
+std::optional<std::size_t> MxReportingSession::keptBytes() const
+{
+    auto current = aggregatedPayloadData();
+    if (!current)
+        return std::nullopt;
+    return current->arena()->keptBytes();
+}
+
+std::size_t MxReportingSession::keptBytesOf(const Dictionary& message)
+{
+    return encodedMsgpackBytes(Value(message)) + kKeptBytesPerMessage;
+}
+
 void MxReportingSession::makePeriodStores()
 {
-    orientationRecords_.store(0);
-    orientationBoundLogged_.store(false);
     auto arena = std::make_shared<MxReportingEncodedArena>();
     aggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>(arena));
     nestedAggregatedPayloadData_.set(std::make_shared<MxReportingAggregationArray>(arena));

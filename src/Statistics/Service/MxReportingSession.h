@@ -40,9 +40,18 @@ public:
     using SendReply = MxReportingSessionUplink::SendReply;
     using AggregationArray = std::shared_ptr<MxReportingAggregationArray>;
 
-    // Orientation changes a period records: a feed flooded with changes costs each
-    // tracked session this many records at most, and one log line.
-    static constexpr int kMaximumOrientationRecords = 1000;
+    // What one session's period, and every session's together, may keep of the reports
+    // it is sent (counted as encoded, MxReportingEncodedArena): the summary built from it
+    // at stop runs on the server queue and takes about a second at most. A message that
+    // would pass either is refused whole.
+    static constexpr std::size_t kMaximumKeptBytes = std::size_t{64} << 20;
+    static constexpr std::size_t kMaximumKeptBytesInService = std::size_t{512} << 20;
+    // What keeping one message costs a period beyond its payload: its identifier and
+    // its place in both stores.
+    static constexpr std::size_t kKeptBytesPerMessage = 64;
+    // Told, on the server queue, each time the session's description changes (its
+    // service type, started or stopped): its owner keeps its indexes by it.
+    using ChangeObserver = std::function<void(const MxReportingSession&)>;
 
     // initWithID:processIdentifiers:
     MxReportingSession(ReporterID reporterID, std::vector<std::int32_t> processIdentifiers);
@@ -70,6 +79,14 @@ public:
     AggregationArray nestedAggregatedPayloadData() const { return nestedAggregatedPayloadData_.get(); }
     // Server queue only.
     const std::map<std::string, std::int64_t>& messageTypeCounts() const { return messageTypeCounts_; }
+    // Set once, by the owner, before the session is shared.
+    void setChangeObserver(ChangeObserver observer) { changeObserver_ = std::move(observer); }
+    // What the current period keeps, as encoded; nothing while no period keeps anything
+    // (after a stop, until the next start).
+    std::optional<std::size_t> keptBytes() const;
+    // What sending `message` would add to a period's keeping.
+    static std::size_t keptBytesOf(const Dictionary& message);
+    static std::size_t keptBytesInService() { return MxReportingEncodedArena::keptInAll(); }
     std::string serviceName() const { return serviceName_.get(); }
     std::shared_ptr<UplinkSession> uplinkSession() const { return uplink_.uplinkSession(); }
     std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplink_.uplinkAgentToken(); }
@@ -114,6 +131,7 @@ public:
     std::string description() const;
 
 private:
+    void changed() const;
     void registerOrientation();
     void unregisterOrientation();
     // `mode` is "device" or "ui"; runs on a thread of the orientation service.
@@ -144,8 +162,7 @@ private:
     MxAtomicProperty<std::string> serviceName_{std::string("unknown")};
     MxAtomicProperty<std::optional<std::string>> orientationCallbackID_;
     MxAtomicProperty<std::optional<Date>> startDate_;
-    std::atomic<int> orientationRecords_{0}; // this period's
-    std::atomic<bool> orientationBoundLogged_{false};
+    ChangeObserver changeObserver_;
     MxReportingSessionUplink uplink_;
 };
 

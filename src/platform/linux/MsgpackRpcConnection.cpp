@@ -162,7 +162,8 @@ void MsgpackRpcConnection::handleRead(std::size_t bytes)
 bool MsgpackRpcConnection::overBound() const
 {
     return stoppedReading_ || requestsInFlight_.load() >= kMaximumRequestsInFlight ||
-        bytesInFlight_.load() >= kMaximumBytesInFlight || outboxBytes_ > kBackPressureBytes;
+        bytesInFlight_.load() >= kMaximumBytesInFlight || outboxBytes_ > kBackPressureBytes ||
+        (exported_ && exported_->overdrawn());
 }
 
 // Decoded input waits in the decoder while a bound holds; the socket behind it fills,
@@ -171,18 +172,34 @@ void MsgpackRpcConnection::processBuffered()
 {
     Value message;
     std::string reason;
-    while (!closed_) {
+    for (std::size_t handedOn = 0; !closed_;) {
         if (overBound()) {
             // No read is outstanding meanwhile, and maybe no write: the connection
             // holds itself until it reads again or closes.
             holdWhilePaused_ = shared_from_this();
             paused_.store(true);
             if (overBound()) {
+                // Told when its client owes less; the other bounds are lowered by
+                // replies and writes, which look at the pause themselves.
+                if (exported_ && exported_->overdrawn())
+                    exported_->whenSettled([weakSelf = weak_from_this()] {
+                        if (auto self = weakSelf.lock())
+                            self->postResume();
+                    });
                 watchForHangUp();
                 return;
             }
             paused_.store(false);
             holdWhilePaused_.reset();
+        }
+        if (handedOn == kRequestsPerPass) {
+            // The requests handed on run when this handler returns; the rest wait
+            // behind the other connections' passes.
+            asio::post(socket_.get_executor(), [self = shared_from_this()] {
+                AsioHandOver handOver(self.get());
+                self->processBuffered();
+            });
+            return;
         }
         switch (decoder_.next(message, reason)) {
         case MsgpackRpcDecoder::Status::NeedMore:
@@ -194,6 +211,7 @@ void MsgpackRpcConnection::processBuffered()
         case MsgpackRpcDecoder::Status::Message:
             if (!handleMessage(message, decoder_.lastMessageBytes()))
                 return;
+            ++handedOn;
             break;
         }
     }
@@ -232,10 +250,16 @@ void MsgpackRpcConnection::requestEnded(std::size_t bytes)
 {
     requestsInFlight_.fetch_sub(1);
     bytesInFlight_.fetch_sub(bytes);
+    postResume();
+}
+
+void MsgpackRpcConnection::postResume()
+{
     if (!paused_.load() || resumePosted_.exchange(true))
         return;
     asio::post(socket_.get_executor(), [self = shared_from_this()] {
         self->resumePosted_.store(false);
+        AsioHandOver handOver(self.get());
         self->resumeIfPaused();
     });
 }
@@ -378,7 +402,7 @@ void MsgpackRpcConnection::close(const std::string& reason)
     if (closed_.exchange(true))
         return;
     if (!reason.empty())
-        MXLOG(nullptr, Error, "closing connection of pid {}: {}", pid_, reason);
+        MXLOG_LIMITED(nullptr, Error, "closing connection of pid {}: {}", pid_, reason);
     std::error_code ignored;
     socket_.shutdown(asio::socket_base::shutdown_both, ignored);
     socket_.close(ignored);

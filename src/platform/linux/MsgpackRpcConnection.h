@@ -1,10 +1,15 @@
 #pragma once
 // One client connection of the listener: reads msgpack-rpc requests from the Unix
 // stream socket, hands each (method name and parameters, whatever the method) to the
-// exported object, and writes the replies back in whatever order they come. Bad input closes only this connection, with
-// one log line. A client that stops reading its replies is back-pressured: its requests are not read while its unsent
-// replies exceed a bound. Its socket's handlers run on a strand of its own (the socket's executor); replies may be
-// sent from any thread.
+// exported object, and writes the replies back in whatever order they come. Bad input
+// closes only this connection, with one log line. Back-pressure acts before a request
+// arrives: the connection is not read while it has too many requests unanswered, too
+// many reply bytes unsent, or while its client owes the service past its bound (the
+// exported object says); other connections are read on. A pass hands on a bounded
+// number of requests and lets the others' passes come between, so that requests
+// arrive, and run, in the order the clients sent them rather than a pipeline at a time.
+// Its socket's handlers run on a strand of its own (the socket's executor); replies may
+// be sent from any thread.
 
 #include <atomic>
 #include <chrono>
@@ -35,6 +40,9 @@ public:
     // pile up more than its share of the daemon's queues.
     static constexpr std::size_t kMaximumRequestsInFlight = 256;
     static constexpr std::size_t kMaximumBytesInFlight = std::size_t{4} << 20;
+    // Requests one pass hands on before the passes of other connections come: a
+    // pipeline arrives in steps of this many, interleaved with everyone else's.
+    static constexpr std::size_t kRequestsPerPass = 32;
     // How often a paused connection looks whether its client is still there.
     static constexpr std::chrono::milliseconds kHangUpWatchInterval{500};
     // A reply batch starts this small: most hold a reply or two.
@@ -65,6 +73,8 @@ private:
     void handleRead(std::size_t bytes);
     void processBuffered();
     bool overBound() const;
+    // Any thread: a paused connection looks at its bounds again, on its strand.
+    void postResume();
     void resumeIfPaused();
     void watchForHangUp();
     bool handleMessage(const Value& message, std::size_t bytes);

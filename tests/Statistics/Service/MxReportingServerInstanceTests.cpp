@@ -178,7 +178,7 @@ TEST_F(MxReportingServerInstanceTest, HeldStartRepliesAreAnsweredOnceByTheOwners
 
     // A stop that is not a stop request (as at a disconnection) leaves the held reply
     // in the session; the next start answers it before parking its own.
-    reporting->stop();
+    host.root->serverQueue()->dispatch([&] { reporting->stop(); });
     Replies<bool> fresh;
     other->startReportingSessionForID(5, fresh.callback());
     run();
@@ -317,60 +317,48 @@ TEST_F(MxReportingServerInstanceTest, MessageWithoutIdListReachesEveryStartedSes
     EXPECT_TRUE(platform.uplink.oneShots().empty());
 }
 
-// The drivers' channels are read off the server queue: the client that started waits
-// for them, in its own order, while the others are served.
-TEST_F(MxReportingServerInstanceTest, AClientsRequestsWaitForItsDriverSamplingWhileOthersGoOn)
+// One serial queue, requests whole and in the order they came, whoever sent them: a
+// stop's sampling is part of the stop, and a message to many sessions reaches them all
+// before the next request runs.
+TEST_F(MxReportingServerInstanceTest, EveryClientsRequestsRunWholeInTheOrderTheyArrived)
 {
     auto owner = connect(1);
     auto other = connect(2);
-    create(*owner, 5);
-    Replies<bool> started;
-    Replies<Dictionary> ownerValid, otherValid;
-    owner->startReportingSessionForID(5, started.callback());
-    owner->reporterID(5, ownerValid.callback());
-    other->reporterID(5, otherValid.callback());
-    auto& server = static_cast<FakeWorkQueue&>(*host.root->serverQueue());
-    while (server.runOne()) {}
-    EXPECT_THAT(ownerValid.values, IsEmpty()) << "behind its start, whose drivers are still being read";
-    EXPECT_THAT(otherValid.values, ElementsAre(Dictionary{{"reporterID", 5}, {"serviceType", 65535}}));
-    run();
-    EXPECT_THAT(ownerValid.values, ElementsAre(Dictionary{{"reporterID", 5}, {"serviceType", 65535}}));
-    EXPECT_NE(session(*owner, 5)->driverSnapShot(), nullptr);
-}
-
-// A message to many sessions goes a step at a time, and other clients' requests come
-// between its steps.
-TEST_F(MxReportingServerInstanceTest, AMessageToManySessionsTakesTurnsWithOtherClients)
-{
-    auto first = connect(1);
-    auto second = connect(2);
-    auto sender = connect(3);
-    auto bystander = connect(4);
+    auto bystander = connect(3);
     for (ReporterID id = 1; id <= 2000; ++id) {
-        auto& owner = id <= 1000 ? *first : *second;
-        owner.createReportingSession(id, [](bool) {});
-        owner.startReportingSessionForID(id, [](bool) {});
+        owner->createReportingSession(id, [](bool) {});
+        owner->startReportingSessionForID(id, [](bool) {});
     }
     run();
     std::vector<std::string> order;
-    sender->sendMessage(Dictionary{{"k", 1}}, 3, 1, std::nullopt, [&](auto) { order.emplace_back("broadcast"); });
+    Replies<bool> restarted;
+    owner->stopReportingSessionForID(1, [&](bool) { order.emplace_back("stop"); });
+    other->startReportingSessionForID(1, restarted.callback());
+    owner->sendMessage(Dictionary{{"k", 1}}, 3, 1, std::nullopt, [&](auto) { order.emplace_back("broadcast"); });
     bystander->reporterID(1, [&](auto) { order.emplace_back("bystander"); });
     run();
-    EXPECT_THAT(order, ElementsAre("bystander", "broadcast"));
-    EXPECT_EQ(platform.tally.events().size(), 2000u);
+    EXPECT_THAT(order, ElementsAre("stop", "broadcast", "bystander"));
+    EXPECT_TRUE(session(*owner, 1)->started()) << "the other client's start came after the stop";
+    EXPECT_THAT(restarted.values, IsEmpty()) << "its reply is held by the new period";
+    EXPECT_EQ(platform.tally.events().size(), 2000u) << "every started session, the restarted one too";
 }
 
-TEST_F(MxReportingServerInstanceTest, ABroadcastsLogLinesNameTheFirstSessionsAndCountTheRest)
+TEST_F(MxReportingServerInstanceTest, ABroadcastsLogLinesNameEverySession)
 {
     auto client = connect(1);
     for (ReporterID id = 1; id <= 40; ++id)
         create(*client, id);
+    Replies<bool> started;
+    client->startReportingSessionForID(40, started.callback());
+    run();
     send(*client, Dictionary{{"k", "v"}}, std::nullopt);
     std::string listed;
-    for (ReporterID id = 1; id <= 16; ++id)
-        listed +=
-            fmt::format("{}<MxReportingSession reporterID={} serviceType=65535 started=NO>", id > 1 ? ", " : "", id);
-    EXPECT_TRUE(platform.log.contains(fmt::format("sessions for client 1 : ({}, and 24 more)", listed)));
+    for (ReporterID id = 1; id <= 40; ++id)
+        listed += fmt::format("{}<MxReportingSession reporterID={} serviceType=65535 started={}>", id > 1 ? ", " : "",
+                              id, id == 40 ? "YES" : "NO");
+    EXPECT_TRUE(platform.log.contains(fmt::format("sessions for client 1 : ({})", listed)));
+    EXPECT_TRUE(platform.log.contains(
+        "active reporting sessions 1 : (<MxReportingSession reporterID=40 serviceType=65535 started=YES>)"));
 }
 
 TEST_F(MxReportingServerInstanceTest, MessageWithoutIdListAndNoStartedSessionGoesOutOnceAlone)
