@@ -25,8 +25,12 @@ public:
     // Runs `work` after everything dispatched before it (on a serial queue). Callable
     // from any thread, including the queue's own; never runs `work` inline.
     virtual void dispatch(UniqueFunction<void()> work) = 0;
-    // Runs `work` once `delay` has passed. Callable from any thread.
+    // Runs `work` once `delay` has passed. Callable from any thread. A shutdown runs it
+    // at once: nothing handed to a queue is left behind at exit.
     virtual void dispatchAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> work) = 0;
+    // Runs `work` once `delay` has passed, unless the process ends first: a timeout
+    // that a shutdown neither waits for nor brings forward. Callable from any thread.
+    virtual void dispatchTimeout(std::chrono::nanoseconds delay, UniqueFunction<void()> work) = 0;
     // True while the calling thread runs work of this queue; for debug assertions.
     virtual bool isCurrent() const = 0;
 };

@@ -24,6 +24,11 @@ public:
     QueuePriority priority() const { return priority_; }
     void dispatch(UniqueFunction<void()> work) override;
     void dispatchAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> work) override;
+    // Moved by the test's time, as delayed work is.
+    void dispatchTimeout(std::chrono::nanoseconds delay, UniqueFunction<void()> work) override
+    {
+        dispatchAfter(delay, std::move(work));
+    }
     bool isCurrent() const override;
 
     // Runs one ready item; false when none was ready.

@@ -112,11 +112,13 @@ void MxReportingSession::start()
 
     MxReportingSessionUplink::Configuration configuration{userInfo_, serviceName(), serviceType(),
                                                           uplinkSessionStarted()};
-    uplink_.run(
-        [self = shared_from_this(), earlier = uplink_.takeHeld(), configuration = std::move(configuration)]() mutable {
-            self->deliver(std::move(earlier));
-            self->uplink_.configure(self->serviceType(), configuration);
-        });
+    // Queued, not run in place: configuration merged before it runs reaches the
+    // backend session too.
+    uplink_.runOnQueue(
+        [this, configuration = std::move(configuration)] {
+            return uplink_.configure(serviceType(), configuration, shared_from_this());
+        },
+        shared_from_this());
 }
 
 void MxReportingSession::stop()
@@ -138,9 +140,9 @@ void MxReportingSession::stop()
     }
     writeSummaryJson();
 
-    uplink_.run([self = shared_from_this(), earlier = uplink_.takeHeld()]() mutable {
-        self->deliver(std::move(earlier));
-        self->uplink_.flush(self->serviceType());
+    runUplinkJob([this] {
+        uplink_.flush(serviceType());
+        return MxReportingSessionUplink::JobEnd::Done;
     });
 
     dropAggregated(aggregatedPayloadData_);
@@ -188,33 +190,27 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
     MxTrace(kTraceMessageQueued);
 
     // Whether the message goes in-session or alone is decided now, not at delivery.
-    MxReportingSessionUplink::Delivery delivery{std::move(cleaned), message, started(), category, type, {}};
-    if (delivery.wasStarted && uplink_.idle()) {
-        uplink_.deliver(serviceType(), delivery, *userInfo_);
-    } else {
-        // Owed by the client that sent it until delivered, and so is what the delivery writes.
-        delivery.debt = BacklogDebt::incur();
-        if (uplink_.hold(std::move(delivery)))
-            queueHeldDeliveries();
-    }
+    runUplinkJob(
+        [this, delivery = MxReportingSessionUplink::Delivery{std::move(cleaned), message, started(), category, type}] {
+            uplink_.deliver(serviceType(), delivery, *userInfo_);
+            return MxReportingSessionUplink::JobEnd::Done;
+        });
     if (reply)
         reply(std::nullopt);
 }
 
-void MxReportingSession::queueHeldDeliveries()
+// Jobs hold the session only as `this`: the caller holds it while a job runs in place,
+// and whatever runs the waiting ones holds it then. A job that waits behind another is
+// owed by the client whose request gave it, until it has run, and so is what it writes.
+template <class F>
+void MxReportingSession::runUplinkJob(F job)
 {
-    uplink_.runAfter(MxReportingSessionUplink::kDeliveryGathering,
-                     [self = shared_from_this()] { self->deliver(self->uplink_.takeHeld()); });
-}
-
-void MxReportingSession::deliver(std::vector<MxReportingSessionUplink::Delivery> deliveries)
-{
-    for (auto& delivery : deliveries) {
-        // Each delivery's debt settles as soon as it is delivered.
-        auto debt = std::move(delivery.debt);
+    if (uplink_.runNow(job))
+        return;
+    uplink_.runLater([job = std::move(job), debt = BacklogDebt::incur()]() mutable {
         ScopedBacklogAccount charging(debt);
-        uplink_.deliver(serviceType(), delivery, *userInfo_);
-    }
+        return job();
+    });
 }
 
 bool MxReportingSession::shouldReportOrientation() const

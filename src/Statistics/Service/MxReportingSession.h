@@ -136,10 +136,9 @@ private:
     void unregisterOrientation();
     // `mode` is "device" or "ui"; runs on a thread of the orientation service.
     void recordOrientation(std::string_view mode, int orientation);
-    // Queues the run that delivers what is held then.
-    void queueHeldDeliveries();
-    // Uplink queue only.
-    void deliver(std::vector<MxReportingSessionUplink::Delivery> deliveries);
+    // Server queue only: `job` runs on the uplink side after every job given before.
+    template <class F>
+    void runUplinkJob(F job);
     // New empty stores for a period, sharing one arena.
     void makePeriodStores();
     // Keeps a message in both stores: as it is, and under its identifier.

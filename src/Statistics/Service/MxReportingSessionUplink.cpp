@@ -32,14 +32,6 @@ std::int64_t randomAlarmDelaySeconds()
 
 } // namespace
 
-// The backend-list callback and the configuration job meet here: the flag says that
-// backends were found, and is read and written only under the condition's lock.
-struct MxReportingDiscovery {
-    explicit MxReportingDiscovery(bool seed) : found(seed) {}
-    MxReportingCondition condition;
-    bool found;
-};
-
 MxReportingSessionUplink::MxReportingSessionUplink(ReporterID reporterID)
     : reporterID_(reporterID),
       queue_(
@@ -47,41 +39,60 @@ MxReportingSessionUplink::MxReportingSessionUplink(ReporterID reporterID)
 {
 }
 
-void MxReportingSessionUplink::run(UniqueFunction<void()> job) { queue_->dispatch(counted(std::move(job))); }
-
-void MxReportingSessionUplink::runAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> job)
+void MxReportingSessionUplink::runLater(Job job)
 {
-    queue_->dispatchAfter(delay, counted(std::move(job)));
+    {
+        std::lock_guard lock(jobsMutex_);
+        if (busy_) {
+            waiting_.push_back(std::move(job));
+            return;
+        }
+        busy_ = true;
+    }
+    if (job() == JobEnd::Done)
+        runWaiting();
 }
 
-// The job holds its session, and so this object, until the count is down.
-UniqueFunction<void()> MxReportingSessionUplink::counted(UniqueFunction<void()> job)
+void MxReportingSessionUplink::runOnQueue(Job job, std::shared_ptr<void> owner)
 {
-    queuedJobs_.fetch_add(1, std::memory_order_relaxed);
-    return [this, job = std::move(job)]() mutable {
-        job();
-        queuedJobs_.fetch_sub(1, std::memory_order_release);
-    };
+    {
+        std::lock_guard lock(jobsMutex_);
+        if (busy_) {
+            waiting_.push_back(std::move(job));
+            return;
+        }
+        busy_ = true;
+    }
+    queue_->dispatch([this, job = std::move(job), owner = std::move(owner)]() mutable {
+        if (job() == JobEnd::Done)
+            runWaiting();
+    });
 }
 
-bool MxReportingSessionUplink::hold(Delivery delivery)
+void MxReportingSessionUplink::runWaiting()
 {
-    std::lock_guard lock(heldMutex_);
-    held_.push_back(std::move(delivery));
-    return held_.size() == 1;
+    for (;;) {
+        Job next;
+        {
+            std::lock_guard lock(jobsMutex_);
+            if (waiting_.empty()) {
+                busy_ = false;
+                return;
+            }
+            next = std::move(waiting_.front());
+            waiting_.pop_front();
+        }
+        if (next() == JobEnd::Suspended)
+            return;
+    }
 }
 
-std::vector<MxReportingSessionUplink::Delivery> MxReportingSessionUplink::takeHeld()
+MxReportingSessionUplink::JobEnd MxReportingSessionUplink::configure(ServiceType currentType,
+                                                                     const Configuration& configuration,
+                                                                     std::shared_ptr<void> owner)
 {
-    std::lock_guard lock(heldMutex_);
-    return std::exchange(held_, {});
-}
-
-void MxReportingSessionUplink::configure(ServiceType currentType, const Configuration& configuration)
-{
-    assert(queue_->isCurrent());
     if (currentType == service_type::kTest)
-        return;
+        return JobEnd::Done;
 
     auto& uplink = ProcessWide<Uplink>::get();
     auto token = uplink.newSecureHierarchyToken(nullptr);
@@ -101,7 +112,7 @@ void MxReportingSessionUplink::configure(ServiceType currentType, const Configur
 
     auto session = uplink.makeSession(std::move(sessionInfo), std::move(backendUserInfo), {});
     uplinkSession_.set(session);
-    auto discovery = std::make_shared<MxReportingDiscovery>(configuration.discovered);
+    auto discovery = std::make_shared<MxReportingQueueCondition>(configuration.discovered);
     session->startConfiguration([discovery](std::optional<std::vector<std::string>> backends) {
         if (!backends) {
             // Intended: the waiter is not woken and runs into its timeout.
@@ -110,25 +121,31 @@ void MxReportingSessionUplink::configure(ServiceType currentType, const Configur
         }
         MXLOG(logScope(), Default, "List of backends {}",
               Value(Array(std::vector<Value>(backends->begin(), backends->end()))).description());
-        std::lock_guard lock(discovery->condition.mutex);
-        discovery->found = true;
-        discovery->condition.condition.notify_all();
+        discovery->signal();
     });
 
-    bool found = MxReportingUtilityWait(discovery->condition, &discovery->found, "waiting for uplinkd to find backends",
-                                        "failed to find backend", logScope(), double(kDiscoveryTimeoutSeconds));
-    // Intended: success leaves uplinkSessionStarted false, so every start waits for
-    // discovery afresh.
-    if (!found) {
-        uplinkSession_.set(nullptr);
-        uplinkSessionStarted_.store(false);
-    }
+    // Whichever of the wait's end and this job's return comes second goes on: in
+    // place when the wait ended at once, else the wait's end resumes the queue.
+    enum : int { kWaiting, kEnded, kReturned };
+    auto handOff = std::make_shared<std::atomic<int>>(kWaiting);
+    MxReportingUtilityWait(discovery, "waiting for uplinkd to find backends", "failed to find backend", logScope(),
+                           double(kDiscoveryTimeoutSeconds), queue_,
+                           [this, handOff, owner = std::move(owner)](bool found) {
+                               // Intended: success leaves uplinkSessionStarted false, so
+                               // every start waits for discovery afresh.
+                               if (!found) {
+                                   uplinkSession_.set(nullptr);
+                                   uplinkSessionStarted_.store(false);
+                               }
+                               if (handOff->exchange(kEnded) == kReturned)
+                                   resume();
+                           });
+    return handOff->exchange(kReturned) == kEnded ? JobEnd::Done : JobEnd::Suspended;
 }
 
 void MxReportingSessionUplink::deliver(ServiceType currentType, const Delivery& delivery,
                                        const MxLockedDictionary& userInfo)
 {
-    assert(queue_->isCurrent() || idle());
     if (!delivery.wasStarted) {
         MXLOG_VERBOSE(logScope(), "session not started, will send as a single message");
         Dictionary snapshot = userInfo.snapshot();
@@ -156,7 +173,6 @@ void MxReportingSessionUplink::deliver(ServiceType currentType, const Delivery& 
 
 void MxReportingSessionUplink::flush(ServiceType currentType)
 {
-    assert(queue_->isCurrent());
     if (currentType == service_type::kTest)
         return;
     if (auto session = uplinkSession())

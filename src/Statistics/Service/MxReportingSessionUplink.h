@@ -1,32 +1,30 @@
 #pragma once
 // A session's side of the reporting backend: its backend session and token, and the
-// work that runs on the session's own serial uplink queue, in submission order:
-// backend configuration with the discovery wait, in-session deliveries, the flush.
-// A started session's delivery is made at once, on the server queue, while the uplink
-// queue has nothing to do: the server queue alone gives the uplink queue work, so it
-// stays idle meanwhile, and the delivery keeps its order. It then costs no hop and no
-// wake-up of the utility thread, and its row is kept (SqliteStore) before the report
-// is answered. Otherwise (a configuration waiting for its backends, a flush, a session
-// not started) deliveries are held and go in gathered runs: a queue hop per report
-// costs more than the delivery, so a run a few milliseconds after the first held one
-// takes all that came since. Configuration and flush take what is held before they
-// are queued, so nothing is delivered out of its order with them.
-// Owned by its MxReportingSession, which queues that work holding itself, so the
-// session (and this object) outlives every queued job. Also sends single messages,
-// which go alone from the global utility queue.
+// work of its serial uplink queue, in submission order: backend configuration with the
+// discovery wait, in-session deliveries, the flush. Only the server queue gives that
+// work, and none of it blocks: so while nothing is waiting, a delivery or a flush runs
+// at once, in place, on the server queue (a delivery's row is then kept, SqliteStore,
+// before the report is answered). A start's configuration is queued, as it always was:
+// configuration merged into the session before it runs still reaches the backend.
+// Discovery suspends the queue instead of holding a thread. Jobs given meanwhile wait
+// in order behind, and run on the uplink queue once the queue goes on. Order is
+// submission order, always.
+// Owned by its MxReportingSession. A waiting job does not hold the session: whatever
+// will run it does (the queued configuration, the suspended wait), so that work
+// dropped unrun leaves no session behind. Also sends single messages, which go alone
+// from the global utility queue.
 
 #include <atomic>
 #include <chrono>
+#include <deque>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "Statistics/MxAtomicProperty.h"
 #include "Statistics/MxLockedDictionary.h"
 #include "Statistics/MxReportingVocabulary.h"
-#include "platform/BacklogAccount.h"
 #include "platform/UniqueFunction.h"
 #include "platform/Uplink.h"
 #include "platform/WorkQueue.h"
@@ -37,6 +35,10 @@ namespace mx {
 class MxReportingSessionUplink {
 public:
     using SendReply = UniqueFunction<void(std::optional<UplinkError>)>;
+    // What a job says as it returns: done, or the queue waits until the job itself
+    // calls resume() (on the uplink queue).
+    enum class JobEnd { Done, Suspended };
+    using Job = UniqueFunction<JobEnd()>;
 
     // What a start hands to its configuration job, taken when the session starts.
     struct Configuration {
@@ -49,22 +51,14 @@ public:
         bool discovered = false;
     };
 
-    // A message on its way to the backend, owed by the client that sent it until it
-    // is delivered.
+    // A message on its way to the backend.
     struct Delivery {
         Dictionary cleaned;
         Dictionary message;
         bool wasStarted = false;
         MessageCategory category = 0;
         MessageType type = 0;
-        BacklogDebt debt;
     };
-
-    // How long a run of held deliveries gathers after the first of it is held. It is
-    // what a SIGKILL may take of them, for the store keeps each row it is handed
-    // (SqliteStore); with the store's short window, for a row it finds no room to
-    // keep, it stays under 100 ms.
-    static constexpr std::chrono::milliseconds kDeliveryGathering{40};
 
     explicit MxReportingSessionUplink(ReporterID reporterID);
     MxReportingSessionUplink(const MxReportingSessionUplink&) = delete;
@@ -77,24 +71,36 @@ public:
     std::shared_ptr<UplinkSession> uplinkSession() const { return uplinkSession_.get(); }
     std::optional<UplinkSecureHierarchyToken> uplinkAgentToken() const { return uplinkAgentToken_.get(); }
 
-    // Server queue only. Queues `job` on the uplink queue, counted until it has run.
-    void run(UniqueFunction<void()> job);
-    void runAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> job);
-    // Server queue only. Nothing is queued on the uplink queue or running there, and
-    // nothing can be until the caller returns: what it delivers now is in order.
-    bool idle() const { return queuedJobs_.load(std::memory_order_acquire) == 0; }
+    // Server queue only. Runs `job` in place, now, when no job is waiting or running:
+    // true, and it ran. Else false, and the caller hands it, with what it carries
+    // while it waits, to runLater.
+    template <class F>
+    bool runNow(F& job)
+    {
+        {
+            std::lock_guard lock(jobsMutex_);
+            if (busy_)
+                return false;
+            busy_ = true;
+        }
+        if (job() == JobEnd::Done)
+            runWaiting();
+        return true;
+    }
+    // Server queue only. Runs `job` after every job given before it.
+    void runLater(Job job);
+    // Server queue only. Runs `job` on the uplink queue, after every job given before
+    // it; `owner` is held until the queue has gone past it.
+    void runOnQueue(Job job, std::shared_ptr<void> owner);
+    // The job that suspended the queue is done: the jobs behind it run, on the
+    // calling thread (the uplink queue).
+    void resume() { runWaiting(); }
 
-    // Any thread. Holds the delivery for the next run; true when nothing was held
-    // before it, and the caller queues that run.
-    bool hold(Delivery delivery);
-    // Any thread. What is held, in order, for a job about to be queued.
-    std::vector<Delivery> takeHeld();
-
-    // Uplink queue only, or the server queue while idle. `currentType` is the
-    // session's service type as the delivery is made.
+    // Jobs only. `currentType` is the session's service type as the job runs.
     void deliver(ServiceType currentType, const Delivery& delivery, const MxLockedDictionary& userInfo);
-    // Uplink queue only.
-    void configure(ServiceType currentType, const Configuration& configuration);
+    // Suspends the queue while discovery waits: then `resume` follows once it ended,
+    // holding `owner` until then.
+    JobEnd configure(ServiceType currentType, const Configuration& configuration, std::shared_ptr<void> owner);
     void flush(ServiceType currentType);
 
     // One message with a throw-away backend session of its own, sent from the global
@@ -104,17 +110,18 @@ public:
                                   ServiceType serviceType, const Dictionary* userInfo, SendReply reply);
 
 private:
-    UniqueFunction<void()> counted(UniqueFunction<void()> job);
+    // Runs jobs from the front until none is left or one suspends the queue.
+    void runWaiting();
 
     const ReporterID reporterID_;
     const std::shared_ptr<WorkQueue> queue_;
-    std::atomic<int> queuedJobs_{0};
-    // Written on the uplink queue only; read from anywhere.
+    // Written by jobs only; read from anywhere.
     std::atomic<bool> uplinkSessionStarted_{false};
     MxAtomicProperty<std::shared_ptr<UplinkSession>> uplinkSession_;
     MxAtomicProperty<std::optional<UplinkSecureHierarchyToken>> uplinkAgentToken_;
-    std::mutex heldMutex_;
-    std::vector<Delivery> held_;
+    std::mutex jobsMutex_;
+    std::deque<Job> waiting_;
+    bool busy_ = false; // a job runs, or the queue is suspended, or jobs wait
 };
 
 } // namespace mx

@@ -24,4 +24,10 @@ void AsioGlobalQueue::dispatchAfter(std::chrono::nanoseconds delay, UniqueFuncti
     work_.runAfter(std::make_shared<asio::steady_timer>(pool_.executor(), delay), std::move(work));
 }
 
+void AsioGlobalQueue::dispatchTimeout(std::chrono::nanoseconds delay, UniqueFunction<void()> work)
+{
+    auto timer = std::make_shared<asio::steady_timer>(pool_.executor(), delay);
+    timer->async_wait([timer, work = std::move(work)](const std::error_code&) mutable { work(); });
+}
+
 } // namespace mx

@@ -15,6 +15,7 @@ public:
     const std::string& label() const override { return label_; }
     void dispatch(UniqueFunction<void()> work) override;
     void dispatchAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> work) override;
+    void dispatchTimeout(std::chrono::nanoseconds delay, UniqueFunction<void()> work) override;
     bool isCurrent() const override { return pool_.runsCurrentThread(); }
 
 private:

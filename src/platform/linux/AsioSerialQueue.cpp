@@ -43,4 +43,10 @@ void AsioSerialQueue::dispatchAfter(std::chrono::nanoseconds delay, UniqueFuncti
     work_.runAfter(std::make_shared<asio::steady_timer>(strand_, delay), std::move(work));
 }
 
+void AsioSerialQueue::dispatchTimeout(std::chrono::nanoseconds delay, UniqueFunction<void()> work)
+{
+    auto timer = std::make_shared<asio::steady_timer>(strand_, delay);
+    timer->async_wait([timer, work = std::move(work)](const std::error_code&) mutable { work(); });
+}
+
 } // namespace mx

@@ -17,6 +17,7 @@ public:
     const std::string& label() const override { return label_; }
     void dispatch(UniqueFunction<void()> work) override;
     void dispatchAfter(std::chrono::nanoseconds delay, UniqueFunction<void()> work) override;
+    void dispatchTimeout(std::chrono::nanoseconds delay, UniqueFunction<void()> work) override;
     bool isCurrent() const override { return strand_.running_in_this_thread(); }
 
 private:

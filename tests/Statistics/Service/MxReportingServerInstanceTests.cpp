@@ -33,13 +33,7 @@ protected:
 
     std::shared_ptr<MxReportingServerInstance> connect(std::int32_t pid) { return host.connect(pid); }
 
-    // Runs what is queued, and the deliveries it held once they have gathered.
-    void run()
-    {
-        platform.dispatch.runUntilIdle();
-        platform.dispatch.advance(MxReportingSessionUplink::kDeliveryGathering);
-        platform.dispatch.runUntilIdle();
-    }
+    void run() { platform.dispatch.runUntilIdle(); }
 
     bool create(MxReportingServerInstance& client, ReporterID id)
     {
