@@ -27,6 +27,8 @@ public:
 
     std::size_t owed() const { return owed_.load(); }
     bool overdrawn() const;
+    // Owes more than a quarter of its bound: one of the clients filling the queues.
+    bool owesMuch() const { return owed() > bound_ / 4; }
     // Runs `resume` once the account owes at most half its bound: on the thread that
     // settles it that far, or here, at once, when it does already. The account must be
     // held by a shared_ptr.
@@ -65,6 +67,7 @@ public:
 
     // Its account is past its bound: its client waits for what it owes to be done.
     bool overdrawn() const { return account_ && account_->overdrawn(); }
+    bool owesMuch() const { return account_ && account_->owesMuch(); }
 
 private:
     friend class ScopedBacklogAccount;

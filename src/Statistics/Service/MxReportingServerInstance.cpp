@@ -8,6 +8,7 @@
 
 #include "Statistics/MxReportingJouleUtility.h"
 #include "Statistics/MxReportingTallyBridge.h"
+#include "platform/ReplyGate.h"
 #include "platform/TracePoints.h"
 
 namespace mx {
@@ -326,11 +327,13 @@ void MxReportingServerInstance::handleSendMessage(FanOut& message)
         return;
     }
     root->noteReportReceived();
+    // The reply says the message was taken: it goes once everything the message left
+    // is kept, which is at once unless a row found no room or a delivery waits.
+    ScopedReplyGate replyOnceKept([reply = std::move(message.reply)] { reply(std::nullopt); });
     if (message.reportingIDs)
         sendToListedSessions(message);
     else
         sendToStartedSessions(message, *root);
-    message.reply(std::nullopt);
 }
 
 void MxReportingServerInstance::sendToListedSessions(const FanOut& message)

@@ -8,6 +8,7 @@
 #include "platform/BacklogAccount.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Orientation.h"
+#include "platform/ReplyGate.h"
 #include "platform/TracePoints.h"
 #include "wire/MsgpackValue.h"
 
@@ -201,15 +202,22 @@ void MxReportingSession::sendMessage(const Dictionary& message, MessageCategory 
 
 // Jobs hold the session only as `this`: the caller holds it while a job runs in place,
 // and whatever runs the waiting ones holds it then. A job that waits behind another is
-// owed by the client whose request gave it, until it has run, and so is what it writes.
+// owed by the client whose request gave it, until it has run, and so is what it
+// writes; and it holds that request's reply until what it writes is kept.
 template <class F>
 void MxReportingSession::runUplinkJob(F job)
 {
     if (uplink_.runNow(job))
         return;
-    uplink_.runLater([job = std::move(job), debt = BacklogDebt::incur()]() mutable {
+    uplink_.runLater([job = std::move(job), debt = BacklogDebt::incur(), ticket = ReplyTicket::take()]() mutable {
         ScopedBacklogAccount charging(debt);
-        return job();
+        auto end = MxReportingSessionUplink::JobEnd::Done;
+        {
+            ScopedReplyGate replying(ticket);
+            end = job();
+        }
+        ticket.giveBack();
+        return end;
     });
 }
 

@@ -8,6 +8,7 @@
 #include "Statistics/Service/MxReportingSession.h"
 #include "platform/BacklogAccount.h"
 #include "platform/MxLog.h"
+#include "platform/ReplyGate.h"
 #include "platform/TracePoints.h"
 
 namespace mx {
@@ -191,10 +192,13 @@ void MxReportingSessionUplink::sendSingleMessage(const Dictionary& message, Mess
     std::int64_t delta = serviceType == service_type::kAlarms ? randomAlarmDelaySeconds() : 0;
     MXLOG_VERBOSE(logScope(), "sending single message after delta {} for service {}", delta, serviceType);
 
-    // Owed by the client that sent it while it waits, up to 59 s for an alarm.
-    auto send = [message, category, type, serviceType, reply = std::move(reply),
-                 debt = BacklogDebt::incur()]() mutable {
+    // Owed by the client that sent it while it waits, up to 59 s for an alarm; and,
+    // unless it waits out an alarm's delay (which a process that ends loses, as
+    // intended), its request's reply waits for it.
+    auto send = [message, category, type, serviceType, reply = std::move(reply), debt = BacklogDebt::incur(),
+                 ticket = delta == 0 ? ReplyTicket::take() : ReplyTicket()]() mutable {
         ScopedBacklogAccount charging(debt);
+        ScopedReplyGate replying(ticket);
         MxTrace(kTraceMessageQueued);
         MXLOG_VERBOSE(logScope(), "sending single message");
         Dictionary sessionInfo{
@@ -217,6 +221,7 @@ void MxReportingSessionUplink::sendSingleMessage(const Dictionary& message, Mess
                           static_cast<std::int32_t>(category), type);
         if (reply)
             reply(sent ? std::nullopt : error);
+        ticket.giveBack();
     };
 
     auto& queue = ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility);

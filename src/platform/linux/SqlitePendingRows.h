@@ -57,6 +57,9 @@ public:
     void release(std::uint64_t number);
     // Any thread, without the lock: whether an everyday row may fit, before it is encoded.
     bool mayHaveRoom() const { return room_.load(std::memory_order_relaxed) >= kEverydayRowBytes; }
+    // Any thread, without the lock: over half the file is taken, and its rows should be
+    // committed soon, before a row finds no room (its reply would wait for a commit).
+    bool halfTaken() const { return room_.load(std::memory_order_relaxed) < kFileBytes / 2; }
 
     const std::filesystem::path& path() const { return path_; }
 

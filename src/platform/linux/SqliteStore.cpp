@@ -254,22 +254,31 @@ void SqliteStore::submit(SqliteWrite write)
     write.debt = BacklogDebt::incur();
     // A client held back waits on its rows: they go now, not at the window's end.
     bool urgent = write.debt.overdrawn();
-    // Encoded before the lock is taken; a full file of pending rows is not tried.
+    // Encoded before the lock is taken; a full file of pending rows is not tried. Its
+    // second half is kept for the clients that owe little: one that fills the queues
+    // (its rows outrunning the writer, or a disk refusing them) waits for commits once
+    // the first half is taken, and the others go on being answered at once.
     std::string_view encoded;
-    if (pending_ && pending_->mayHaveRoom())
+    if (pending_ && pending_->mayHaveRoom() && !(pending_->halfTaken() && write.debt.owesMuch()))
         encoded = SqlitePendingRows::encode(write);
+    // A row kept nowhere holds its request's reply until it is committed.
+    if (encoded.empty())
+        write.ticket = ReplyTicket::take();
     std::lock_guard lock(writer_->mutex());
     if (!encoded.empty())
         write.pending = pending_->keep(encoded);
     bool kept = write.pending != 0;
-    if (!kept)
+    if (!kept) {
         ++unkept_;
+        if (!write.ticket)
+            write.ticket = ReplyTicket::take();
+    }
     queue_.push_back(std::move(write));
     ++submitted_;
     if (urgent)
         writer_->hurry();
     else
-        writer_->queued(queue_.size(), kept);
+        writer_->queued(queue_.size(), kept && !pending_->halfTaken());
 }
 
 void SqliteStore::flush()
@@ -360,6 +369,8 @@ void SqliteStore::writeBatch()
         roundSettled_ = batch_.size();
         roundPending_ = committedPending_;
         roundCheckpoint_ = logPages_ >= checkpointPages_;
+        for (auto& write : batch_)
+            write.ticket.giveBack();
         batch_.clear();
         // Age is looked at now and then; size after any batch that may have taken the
         // rows past their share, so that a burst never takes the store far past its bound;

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/BacklogAccount.h"
+#include "platform/ReplyGate.h"
 #include "platform/UniqueFunction.h"
 #include "value/Value.h"
 
@@ -27,6 +28,8 @@ struct SqliteWrite {
     BacklogDebt debt = {}; // owed by the client whose request made the row, until committed
     // Its number among the store's pending rows (SqlitePendingRows), 0 when not kept there.
     std::uint64_t pending = 0;
+    // A row kept nowhere yet holds its request's reply until it is committed.
+    ReplyTicket ticket = {};
 };
 
 } // namespace mx
