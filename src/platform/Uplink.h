@@ -40,8 +40,9 @@ struct UplinkError {
 class UplinkSession {
 public:
     virtual ~UplinkSession() = default;
-    // Returns at once; `completion` runs once, later, on a backend thread, with the
-    // backends that answered (possibly none) or with nothing when discovery failed.
+    // Returns at once; `completion` runs once, with the backends that answered
+    // (possibly none) or with nothing when discovery failed: in place, when the
+    // backends' answer is known already, else later, on a backend thread.
     virtual void startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion) = 0;
     // Sends whatever the session still holds; `completion` runs once, on a backend
     // thread, with the error or nothing.

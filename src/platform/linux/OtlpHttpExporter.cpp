@@ -13,6 +13,7 @@
 #include <zlib.h>
 
 #include "platform/MxLog.h"
+#include "platform/WorkQueue.h"
 #include "platform/linux/SqliteStore.h"
 
 namespace mx {
@@ -185,25 +186,58 @@ std::optional<UplinkError> OtlpHttpExporter::currentError() const
     return error_;
 }
 
-bool OtlpHttpExporter::probe()
+std::optional<bool> OtlpHttpExporter::answeredLately() const
 {
-    // Every session start asks; the collector is asked at most once a few seconds.
+    std::lock_guard lock(mutex_);
+    auto now = std::chrono::steady_clock::now();
+    if (lastAnswered_ && now - *lastAnswered_ < kProbeReuse)
+        return true;
+    if (lastAsked_ && now - *lastAsked_ < kProbeReuse)
+        return false;
+    return std::nullopt;
+}
+
+// Every session start asks: the collector is asked at most once a few seconds, and
+// however many starts ask at once, one probe answers them all, holding one thread.
+void OtlpHttpExporter::probe(UniqueFunction<void(bool)> answered)
+{
+    if (auto known = answeredLately()) {
+        answered(*known);
+        return;
+    }
     {
         std::lock_guard lock(mutex_);
-        if (lastProbe_ && std::chrono::steady_clock::now() - *lastProbe_ < kProbeReuse)
-            return probeAnswered_;
+        probeWaiters_.push_back(std::move(answered));
+        if (std::exchange(probing_, true))
+            return;
     }
-    std::chrono::seconds retryAfter{0};
-    long status = 0;
-    // A handle of its own: the exporter thread's may be in the middle of a request.
-    CURL* curl = curl_easy_init();
-    post(curl, logsRequest(Json::array()), std::min<std::chrono::milliseconds>(collector_.timeout, kProbeTimeout),
-         retryAfter, status);
-    curl_easy_cleanup(curl);
-    std::lock_guard lock(mutex_);
-    lastProbe_ = std::chrono::steady_clock::now();
-    probeAnswered_ = status != 0;
-    return probeAnswered_;
+    ProcessWide<Dispatch>::get().globalQueue(QueuePriority::Utility).dispatch([self = shared_from_this()] {
+        ScopedBlockingCall probing;
+        std::chrono::seconds retryAfter{0};
+        long status = 0;
+        // A handle of its own: the exporter thread's may be in the middle of a request.
+        CURL* curl = curl_easy_init();
+        self->post(curl, logsRequest(Json::array()),
+                   std::min<std::chrono::milliseconds>(self->collector_.timeout, kProbeTimeout), retryAfter, status);
+        curl_easy_cleanup(curl);
+        std::vector<UniqueFunction<void(bool)>> waiters;
+        {
+            std::lock_guard lock(self->mutex_);
+            self->noteAsked(status);
+            self->probing_ = false;
+            waiters.swap(self->probeWaiters_);
+        }
+        for (auto& waiter : waiters)
+            waiter(status != 0);
+    });
+}
+
+void OtlpHttpExporter::noteAsked(long status)
+{
+    auto now = std::chrono::steady_clock::now();
+    lastAsked_ = now;
+    if (status != 0)
+        lastAnswered_ = now;
 }
 
 std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string& body,
@@ -387,6 +421,10 @@ std::optional<UplinkError> OtlpHttpExporter::exportBatch(std::size_t& exported)
         std::chrono::seconds retryAfter{0};
         long status = 0;
         failure = post(handle_, logsRequest(records), collector_.timeout, retryAfter, status);
+        {
+            std::lock_guard lock(mutex_);
+            noteAsked(status);
+        }
         if (failure && retryAfter.count() > 0) {
             failure->description += fmt::format(" (retry after {} s)", retryAfter.count());
             retryAfter_ = retryAfter;

@@ -18,7 +18,9 @@
 #include <string>
 #include <sys/types.h>
 #include <thread>
+#include <vector>
 
+#include "platform/UniqueFunction.h"
 #include "platform/Uplink.h"
 #include "platform/linux/OtlpCollector.h"
 
@@ -26,7 +28,7 @@ struct sqlite3;
 
 namespace mx {
 
-class OtlpHttpExporter {
+class OtlpHttpExporter : public std::enable_shared_from_this<OtlpHttpExporter> {
 public:
     OtlpHttpExporter(std::filesystem::path spool, OtlpCollector collector);
     ~OtlpHttpExporter();
@@ -35,9 +37,14 @@ public:
 
     const std::string& url() const { return collector_.url; }
     const OtlpCollector& collector() const { return collector_; }
-    // Whether the collector answers an HTTP request at all (any status). Blocks for
-    // at most a few seconds; callable from any thread.
-    bool probe();
+    // Whether the collector answered an HTTP request (any status) in the last few
+    // seconds, a probe's or an export's: nothing when it was not asked lately.
+    std::optional<bool> answeredLately() const;
+    // Asks the collector whether it answers an HTTP request at all (any status), unless
+    // it was asked lately, and tells `answered`: at once, or from the global utility
+    // queue once the one probe in flight for every asker has its answer (a few seconds
+    // at most). Callable from any thread; must be held by a shared_ptr.
+    void probe(UniqueFunction<void(bool)> answered);
     // Asks for an export pass now rather than at the next poll.
     void wake();
     // Waits (at most `timeout`) until every spooled message of `session` has been
@@ -57,6 +64,9 @@ private:
     // The spool's file opened, again if the store made it anew; false while it cannot be.
     bool openSpool();
     void measureLag();
+    // Under the lock: the collector was asked something, and answered with `status`
+    // (0: no answer at all).
+    void noteAsked(long status);
     // `status` is the HTTP status, 0 when no response came at all.
     std::optional<UplinkError> post(void* curl, const std::string& body, std::chrono::milliseconds timeout,
                                     std::chrono::seconds& retryAfter, long& status);
@@ -79,8 +89,10 @@ private:
     double oldestUnacknowledged_ = 0; // seconds since the epoch; 0 when none
     std::uint64_t passes_ = 0;
     std::set<std::int64_t> deliveredSessions_;
-    std::optional<std::chrono::steady_clock::time_point> lastProbe_;
-    bool probeAnswered_ = false;
+    std::optional<std::chrono::steady_clock::time_point> lastAsked_;    // a probe or an export post
+    std::optional<std::chrono::steady_clock::time_point> lastAnswered_; // any HTTP status
+    bool probing_ = false;
+    std::vector<UniqueFunction<void(bool)>> probeWaiters_;
     std::thread thread_;
 };
 

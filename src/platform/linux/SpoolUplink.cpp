@@ -185,15 +185,53 @@ Dictionary SpoolUplink::exportersStatus() const
     return status;
 }
 
-std::vector<std::string> SpoolUplink::discoverBackends()
+void SpoolUplink::discoverBackends(UniqueFunction<void(std::vector<std::string>)> found)
 {
-    std::vector<std::string> answered;
+    // Each backend's answer in its place, so the list keeps the configuration's order.
+    struct Discovery {
+        std::mutex mutex;
+        std::vector<std::optional<std::string>> answered;
+        std::size_t asking = 0;
+        UniqueFunction<void(std::vector<std::string>)> found;
+
+        void finish()
+        {
+            std::vector<std::string> backends;
+            for (auto& backend : answered)
+                if (backend)
+                    backends.push_back(std::move(*backend));
+            found(std::move(backends));
+        }
+    };
+    auto current = exporters();
+    auto discovery = std::make_shared<Discovery>();
+    discovery->found = std::move(found);
+    discovery->answered.resize(current.size() + 1);
     if (spoolListed_.load())
-        answered.push_back("spool");
-    for (auto& exporter : exporters())
-        if (exporter->probe())
-            answered.push_back(exporter->url());
-    return answered;
+        discovery->answered[0] = "spool";
+    std::vector<std::size_t> unknown;
+    for (std::size_t i = 0; i < current.size(); ++i) {
+        auto lately = current[i]->answeredLately();
+        if (!lately)
+            unknown.push_back(i);
+        else if (*lately)
+            discovery->answered[i + 1] = current[i]->url();
+    }
+    if (unknown.empty()) {
+        discovery->finish();
+        return;
+    }
+    discovery->asking = unknown.size();
+    for (std::size_t i : unknown)
+        current[i]->probe([discovery, i, url = current[i]->url()](bool answered) {
+            std::unique_lock lock(discovery->mutex);
+            if (answered)
+                discovery->answered[i + 1] = url;
+            if (--discovery->asking == 0) {
+                lock.unlock();
+                discovery->finish();
+            }
+        });
 }
 
 std::optional<UplinkError> SpoolUplink::settleSession(std::int64_t session, bool realtime)

@@ -54,9 +54,11 @@ public:
     // stopped to match, the spool's retention. Callable from any thread.
     void reconfigure(const Backends& backends, const StoreLimit& limit);
 
-    // The backends that answer now: "spool" when it is listed, and every collector
-    // that responds. Blocks for the probes; backend threads only.
-    std::vector<std::string> discoverBackends();
+    // The backends that answer now, to `found`: "spool" when it is listed, and every
+    // collector that answered lately or answers its probe. At once, in place, when no
+    // collector needs asking (the spool alone, or collectors heard from lately); else
+    // from the global utility queue once the probes are answered. Any thread.
+    void discoverBackends(UniqueFunction<void(std::vector<std::string>)> found);
     // Waits (bounded) until the exporters hold the session's messages acknowledged,
     // or for their error; for a realtime session only their current error.
     std::optional<UplinkError> settleSession(std::int64_t session, bool realtime);

@@ -26,18 +26,16 @@ SpoolUplinkSession::SpoolUplinkSession(std::shared_ptr<SpoolUplink> uplink, std:
         {SpoolUplink::kInsertSession, {id_, std::move(sessionInfo), std::move(userInfo), secondsSinceEpoch()}});
 }
 
+// The spool answers at once however many sessions start: their configuration never
+// waits for it.
 void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<std::vector<std::string>>)> completion)
 {
-    ProcessWide<Dispatch>::get()
-        .globalQueue(QueuePriority::Utility)
-        .dispatch([uplink = uplink_, completion = std::move(completion)]() mutable {
-            ScopedBlockingCall probing;
-            auto backends = uplink->discoverBackends();
-            if (backends.empty())
-                completion(std::nullopt);
-            else
-                completion(std::move(backends));
-        });
+    uplink_->discoverBackends([completion = std::move(completion)](std::vector<std::string> backends) mutable {
+        if (backends.empty())
+            completion(std::nullopt);
+        else
+            completion(std::move(backends));
+    });
 }
 
 SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const
