@@ -65,8 +65,7 @@ double bareInsert(const std::filesystem::path& file, int events)
 
 double storeInsert(const std::filesystem::path& directory, int events)
 {
-    std::string error;
-    auto tally = SqliteTally::open(directory / "tally.db", {}, StoreLimit{}, error);
+    auto tally = SqliteTally::open(directory / "tally.db", {}, StoreLimit{});
     auto began = Clock::now();
     for (int i = 0; i < events; ++i)
         tally->sendEventLazy("com.kestrel.harmonia.Session_Playback.Start", [i] { return payload(i); });

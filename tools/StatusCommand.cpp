@@ -77,9 +77,12 @@ void printStatus(const Json& status)
     std::printf("stores:\n");
     const Json& stores = member(status, "stores");
     for (const auto& [name, store] : stores.items())
-        std::printf("  %-7s %lld rows written, %lld queued, %s on disk, %lld failed writes\n", printable(name).c_str(),
-                    count(store, "rows_written"), count(store, "queue_depth"),
-                    humanBytes(number(store, "bytes")).c_str(), count(store, "failures"));
+        std::printf("  %-7s %lld rows written, %lld queued, %s on disk, %lld failed writes%s\n",
+                    printable(name).c_str(), count(store, "rows_written"), count(store, "queue_depth"),
+                    humanBytes(number(store, "bytes")).c_str(), count(store, "failures"),
+                    member(store, "pending_rows_in_memory") == Json(true)
+                        ? "; rows not yet written are in memory alone (the disk refused their file)"
+                        : "");
     const Json& exporters = member(status, "exporters");
     bool any = exporters.is_object() && !exporters.empty();
     std::printf("exporters:%s\n", any ? "" : " none (the spool alone)");

@@ -113,9 +113,12 @@ std::string helpFooter(bool forManual)
     return footer;
 }
 
-// How long a shutdown waits for the queues: sessions still waiting on backend
-// discovery take up to 9 s a round, and the unit's stop timeout is 90 s.
-constexpr std::chrono::milliseconds kDrainBound{60'000};
+// How long a stop takes at most, whatever the stores do: first the queues run what was
+// taken, then the stores commit what they can. What they cannot stays in the pending
+// rows for the next start. Sessions still waiting on backend discovery are not waited
+// for: their reports were not answered yet.
+constexpr std::chrono::seconds kStopBound{10};
+constexpr std::chrono::seconds kDrainBound{6};
 
 // Every client is a descriptor: take all the system allows, not the shell's default.
 void raiseDescriptorLimit()
@@ -230,20 +233,16 @@ int run(int argc, char** argv)
         fail(joined(errors));
     const StoreLimits& limits = configuration->limits;
     MxReportingSessionSummary::setRetention(limits.summaries.maxFiles, limits.summaries.maxBytes);
-    auto tally = SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"), configuration->disabledEvents,
-                                   limits.tally, error);
-    if (!tally)
-        fail(error);
+    // Stores that cannot be written now are opened all the same: the daemon serves, and
+    // they try again.
+    auto tally =
+        SqliteTally::open(MxReportingPath("var/lib/harmonia/tally.db"), configuration->disabledEvents, limits.tally);
     ProcessWide<Tally>::install(tally.get());
-    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), limits.joule, error);
-    if (!joule)
-        fail(error);
+    auto joule = SqliteJoule::open(MxReportingPath("var/lib/harmonia/joule.db"), limits.joule);
     ProcessWide<Joule>::install(joule.get());
     curl_global_init(CURL_GLOBAL_DEFAULT);
     auto uplink =
-        SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), configuration->backends, limits.uplink, error);
-    if (!uplink)
-        fail(error);
+        SpoolUplink::open(MxReportingPath("var/lib/harmonia/uplink.db"), configuration->backends, limits.uplink);
     ProcessWide<Uplink>::install(uplink.get());
 
     ProcProcessTable processTable;
@@ -314,14 +313,19 @@ int run(int argc, char** argv)
     BacklogAccount::forgiveAll();
     if (!dispatch.drain(kDrainBound))
         MXLOG_LIMITED(nullptr, Error, "queues still busy after {} s: committing what they handed over",
-                      kDrainBound.count() / 1000);
-    tally->store().flush();
-    joule->store().flush();
-    uplink->store().flush();
+                      kDrainBound.count());
+    SqliteStore::Uncommitted left;
+    for (SqliteStore* store : {&tally->store(), &joule->store(), &uplink->store()})
+        left += store->flush(began + kStopBound);
     MxReportingMetrics::remove();
-    MXLOG_LIMITED(
-        nullptr, Default, "mxreportingd stopped: everything taken is committed ({} ms)",
-        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - began).count());
+    auto took = std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - began).count();
+    if (left.kept + left.inMemory == 0)
+        MXLOG_LIMITED(nullptr, Default, "mxreportingd stopped: everything taken is committed ({} ms)", took);
+    else
+        MXLOG_LIMITED(nullptr, Error,
+                      "mxreportingd stopped after {} ms with {} rows the stores could not commit: {} stay in the "
+                      "pending rows for the next start, {} held in memory alone are lost",
+                      took, left.kept + left.inMemory, left.kept, left.inMemory);
     // Queues and connections are not torn down: the process simply ends.
     std::_Exit(0);
 }

@@ -14,8 +14,6 @@
 #include <gtest/gtest.h>
 
 #include "integration/IntegrationHelpers.h"
-#include "wire/MsgpackRpcMessage.h"
-#include "wire/MsgpackValue.h"
 
 namespace mx::testing {
 namespace {
@@ -27,32 +25,6 @@ protected:
 
     DaemonProcess daemon;
 };
-
-// Requests written in one go on a raw connection, and their responses read back in
-// the order of their msgids: what a pipelining client sees.
-std::vector<RpcResponse> exchange(RawConnection& connection, const std::vector<std::pair<std::string, Array>>& requests,
-                                  std::size_t responses)
-{
-    msgpack::sbuffer bytes;
-    for (std::size_t i = 0; i < requests.size(); ++i)
-        encodeRpcRequest(bytes, static_cast<std::uint32_t>(i), requests[i].first, requests[i].second);
-    EXPECT_TRUE(connection.send(std::string(bytes.data(), bytes.size())));
-    std::vector<RpcResponse> answered(requests.size());
-    msgpack::unpacker unpacker;
-    for (std::size_t got = 0; got < responses;) {
-        unpacker.reserve_buffer(65536);
-        ssize_t length = ::recv(connection.fd(), unpacker.buffer(), 65536, 0);
-        if (length <= 0)
-            break;
-        unpacker.buffer_consumed(std::size_t(length));
-        for (msgpack::object_handle handle; unpacker.next(handle); ++got) {
-            std::string reason;
-            auto response = parseRpcResponse(*decodeMsgpack(handle.get(), reason), reason);
-            answered[response->msgid] = *response;
-        }
-    }
-    return answered;
-}
 
 std::vector<std::pair<std::string, Array>> creates(std::int64_t first, std::int64_t last)
 {

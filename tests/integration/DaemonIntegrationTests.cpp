@@ -286,21 +286,35 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
     client.reset();
 }
 
-TEST(DaemonStoreFailureTest, StoresThatCannotBeWrittenAtStartUpAreAClearError)
+// Stores that cannot be written at start-up keep no daemon from serving: it says so,
+// with what to mend, holds what it is sent, and writes it once the disk takes it.
+TEST(DaemonStoreFailureTest, StoresThatCannotBeWrittenAtStartUpServeAndWriteOnceTheyCan)
 {
     DaemonProcess daemon;
     Tmpfs stores(daemon.path("var/lib/harmonia"), "size=1m,ro");
     if (!stores.mounted())
         GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
-    std::string text;
-    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH}, text), 1);
+    daemon.start();
     // What to mend: the file, its directory's owner and mode, and whom the daemon runs as.
-    EXPECT_THAT(text,
-                ::testing::ContainsRegex("mxreportingd cannot start \\(running as user [^ ]+, group [^ ]+\\): " +
-                                         daemon.path("var/lib/harmonia/tally.db").string() +
+    EXPECT_THAT(daemon.log(),
+                ::testing::ContainsRegex(daemon.path("var/lib/harmonia/tally.db").string() +
                                          ": cannot make it: Read-only file system \\(" +
                                          daemon.path("var/lib/harmonia").string() +
                                          " is owned by [^ ]+:[^ ]+, mode [0-7]+; this process runs as"));
+    EXPECT_THAT(daemon.log(), ::testing::HasSubstr("kept in memory alone"));
+    auto client = connectTo(daemon);
+    ASSERT_EQ(client->createSession(3), 0);
+    for (int i = 0; i < 10; ++i)
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"n", i}}), 3, 1, {3}), 0);
+    std::string status;
+    ASSERT_EQ(client->status(status), 0);
+    EXPECT_EQ(nlohmann::json::parse(status)["stores"]["tally"]["pending_rows_in_memory"], true);
+
+    ASSERT_TRUE(stores.remount("rw"));
+    EXPECT_TRUE(waitUntil([&] {
+        auto rows = daemon.query("tally", "SELECT count(*) FROM events");
+        return !rows.empty() && rows[0][0] == "10";
+    }));
 }
 
 TEST(DaemonStoreFailureTest, CorruptStoresAreSetAsideAndARemovedOneIsMadeAnew)

@@ -24,6 +24,8 @@
 #include "integration/DaemonProcess.h"
 #include "value/JsonValue.h"
 #include "value/Value.h"
+#include "wire/MsgpackRpcMessage.h"
+#include "wire/MsgpackValue.h"
 
 namespace mx::testing {
 
@@ -75,6 +77,33 @@ private:
     int fd_ = -1;
     bool connected_ = false;
 };
+
+// Requests written in one go on a raw connection, and `responses` of their responses
+// read back, each in its request's place: what a pipelining client sees.
+using RawRequest = std::pair<std::string, Array>;
+inline std::vector<RpcResponse> exchange(RawConnection& connection, const std::vector<RawRequest>& requests,
+                                         std::size_t responses)
+{
+    msgpack::sbuffer bytes;
+    for (std::size_t i = 0; i < requests.size(); ++i)
+        encodeRpcRequest(bytes, static_cast<std::uint32_t>(i), requests[i].first, requests[i].second);
+    EXPECT_TRUE(connection.send(std::string(bytes.data(), bytes.size())));
+    std::vector<RpcResponse> answered(requests.size());
+    msgpack::unpacker unpacker;
+    for (std::size_t got = 0; got < responses;) {
+        unpacker.reserve_buffer(65536);
+        ssize_t length = ::recv(connection.fd(), unpacker.buffer(), 65536, 0);
+        if (length <= 0)
+            break;
+        unpacker.buffer_consumed(std::size_t(length));
+        for (msgpack::object_handle handle; unpacker.next(handle); ++got) {
+            std::string reason;
+            auto response = parseRpcResponse(*decodeMsgpack(handle.get(), reason), reason);
+            answered[response->msgid] = *response;
+        }
+    }
+    return answered;
+}
 
 inline std::string packed(const std::function<void(msgpack::packer<msgpack::sbuffer>&)>& write)
 {

@@ -64,7 +64,7 @@ def main():
         check("status clients", sorted(client["sessions"] for client in status["clients"]), [0, 1])
         check("status stores", sorted(status["stores"]), ["joule", "tally", "uplink"])
         check("status store counters", sorted(status["stores"]["tally"]),
-              ["bytes", "failures", "queue_depth", "rows_written"])
+              ["bytes", "failures", "pending_rows_in_memory", "queue_depth", "rows_written"])
         error, _ = a.reply(a.send("status", 1))
         check("status takes no arguments", error["code"], 2)
 

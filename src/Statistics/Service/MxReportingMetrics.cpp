@@ -33,6 +33,8 @@ constexpr Series kStore[] = {
     {"queue_depth", "mxreportingd_store_queue_depth", "gauge", "Rows waiting for the store's writer."},
     {"bytes", "mxreportingd_store_bytes", "gauge", "Bytes the store takes on disk."},
     {"failures", "mxreportingd_store_failures_total", "counter", "Failed attempts to write to the store."},
+    {"pending_rows_in_memory", "mxreportingd_store_pending_rows_in_memory", "gauge",
+     "1 while the disk refuses the file of pending rows: a crash would lose the rows not yet committed."},
 };
 
 constexpr Series kExporter[] = {

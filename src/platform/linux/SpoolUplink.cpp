@@ -116,7 +116,7 @@ std::optional<SpoolUplink::Backends> SpoolUplink::readBackends(const std::filesy
 }
 
 std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& database, const Backends& backends,
-                                               const StoreLimit& limit, std::string& error)
+                                               const StoreLimit& limit)
 {
     const auto& collectors = backends.collectors;
     auto store = SqliteStore::open(
@@ -130,9 +130,7 @@ std::shared_ptr<SpoolUplink> SpoolUplink::open(const std::filesystem::path& data
          "UPDATE sessions SET flushed = ? WHERE id = ?",
          "INSERT INTO messages(session, time, category, type, payload, session_info, user_info) "
          "VALUES(?, ?, ?, ?, ?, ?, ?)"},
-        spoolRetention(limit, collectors), error);
-    if (!store)
-        return nullptr;
+        spoolRetention(limit, collectors));
     return std::shared_ptr<SpoolUplink>(new SpoolUplink(std::move(store), backends.spool, collectors));
 }
 
@@ -240,7 +238,9 @@ std::optional<UplinkError> SpoolUplink::settleSession(std::int64_t session, bool
     if (current.empty())
         return std::nullopt;
     // The exporters read the spool: the session's rows must be committed first.
-    store_->flush();
+    auto left = store_->flush(std::chrono::steady_clock::now() + kSettleTimeout);
+    if (left.kept + left.inMemory > 0)
+        return UplinkError{-1, "the spool cannot commit the session's messages now: they wait for it"};
     for (auto& exporter : current) {
         auto error = realtime ? exporter->currentError() : exporter->waitForSession(session, kSettleTimeout);
         if (error)

@@ -37,7 +37,7 @@ public:
 
     // The spool at `database`, exporting to the collectors of `backends`.
     static std::shared_ptr<SpoolUplink> open(const std::filesystem::path& database, const Backends& backends,
-                                             const StoreLimit& limit, std::string& error);
+                                             const StoreLimit& limit);
     ~SpoolUplink() override;
 
     UplinkSecureHierarchyToken newSecureHierarchyToken(const UplinkSecureHierarchyToken* parent) override;

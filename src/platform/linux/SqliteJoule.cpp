@@ -5,16 +5,13 @@
 
 namespace mx {
 
-std::unique_ptr<SqliteJoule> SqliteJoule::open(const std::filesystem::path& database, const StoreLimit& limit,
-                                               std::string& error)
+std::unique_ptr<SqliteJoule> SqliteJoule::open(const std::filesystem::path& database, const StoreLimit& limit)
 {
     auto store = SqliteStore::open(database,
                                    {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, "
                                     "agent INTEGER, name TEXT, payload TEXT)"},
                                    {"INSERT INTO events(time, agent, name, payload) VALUES(?, ?, ?, ?)"},
-                                   eventsRetention(limit), error);
-    if (!store)
-        return nullptr;
+                                   eventsRetention(limit));
     return std::unique_ptr<SqliteJoule>(new SqliteJoule(std::move(store)));
 }
 

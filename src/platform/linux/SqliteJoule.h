@@ -13,8 +13,7 @@ struct StoreLimit;
 
 class SqliteJoule final : public Joule {
 public:
-    static std::unique_ptr<SqliteJoule> open(const std::filesystem::path& database, const StoreLimit& limit,
-                                             std::string& error);
+    static std::unique_ptr<SqliteJoule> open(const std::filesystem::path& database, const StoreLimit& limit);
 
     void logRegisteredEvent(std::int32_t agent, std::string_view name, Dictionary event,
                             const Dictionary* options) override;

@@ -3,12 +3,14 @@
 #include <algorithm>
 #include <atomic>
 #include <cstring>
+#include <ctime>
 #include <fcntl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <system_error>
 #include <unistd.h>
 
+#include <fmt/format.h>
 #include <msgpack.hpp>
 #include <zlib.h>
 
@@ -20,10 +22,15 @@ namespace mx {
 
 namespace {
 
-// The header: a signature, then the offset of the oldest record still wanted.
+// The header: a signature, the offset of the oldest record still wanted, and the name of
+// the store the rows are for (zeros in a file made before files named their store).
 constexpr char kSignature[16] = {'m', 'x', 'r', 'e', 'p', 'o', 'r', 't', 'i', 'n', 'g', '-', 'r', 'o', 'w', 's'};
 constexpr std::uint64_t kTailOffset = 16;
+constexpr std::uint64_t kStoreNameOffset = 24;
+constexpr std::size_t kStoreNameBytes = 40;
 constexpr std::uint64_t kHeaderBytes = 64;
+// A record numbered past this was not numbered by a store: one more would wrap.
+constexpr std::uint64_t kLargestNumber = std::uint64_t{1} << 62;
 
 // A record: magic, payload length, number, checksum (of the length, the number and
 // the payload), a zero word, then the payload, padded to eight bytes.
@@ -73,7 +80,7 @@ std::string errnoText(int error) { return std::generic_category().message(error)
 
 // Zeros written rather than a hole: a full disk shows now, not as a fault on a page
 // of the mapping later.
-bool makeAfresh(int fd, std::string& error)
+bool makeAfresh(int fd, const std::string& storeName, std::string& error)
 {
     std::vector<char> zeros(std::size_t{64} << 10);
     bool written = ::ftruncate(fd, 0) == 0;
@@ -83,19 +90,26 @@ bool makeAfresh(int fd, std::string& error)
         if (count >= 0 && !written)
             errno = ENOSPC;
     }
+    char name[kStoreNameBytes] = {};
+    storeName.copy(name, kStoreNameBytes - 1);
     if (written)
         written = ::pwrite(fd, kSignature, sizeof kSignature, 0) == sizeof kSignature &&
-            ::pwrite(fd, &kHeaderBytes, sizeof kHeaderBytes, kTailOffset) == sizeof kHeaderBytes;
+            ::pwrite(fd, &kHeaderBytes, sizeof kHeaderBytes, kTailOffset) == sizeof kHeaderBytes &&
+            ::pwrite(fd, name, sizeof name, kStoreNameOffset) == sizeof name;
     if (!written)
         error = "cannot make it: " + errnoText(errno);
     return written;
 }
 
-bool looksKept(const char* base)
+// A file of this store's pending rows: one of another store's would put its rows in
+// the wrong table.
+bool looksKept(const char* base, const std::string& storeName)
 {
     auto tail = load<std::uint64_t>(base + kTailOffset);
+    std::string_view named(base + kStoreNameOffset, ::strnlen(base + kStoreNameOffset, kStoreNameBytes));
     return std::memcmp(base, kSignature, sizeof kSignature) == 0 && tail >= kHeaderBytes &&
-        tail + kTerminatorRoom <= SqlitePendingRows::kFileBytes && tail % 8 == 0;
+        tail + kTerminatorRoom <= SqlitePendingRows::kFileBytes && tail % 8 == 0 &&
+        (named.empty() || named == storeName);
 }
 
 // A parameter goes through the wire's own decoder; a row holds only the kinds a
@@ -144,23 +158,104 @@ std::optional<SqliteWrite> decodeRow(std::string_view bytes, std::size_t stateme
 
 } // namespace
 
-std::unique_ptr<SqlitePendingRows> SqlitePendingRows::open(const std::filesystem::path& path, std::string& error)
+namespace {
+
+// Why a file in the pending rows' place is not this daemon's own to trust: rows that
+// others can write, or that another path also names, would be written into the store
+// as if they had been answered here. Nothing when it is.
+std::optional<std::string> untrusted(const struct stat& file)
 {
-    int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, SqliteStore::kFileMode);
+    if (!S_ISREG(file.st_mode))
+        return "it is not a regular file";
+    if (file.st_nlink != 1)
+        return fmt::format("it has {} links", file.st_nlink);
+    if (file.st_uid != ::geteuid())
+        return fmt::format("it is owned by uid {}, not this daemon's {}", file.st_uid, ::geteuid());
+    mode_t mode = file.st_mode & 07777;
+    if (mode != 0600 && mode != SqliteStore::kFileMode)
+        return fmt::format("its mode is {:04o}, not 0600 or {:04o}", mode, SqliteStore::kFileMode);
+    return std::nullopt;
+}
+
+// "tally.db-pending" -> "tally.db-pending.set-aside-20261123T041500".
+void setAside(const std::filesystem::path& path, const std::string& why)
+{
+    std::time_t now = std::time(nullptr);
+    std::tm local{};
+    localtime_r(&now, &local);
+    char stamp[32];
+    std::strftime(stamp, sizeof(stamp), "%Y%m%dT%H%M%S", &local);
+    auto aside = path.string() + ".set-aside-" + stamp;
+    std::error_code failure;
+    std::filesystem::rename(path, aside, failure);
+    if (failure)
+        std::filesystem::remove_all(path, failure);
+    MXLOG_LIMITED(nullptr, Error, "{}: {}: set aside as {} unread, starting a fresh one", path.string(), why,
+                  failure ? std::string("nothing (it could not be moved either)")
+                          : std::filesystem::path(aside).filename().string());
+}
+
+// The file opened for reading and writing, nothing on the other end able to block the
+// open; a file that is not the daemon's own is set aside and a fresh one made.
+int openOwnFile(const std::filesystem::path& path, std::string& error)
+{
+    constexpr int kFlags = O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+    int fd = ::open(path.c_str(), kFlags | O_CREAT, SqliteStore::kFileMode);
+    if (fd < 0 && (errno == ELOOP || errno == EISDIR || errno == ENXIO)) {
+        setAside(path, errno == ELOOP ? "it is a symbolic link" : "it is not a regular file");
+        fd = ::open(path.c_str(), kFlags | O_CREAT | O_EXCL, SqliteStore::kFileMode);
+    }
     if (fd < 0) {
         error = "cannot open it: " + errnoText(errno);
-        return nullptr;
+        return -1;
     }
+    struct stat file {};
+    if (::fstat(fd, &file) != 0) {
+        error = "cannot look at it: " + errnoText(errno);
+        ::close(fd);
+        return -1;
+    }
+    if (auto why = untrusted(file)) {
+        ::close(fd);
+        // A link's content stays under its other names: this one goes, and they are
+        // their own files again.
+        if (S_ISREG(file.st_mode) && file.st_nlink > 1 && ::unlink(path.c_str()) == 0)
+            MXLOG_LIMITED(nullptr, Error, "{}: {}: this name of it removed unread, starting a fresh one", path.string(),
+                          *why);
+        else
+            setAside(path, *why);
+        fd = ::open(path.c_str(), kFlags | O_CREAT | O_EXCL, SqliteStore::kFileMode);
+        if (fd < 0)
+            error = "cannot make it: " + errnoText(errno);
+    }
+    return fd;
+}
+
+} // namespace
+
+std::unique_ptr<SqlitePendingRows> SqlitePendingRows::open(const std::filesystem::path& path,
+                                                           const std::string& storeName, std::string& error)
+{
+    int fd = openOwnFile(path, error);
+    if (fd < 0)
+        return nullptr;
     struct stat status {};
-    bool sized = ::fstat(fd, &status) == 0 && static_cast<std::uint64_t>(status.st_size) == kFileBytes;
+    // Its pages all on disk: one missing would be a fault on the mapping when a full
+    // disk cannot give it, and the daemon would die of it.
+    bool sized = ::fstat(fd, &status) == 0 && static_cast<std::uint64_t>(status.st_size) == kFileBytes &&
+        (static_cast<std::uint64_t>(status.st_blocks) * 512 >= kFileBytes ||
+         ::posix_fallocate(fd, 0, static_cast<off_t>(kFileBytes)) == 0);
     void* mapping = sized ? ::mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0) : MAP_FAILED;
-    bool foreign = sized ? mapping != MAP_FAILED && !looksKept(static_cast<const char*>(mapping)) : status.st_size > 0;
+    bool foreign =
+        sized ? mapping != MAP_FAILED && !looksKept(static_cast<const char*>(mapping), storeName) : status.st_size > 0;
     if (foreign) {
-        MXLOG_LIMITED(nullptr, Error, "{} is not a file of pending rows: starting it afresh", path.string());
-        ::munmap(mapping, kFileBytes);
+        MXLOG_LIMITED(nullptr, Error, "{} is not a file of {}'s pending rows: starting it afresh", path.string(),
+                      storeName);
+        if (mapping != MAP_FAILED)
+            ::munmap(mapping, kFileBytes);
         mapping = MAP_FAILED;
     }
-    if ((!sized || foreign) && makeAfresh(fd, error)) {
+    if ((!sized || foreign) && makeAfresh(fd, storeName, error)) {
         ::fchmod(fd, SqliteStore::kFileMode);
         mapping = ::mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
     }
@@ -195,12 +290,17 @@ std::vector<SqliteWrite> SqlitePendingRows::rowsAfter(std::uint64_t committed, s
             at = kHeaderBytes;
             continue;
         }
+        if (magic == 0)
+            break;
         auto length = load<std::uint32_t>(record + 4);
         auto number = load<std::uint64_t>(record + 8);
         auto size = recordBytes(length);
         if (magic != kRecordMagic || at + size + kTerminatorRoom > kFileBytes || (last != 0 && number != last + 1) ||
-            number == 0 || checksum(record, length) != load<std::uint32_t>(record + 16))
+            number == 0 || number >= kLargestNumber || checksum(record, length) != load<std::uint32_t>(record + 16)) {
+            MXLOG_LIMITED(nullptr, Error, "{}: damaged at byte {}: read up to there; {} records lay past it, not read",
+                          path_.string(), at, recordsNewerThan(last));
             break;
+        }
         last = number;
         walked += size;
         if (number > committed) {
@@ -222,6 +322,23 @@ std::vector<SqliteWrite> SqlitePendingRows::rowsAfter(std::uint64_t committed, s
     publishTail();
     updateRoom();
     return rows;
+}
+
+// Whole records anywhere in the file numbered after `number`: what a damage hides.
+// Older ones are rows given back before, written over in later rounds of the ring.
+std::size_t SqlitePendingRows::recordsNewerThan(std::uint64_t number) const
+{
+    std::size_t found = 0;
+    for (std::uint64_t at = kHeaderBytes; at + kRecordHeaderBytes <= kFileBytes; at += 8) {
+        const char* record = base_ + at;
+        auto length = load<std::uint32_t>(record + 4);
+        if (load<std::uint32_t>(record) != kRecordMagic || at + recordBytes(length) > kFileBytes ||
+            checksum(record, length) != load<std::uint32_t>(record + 16))
+            continue;
+        found += load<std::uint64_t>(record + 8) > number ? 1 : 0;
+        at += recordBytes(length) - 8;
+    }
+    return found;
 }
 
 std::string_view SqlitePendingRows::encode(SqliteWrite& write)

@@ -35,9 +35,13 @@ public:
     // store whose rows outrun it commits the rest within its short window instead.
     static constexpr std::size_t kFileBytes = std::size_t{256} << 10;
 
-    // Opens the file, or makes it when it is missing or is not such a file. Nothing,
-    // with `error`, when it cannot be made or mapped.
-    static std::unique_ptr<SqlitePendingRows> open(const std::filesystem::path& path, std::string& error);
+    // Opens the file of `storeName`'s pending rows ("tally.db"), or makes it when it is
+    // missing or is not such a file. One that is not the daemon's own (not a regular
+    // file, more than one link, another owner, a mode others may write) is set aside
+    // unread, with a line in the log. Nothing, with `error`, when it cannot be made or
+    // mapped.
+    static std::unique_ptr<SqlitePendingRows> open(const std::filesystem::path& path, const std::string& storeName,
+                                                   std::string& error);
     ~SqlitePendingRows();
     SqlitePendingRows(const SqlitePendingRows&) = delete;
     SqlitePendingRows& operator=(const SqlitePendingRows&) = delete;
@@ -45,7 +49,8 @@ public:
     // At start-up, before anything is kept: the rows numbered after `committed`, in
     // order, each with its number in `pending`. They stay kept until released, and
     // rows kept from now on are numbered after them. A row that cannot be read back
-    // (its statement is not one of `statements`) is logged and left out.
+    // (its statement is not one of `statements`) is logged and left out; a damaged
+    // record ends the reading, and the log says how many records lay past it.
     std::vector<SqliteWrite> rowsAfter(std::uint64_t committed, std::size_t statements);
 
     // Any thread: the row as it is kept, in a buffer of the calling thread valid until
@@ -68,6 +73,7 @@ private:
 
     SqlitePendingRows(std::filesystem::path path, char* base);
     std::uint64_t tail() const { return kept_.empty() ? head_ : kept_.front().offset; }
+    std::size_t recordsNewerThan(std::uint64_t number) const;
     void publishTail();
     std::optional<std::uint64_t> placeFor(std::size_t bytes, bool& wraps);
     void updateRoom();

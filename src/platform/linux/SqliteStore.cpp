@@ -28,6 +28,42 @@ std::string errnoText(int error) { return std::generic_category().message(error)
 
 bool isCorruption(int code) { return code == SQLITE_CORRUPT || code == SQLITE_NOTADB; }
 
+// A failure that belongs to the row itself rather than to the store or its disk.
+bool refusesRow(int stepped)
+{
+    int code = stepped & 0xff;
+    return code == SQLITE_CONSTRAINT || code == SQLITE_MISMATCH || code == SQLITE_TOOBIG || code == SQLITE_RANGE;
+}
+
+// A row's parameters for the log, cut short: enough to find it by.
+std::string describeRow(const SqliteWrite& write)
+{
+    constexpr std::size_t kShown = 512;
+    std::string text = "[";
+    for (const auto& parameter : write.parameters) {
+        if (text.size() > 1)
+            text += ", ";
+        std::visit(
+            [&](const auto& value) {
+                using T = std::decay_t<decltype(value)>;
+                if constexpr (std::is_same_v<T, std::nullptr_t>)
+                    text += "null";
+                else if constexpr (std::is_same_v<T, std::int64_t> || std::is_same_v<T, double>)
+                    text += fmt::format("{}", value);
+                else if constexpr (std::is_same_v<T, std::string>)
+                    text += Value(value).description();
+                else if constexpr (std::is_same_v<T, Dictionary>)
+                    appendJsonText(text, value);
+                else
+                    text += "(deferred)";
+            },
+            parameter);
+        if (text.size() > kShown)
+            return text.substr(0, kShown) + "...";
+    }
+    return text + "]";
+}
+
 // Every store says up to which of its pending rows it has committed, in the
 // transaction that commits them.
 constexpr const char* kPendingTable =
@@ -90,8 +126,7 @@ std::optional<std::string> makeFile(const std::filesystem::path& path)
 
 std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path,
                                                const std::vector<std::string>& schema,
-                                               const std::vector<std::string>& statements, SqliteRetention retention,
-                                               std::string& error)
+                                               const std::vector<std::string>& statements, SqliteRetention retention)
 {
     // SQLite counts every allocation under a process-wide mutex unless told not
     // to, and three writers allocating for every row contend on it. Too late once
@@ -99,52 +134,62 @@ std::unique_ptr<SqliteStore> SqliteStore::open(const std::filesystem::path& path
     [[maybe_unused]] static const int configured = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0);
     Connection connection;
     int code = SQLITE_OK;
-    if (!connect(path, schema, statements, connection, error, code)) {
-        if (!isCorruption(code))
-            return nullptr;
+    std::string error;
+    if (!connect(path, schema, statements, connection, error, code) && isCorruption(code)) {
         auto aside = setAside(path);
         MXLOG_LIMITED(nullptr, Error, "{} is corrupt ({}): set aside as {}, starting a fresh store", path.string(),
                       error, aside.filename().string());
-        if (!connect(path, schema, statements, connection, error, code))
-            return nullptr;
+        connect(path, schema, statements, connection, error, code);
     }
+    // A store that cannot be written now (a full or read-only disk) serves all the
+    // same: its rows wait for it, and it tries again on its retry schedule.
+    if (!connection.database)
+        MXLOG_LIMITED(nullptr, Error, "{}; serving all the same: its rows wait until it can be written", error);
     std::unique_ptr<SqliteStore> store(new SqliteStore(path, schema, statements, std::move(retention), connection));
-    if (!store->replayPending(error))
-        return nullptr;
+    store->replayPending();
     std::lock_guard lock(store->writer_->mutex());
     store->writer_->attach(*store);
     return store;
 }
 
-// Rows answered but not committed when the process last ended are written before any
-// other. Should they not go in, the store does not open: they stay kept for the next try.
-bool SqliteStore::replayPending(std::string& error)
+// Rows answered but not committed when the process last ended go first, before any
+// other, from the file that keeps them until they are committed. Without the file,
+// rows are kept in memory alone (a disk that refuses it), and the log says so.
+void SqliteStore::replayPending()
 {
     auto path = path_.native() + "-pending";
     std::string why;
-    pending_ = SqlitePendingRows::open(path, why);
+    pending_ = SqlitePendingRows::open(path, path_.filename().string(), why);
     if (!pending_) {
-        MXLOG_LIMITED(nullptr, Error, "{}: {}; its rows are committed within {} ms instead", path, why,
-                      kBatchWindow.count());
-        return true;
+        MXLOG_LIMITED(nullptr, Error,
+                      "{}: {}; rows answered until the store takes them are kept in memory alone, and a crash "
+                      "would lose them",
+                      path, why);
+        return;
     }
-    auto committed =
-        static_cast<std::uint64_t>(firstInteger(connection_.database, "SELECT sequence FROM pending_committed"));
+    // Read on a connection of its own, so that a store that cannot be written still
+    // tells which of the rows it holds.
+    auto committed = static_cast<std::uint64_t>(queryInteger("SELECT sequence FROM pending_committed"));
     auto replayed = pending_->rowsAfter(committed, statementTexts_.size());
     committedPending_ = committed;
     if (replayed.empty())
-        return true;
+        return;
     std::deque<SqliteWrite> rows(std::make_move_iterator(replayed.begin()), std::make_move_iterator(replayed.end()));
     std::string failure;
-    if (!commit(rows, failure, true)) {
-        error = fmt::format("{}: cannot write the {} answered rows kept in {}: {}", path_.string(), rows.size(), path,
-                            failure);
-        return false;
+    if (connection_.database && commit(rows, failure)) {
+        MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run", path_.string(),
+                      rows.size(), path);
+        pending_->release(committedPending_);
+        return;
     }
-    MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run", path_.string(),
-                  rows.size(), path);
-    pending_->release(committedPending_);
-    return true;
+    // They stay kept, and go first once the store can take them.
+    MXLOG_LIMITED(nullptr, Error,
+                  "{}: cannot write the {} answered rows kept in {} now ({}): they go first once it can",
+                  path_.string(), rows.size(), path, connection_.database ? failure : "the store cannot be written");
+    for (auto& row : rows) {
+        queue_.push_back(std::move(row));
+        ++submitted_;
+    }
 }
 
 bool SqliteStore::connect(const std::filesystem::path& path, const std::vector<std::string>& schema,
@@ -261,8 +306,9 @@ void SqliteStore::submit(SqliteWrite write)
     std::string_view encoded;
     if (pending_ && pending_->mayHaveRoom() && !(pending_->halfTaken() && write.debt.owesMuch()))
         encoded = SqlitePendingRows::encode(write);
-    // A row kept nowhere holds its request's reply until it is committed.
-    if (encoded.empty())
+    // A row kept nowhere holds its request's reply until it is committed; without a
+    // file to keep rows in (a disk that refused it), rows are answered from memory.
+    if (encoded.empty() && pending_)
         write.ticket = ReplyTicket::take();
     std::lock_guard lock(writer_->mutex());
     if (!encoded.empty())
@@ -270,7 +316,7 @@ void SqliteStore::submit(SqliteWrite write)
     bool kept = write.pending != 0;
     if (!kept) {
         ++unkept_;
-        if (!write.ticket)
+        if (!write.ticket && pending_)
             write.ticket = ReplyTicket::take();
     }
     queue_.push_back(std::move(write));
@@ -281,13 +327,19 @@ void SqliteStore::submit(SqliteWrite write)
         writer_->queued(queue_.size(), kept && !pending_->halfTaken());
 }
 
-void SqliteStore::flush()
+SqliteStore::Uncommitted SqliteStore::flush(std::chrono::steady_clock::time_point deadline)
 {
     std::unique_lock lock(writer_->mutex());
     std::uint64_t target = submitted_;
     if (settled_ < target)
         writer_->hurry();
-    writer_->changed().wait(lock, [&] { return settled_ >= target; });
+    if (writer_->changed().wait_until(lock, deadline, [&] { return settled_ >= target; }))
+        return {};
+    Uncommitted left;
+    for (const auto* rows : {&batch_, &queue_})
+        for (const auto& write : *rows)
+            ++(write.pending != 0 ? left.kept : left.inMemory);
+    return left;
 }
 
 // A full batch goes before its window ends; a failing one waits for its retry, unless
@@ -587,8 +639,11 @@ Dictionary SqliteStore::status()
             bytes += static_cast<std::uint64_t>(file.st_size);
     }
     std::lock_guard lock(writer_->mutex());
-    return Dictionary{
-        {"rows_written", committed_}, {"queue_depth", queue_.size()}, {"bytes", bytes}, {"failures", failures_}};
+    return Dictionary{{"rows_written", committed_},
+                      {"queue_depth", queue_.size()},
+                      {"bytes", bytes},
+                      {"failures", failures_},
+                      {"pending_rows_in_memory", pending_ == nullptr}};
 }
 
 // A file removed under the open connection still takes writes, into nothing: the
@@ -659,10 +714,11 @@ int SqliteStore::insert(SqliteWrite& write, std::uint64_t& bytes)
     return stepped;
 }
 
-// All or nothing: a batch that fails anywhere is rolled back whole and kept. Rows
-// written again from the pending rows may be there already (`skipPresent`): a row
-// refused as a duplicate is passed over.
-bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error, bool skipPresent)
+// All or nothing: a batch that fails is rolled back whole and kept, unless what failed
+// is a row that SQLite refuses on its own account (a constraint, a type it will not
+// take): that row is logged and set aside, and the others go in. Such a row would be
+// refused again at every retry and every start, and hold back every row behind it.
+bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
 {
     sqlite3* database = connection_.database;
     auto failed = [&](const char* what) {
@@ -688,8 +744,11 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error, boo
     std::uint64_t newestPending = committedPending_;
     for (auto& write : batch) {
         int stepped = insert(write, bytes);
-        if (stepped != SQLITE_DONE && !(skipPresent && (stepped & 0xff) == SQLITE_CONSTRAINT))
+        if (stepped != SQLITE_DONE && !refusesRow(stepped))
             return failed("insert");
+        if (stepped != SQLITE_DONE)
+            MXLOG_LIMITED(nullptr, Error, "{}: a row it refuses ({}) is set aside: statement {}, {}", path_.string(),
+                          sqlite3_errmsg(database), write.statement, describeRow(write));
         newestPending = std::max(newestPending, write.pending);
     }
     // A buffer that grew for one large row (a summary event) is given back.

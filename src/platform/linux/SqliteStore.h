@@ -115,10 +115,10 @@ public:
     static constexpr int kBusyTimeoutMilliseconds = 5000;
 
     // Opens or creates the database, runs `schema`, prepares `statements`, and makes
-    // sure it can write. Nothing, with `error`, when any of that fails.
+    // sure it can write. A store that cannot be written now is made all the same, and
+    // tries again on its retry schedule: the daemon serves meanwhile.
     static std::unique_ptr<SqliteStore> open(const std::filesystem::path& path, const std::vector<std::string>& schema,
-                                             const std::vector<std::string>& statements, SqliteRetention retention,
-                                             std::string& error);
+                                             const std::vector<std::string>& statements, SqliteRetention retention);
     ~SqliteStore();
     SqliteStore(const SqliteStore&) = delete;
     SqliteStore& operator=(const SqliteStore&) = delete;
@@ -126,8 +126,21 @@ public:
     // Charges the row to the account named on this thread (BacklogAccount), and keeps
     // it among the pending rows when there is room, before the caller answers anyone.
     void submit(SqliteWrite write);
-    // Waits until everything submitted before the call is committed.
-    void flush();
+    // Rows not committed: kept among the pending rows (the next start writes them in),
+    // or in memory alone.
+    struct Uncommitted {
+        std::size_t kept = 0;
+        std::size_t inMemory = 0;
+        Uncommitted& operator+=(const Uncommitted& other)
+        {
+            kept += other.kept;
+            inMemory += other.inMemory;
+            return *this;
+        }
+    };
+    // Waits until everything submitted before the call is committed, or `deadline`
+    // passes: what is not committed then.
+    Uncommitted flush(std::chrono::steady_clock::time_point deadline = std::chrono::steady_clock::time_point::max());
 
     // Runs a query on a connection of its own and returns the first column of the
     // first row as an integer (0 when there is none). For reading ids at start-up.
@@ -137,7 +150,9 @@ public:
     // From the next batch on, keep this much instead.
     void setRetention(SqliteRetention retention);
     // "rows_written" (since start-up), "queue_depth" (rows waiting for the writer),
-    // "bytes" (the file and its log on disk), "failures" (failed write attempts).
+    // "bytes" (the file and its log on disk), "failures" (failed write attempts),
+    // "pending_rows_in_memory" (the disk refused the file of pending rows: a crash
+    // would lose the rows not yet committed).
     Dictionary status();
 
 private:
@@ -162,7 +177,7 @@ private:
                         const std::vector<std::string>& statements, Connection& connection, std::string& error,
                         int& code);
     static void disconnect(Connection& connection);
-    bool replayPending(std::string& error);
+    void replayPending();
 
     // The writer's side. Under its lock:
     bool hasWork() const { return !queue_.empty() || !batch_.empty(); }
@@ -178,7 +193,7 @@ private:
     void cutBackLog();
 
     bool stillOnDisk(std::string& error);
-    bool commit(std::deque<SqliteWrite>& batch, std::string& error, bool skipPresent = false);
+    bool commit(std::deque<SqliteWrite>& batch, std::string& error);
     int insert(SqliteWrite& write, std::uint64_t& bytes);
     void prune();
     std::uint64_t logShare() const;

@@ -38,13 +38,11 @@ std::optional<std::vector<std::string>> SqliteTally::readDisabled(const std::fil
 }
 
 std::unique_ptr<SqliteTally> SqliteTally::open(const std::filesystem::path& database, std::vector<std::string> disabled,
-                                               const StoreLimit& limit, std::string& error)
+                                               const StoreLimit& limit)
 {
     auto store = SqliteStore::open(
         database, {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL, name TEXT, payload TEXT)"},
-        {"INSERT INTO events(time, name, payload) VALUES(?, ?, ?)"}, eventsRetention(limit), error);
-    if (!store)
-        return nullptr;
+        {"INSERT INTO events(time, name, payload) VALUES(?, ?, ?)"}, eventsRetention(limit));
     return std::unique_ptr<SqliteTally>(new SqliteTally(std::move(store), std::move(disabled)));
 }
 

@@ -25,7 +25,7 @@ public:
     static std::optional<std::vector<std::string>> readDisabled(const std::filesystem::path& configuration,
                                                                 std::vector<std::string>& errors);
     static std::unique_ptr<SqliteTally> open(const std::filesystem::path& database, std::vector<std::string> disabled,
-                                             const StoreLimit& limit, std::string& error);
+                                             const StoreLimit& limit);
 
     void sendEventLazy(std::string_view name, UniqueFunction<Dictionary()> buildPayload) override;
     bool wanted(std::string_view name) const;
