@@ -123,5 +123,54 @@ TEST(DaemonDurabilityTest, ReportsThatFindNoRoomAmongThePendingRowsAreAnsweredOn
     }
 }
 
+// A disk too full to make the stores at start-up keeps no daemon from serving: it
+// answers from memory, says so, and writes in once there is room.
+TEST(DaemonDurabilityTest, ADaemonStartsAndServesOnADiskTooFullForItsStores)
+{
+    DaemonProcess daemon;
+    Tmpfs stores(daemon.path("var/lib/harmonia"), "size=512k");
+    if (!stores.mounted())
+        GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
+    daemon.start();
+    EXPECT_THAT(daemon.log(), ::testing::HasSubstr("serving all the same"));
+    auto client = connectTo(daemon);
+    ASSERT_EQ(client->createSession(3), 0);
+    for (int i = 0; i < 20; ++i)
+        ASSERT_EQ(client->send(payloadOf(Dictionary{{"n", i}}), 3, 1, {3}), 0) << "report " << i;
+    ASSERT_TRUE(stores.remount("size=64m"));
+    EXPECT_TRUE(waitUntil([&] { return count(daemon, "tally", "SELECT count(*) FROM events") == 20; }));
+    EXPECT_TRUE(waitUntil([&] { return count(daemon, "uplink", "SELECT count(*) FROM messages") == 20; }));
+}
+
+// Stopped while its stores cannot write, a daemon ends within its bound all the same:
+// what it could not commit stays in its pending rows, and the next start writes it in.
+TEST(DaemonDurabilityTest, AStopEndsWithinTenSecondsWhateverTheStoresDo)
+{
+    DaemonProcess daemon;
+    Tmpfs stores(daemon.path("var/lib/harmonia"), "size=1m");
+    if (!stores.mounted())
+        GTEST_SKIP() << "cannot mount a tmpfs here (not root?)";
+    daemon.start();
+    auto client = connectTo(daemon);
+    ASSERT_EQ(client->createSession(3), 0);
+    client->startSession(3);
+    std::atomic<int> answered{0};
+    auto report = payloadOf(Dictionary{{"filler", std::string(100, 'f')}});
+    for (int i = 0; i < 30000; ++i)
+        client->sendAsync(report, 3, 1, std::vector<std::int64_t>{3}, [&](int result) { answered += result == 0; });
+    ASSERT_TRUE(daemon.waitForLog("cannot write", std::chrono::seconds(60)));
+    auto began = std::chrono::steady_clock::now();
+    daemon.signal(SIGTERM);
+    ASSERT_EQ(daemon.waitForExit(), 0);
+    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(15));
+    EXPECT_TRUE(daemon.waitForLog("stay in the pending rows for the next start"));
+    client.reset();
+
+    ASSERT_TRUE(stores.remount("size=256m"));
+    daemon.start();
+    EXPECT_GE(count(daemon, "tally", "SELECT count(*) FROM events"), answered.load());
+    EXPECT_GE(count(daemon, "uplink", "SELECT count(*) FROM messages"), answered.load());
+}
+
 } // namespace
 } // namespace mx::testing

@@ -50,10 +50,8 @@ std::string describeRow(const SqliteWrite& write)
                     text += "null";
                 else if constexpr (std::is_same_v<T, std::int64_t> || std::is_same_v<T, double>)
                     text += fmt::format("{}", value);
-                else if constexpr (std::is_same_v<T, std::string>)
-                    text += Value(value).description();
-                else if constexpr (std::is_same_v<T, Dictionary>)
-                    appendJsonText(text, value);
+                else if constexpr (std::is_same_v<T, std::string> || std::is_same_v<T, Dictionary>)
+                    appendJsonText(text, Value(value));
                 else
                     text += "(deferred)";
             },
@@ -177,8 +175,9 @@ void SqliteStore::replayPending()
     std::deque<SqliteWrite> rows(std::make_move_iterator(replayed.begin()), std::make_move_iterator(replayed.end()));
     std::string failure;
     if (connection_.database && commit(rows, failure)) {
-        MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run", path_.string(),
-                      rows.size(), path);
+        MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run{}",
+                      path_.string(), rows.size() - refused_, path,
+                      refused_ > 0 ? fmt::format(" ({} refused, set aside)", refused_) : "");
         pending_->release(committedPending_);
         return;
     }
@@ -417,7 +416,7 @@ void SqliteStore::writeBatch()
                           attempts_, describe(now - failingSince_));
         attempts_ = 0;
         retryDelay_ = kFirstRetry;
-        roundWritten_ = batch_.size();
+        roundWritten_ = batch_.size() - refused_;
         roundSettled_ = batch_.size();
         roundPending_ = committedPending_;
         roundCheckpoint_ = logPages_ >= checkpointPages_;
@@ -740,15 +739,18 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
     };
     if (!stepOnce(connection_.begin))
         return failed("begin");
+    refused_ = 0;
     std::uint64_t bytes = 0;
     std::uint64_t newestPending = committedPending_;
     for (auto& write : batch) {
         int stepped = insert(write, bytes);
         if (stepped != SQLITE_DONE && !refusesRow(stepped))
             return failed("insert");
-        if (stepped != SQLITE_DONE)
+        if (stepped != SQLITE_DONE) {
+            ++refused_;
             MXLOG_LIMITED(nullptr, Error, "{}: a row it refuses ({}) is set aside: statement {}, {}", path_.string(),
                           sqlite3_errmsg(database), write.statement, describeRow(write));
+        }
         newestPending = std::max(newestPending, write.pending);
     }
     // A buffer that grew for one large row (a summary event) is given back.

@@ -286,5 +286,32 @@ TEST_F(SqliteStoreTest, PendingRowsOthersCouldHaveWrittenAreNeverReadBack)
     EXPECT_EQ(setAside, 4u) << "the link's other name keeps its content";
 }
 
+// A row its store refuses (an id that is no integer) was kept pending by a daemon that
+// died: the next open sets it aside with a line in the log and writes the others.
+TEST_F(SqliteStoreTest, APendingRowTheStoreRefusesIsSetAsideAndKeepsNoStoreFromOpening)
+{
+    const std::vector<std::string> schema = {"CREATE TABLE IF NOT EXISTS events(id INTEGER PRIMARY KEY, time REAL)"};
+    const std::vector<std::string> insert = {"INSERT INTO events(id, time) VALUES (?1, ?2)"};
+    {
+        std::string error;
+        auto pending = SqlitePendingRows::open(directory / "tally.db-pending", "tally.db", error);
+        ASSERT_TRUE(pending) << error;
+        for (SqliteValue id :
+             {SqliteValue(std::int64_t{1}), SqliteValue(std::string("not an id")), SqliteValue(std::int64_t{3})}) {
+            SqliteWrite write{0, {id, 1.5}};
+            pending->keep(SqlitePendingRows::encode(write));
+        }
+    }
+    auto store = SqliteStore::open(directory / "tally.db", schema, insert, {});
+    EXPECT_EQ(count("SELECT count(*) FROM events"), 2);
+    EXPECT_THAT(log.texts(),
+                ::testing::Contains(::testing::HasSubstr("a row it refuses (datatype mismatch) is set "
+                                                         "aside: statement 0, [\"not an id\", 1.5]")));
+    EXPECT_THAT(log.texts(), ::testing::Contains(::testing::HasSubstr("wrote the 2 answered rows kept in")));
+    store->submit({0, {std::int64_t{4}, 2.5}});
+    store->flush();
+    EXPECT_EQ(count("SELECT count(*) FROM events"), 3) << "and it goes on";
+}
+
 } // namespace
 } // namespace mx::testing
