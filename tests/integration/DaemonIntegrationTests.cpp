@@ -444,6 +444,33 @@ TEST(DaemonConfigurationTest, ACheckNamesTheBadLineAndAReloadWithErrorsKeepsTheC
     EXPECT_TRUE(daemon.waitForLog("configuration read again: 0 collectors, 0 disabled event names"));
     sendBoth(3);
     EXPECT_EQ(stored("com.kestrel.harmonia.Session_Playback.Start"), "1");
+
+    // Whatever stands where the configuration names a file, nothing blocks on it: a FIFO
+    // as a CA file is refused at a check and at a reload, at once, and the next good
+    // configuration is taken.
+    ASSERT_EQ(::mkfifo(daemon.path("etc/harmonia/ca.pem").c_str(), 0644), 0);
+    daemon.writeFile("etc/harmonia/uplink.json", R"({"backends": [{"type": "spool"}, {"type": "otlp-http",
+        "url": "https://127.0.0.1:9/v1/logs", "tls": {"ca_file": "ca.pem"}}]})");
+    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH, "--check-config"}, output), 1);
+    EXPECT_THAT(
+        output,
+        ::testing::HasSubstr("tls.ca_file: " + daemon.path("etc/harmonia/ca.pem").string() + " is not a regular file"));
+    daemon.signal(SIGHUP);
+    EXPECT_TRUE(daemon.waitForLog("ca.pem is not a regular file"));
+    std::filesystem::remove(daemon.path("etc/harmonia/uplink.json"));
+    std::filesystem::create_directory(daemon.path("etc/harmonia/uplink.json"));
+    EXPECT_EQ(daemon.runToEnd({MXREPORTINGD_PATH, "--check-config"}, output), 1);
+    EXPECT_THAT(output,
+                ::testing::HasSubstr(daemon.path("etc/harmonia/uplink.json").string() + " is not a regular file"))
+        << "a file there that cannot be read is no absent file";
+    std::filesystem::remove(daemon.path("etc/harmonia/uplink.json"));
+    daemon.writeFile("etc/harmonia/tally.json", R"({"disabled": ["x"]})");
+    daemon.signal(SIGHUP);
+    EXPECT_TRUE(daemon.waitForLog("configuration read again: 0 collectors, 1 disabled event names"));
+    auto began = std::chrono::steady_clock::now();
+    daemon.signal(SIGTERM);
+    EXPECT_EQ(daemon.waitForExit(), 0);
+    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(5));
 }
 
 TEST(DaemonOrientationTest, TrackedSessionsRecordEachFedChangeTimedFromTheirOwnStartIntoTheirSummaryEvent)

@@ -3,14 +3,21 @@
 #include <algorithm>
 #include <cctype>
 #include <cstring>
-#include <fstream>
-#include <sstream>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <system_error>
+#include <unistd.h>
 
 #include <fmt/format.h>
+
+#include "platform/linux/PosixFileSystem.h"
 
 namespace mx {
 
 namespace {
+
+// A configuration file is a few kilobytes; anything near this is no configuration.
+constexpr std::size_t kLargestFile = std::size_t{1} << 20;
 
 std::vector<std::string> tokensOf(ConfigFile::Pointer at)
 {
@@ -146,16 +153,53 @@ private:
 
 } // namespace
 
+ConfigFile::Read ConfigFile::readRegularFile(const std::filesystem::path& path, std::size_t largest)
+{
+    Read read;
+    int fd = ::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+    if (fd < 0) {
+        int error = errno;
+        if (error == ENOENT)
+            return read;
+        read.outcome = Read::Outcome::Refused;
+        read.problem = fmt::format("{} cannot be read: {}{}", path.string(), std::generic_category().message(error),
+                                   PosixFileSystem::refusalHint(error, path));
+        return read;
+    }
+    read.outcome = Read::Outcome::Refused;
+    struct stat file {};
+    if (::fstat(fd, &file) != 0 || !S_ISREG(file.st_mode)) {
+        read.problem = fmt::format("{} is not a regular file", path.string());
+    } else if (static_cast<std::uint64_t>(file.st_size) > largest) {
+        read.problem = fmt::format("{} is larger than {} bytes", path.string(), largest);
+    } else {
+        read.contents.resize(static_cast<std::size_t>(file.st_size));
+        ssize_t got = ::read(fd, read.contents.data(), read.contents.size());
+        if (got == static_cast<ssize_t>(read.contents.size())) {
+            read.outcome = Read::Outcome::Read;
+            read.owner = file.st_uid;
+            read.mode = file.st_mode & 07777;
+        } else {
+            read.problem = fmt::format("{} cannot be read: {}", path.string(),
+                                       got < 0 ? std::generic_category().message(errno) : "it changed as it was read");
+        }
+    }
+    ::close(fd);
+    return read;
+}
+
 ConfigFile::ConfigFile(std::filesystem::path path, std::vector<std::string>& errors)
     : path_(std::move(path)), errors_(errors)
 {
-    std::ifstream stream(path_);
-    if (!stream)
+    auto read = readRegularFile(path_, kLargestFile);
+    if (read.outcome == Read::Outcome::Missing)
         return;
     exists_ = true;
-    std::ostringstream text;
-    text << stream.rdbuf();
-    text_ = text.str();
+    if (read.outcome == Read::Outcome::Refused) {
+        errors_.push_back(read.problem);
+        return;
+    }
+    text_ = std::move(read.contents);
     try {
         document_ = nlohmann::json::parse(text_, nullptr, true, /*ignore_comments=*/true);
         parsed_ = true;

@@ -3,13 +3,18 @@
 // syntax error, a key the file may not have or a value of the wrong type is an error
 // that names the file, the line and the column of the setting, and the setting itself
 // ("etc/harmonia/stores.json:3:18: joule.max_bytes must be ..."), so that an operator
-// can go straight to it. A file that is not there is no error: its defaults hold.
+// can go straight to it. A file that is not there is no error: its defaults hold. One
+// that is there and cannot be read, or is not a regular file, is an error, never taken
+// for an absent one: files are opened so that nothing at the other end can block the
+// open (a FIFO put in a file's place), and checked on the open descriptor.
 
 #include <filesystem>
 #include <initializer_list>
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include <sys/types.h>
 
 #include <nlohmann/json.hpp>
 
@@ -18,6 +23,17 @@ namespace mx {
 class ConfigFile {
 public:
     using Pointer = nlohmann::json::json_pointer;
+
+    // A file the configuration reads, as it was read.
+    struct Read {
+        enum class Outcome { Missing, Read, Refused } outcome = Outcome::Missing;
+        std::string contents;
+        std::string problem; // why it was refused, with what to mend
+        uid_t owner = 0;
+        mode_t mode = 0;
+    };
+    // Reads `path` if it is a regular file of at most `largest` bytes.
+    static Read readRegularFile(const std::filesystem::path& path, std::size_t largest);
 
     // Reads the file now; errors are added to `errors`.
     ConfigFile(std::filesystem::path path, std::vector<std::string>& errors);

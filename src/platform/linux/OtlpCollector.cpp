@@ -6,6 +6,8 @@
 #include <memory>
 #include <system_error>
 
+#include <unistd.h>
+
 #include <curl/curl.h>
 #include <fmt/format.h>
 #include <openssl/bio.h>
@@ -55,31 +57,51 @@ using Bio = std::unique_ptr<BIO, decltype(&BIO_free)>;
 
 int noPassphrase(char*, int, int, void*) { return 0; }
 
-// What is wrong with `path` as a PEM file of `kind` ("certificate" or "key"), if anything.
-std::optional<std::string> pemProblem(const std::string& path, std::string_view kind)
+Bio memoryBio(const std::string& contents)
 {
-    Bio bio(BIO_new_file(path.c_str(), "r"), &BIO_free);
-    if (!bio)
-        return fmt::format("{} cannot be read: {}", path, std::generic_category().message(errno));
+    return Bio(BIO_new_mem_buf(contents.data(), static_cast<int>(contents.size())), &BIO_free);
+}
+
+// A PEM file is a few kilobytes, a CA bundle a few hundred.
+constexpr std::size_t kLargestPem = std::size_t{4} << 20;
+
+// What is wrong with a PEM file of `kind` ("certificate" or "key"), if anything.
+std::optional<std::string> pemProblem(const OtlpCollector::Pem& pem, std::string_view kind)
+{
+    auto bio = memoryBio(pem.contents);
     if (kind == "key") {
         EVP_PKEY* key = PEM_read_bio_PrivateKey(bio.get(), nullptr, noPassphrase, nullptr);
         EVP_PKEY_free(key);
-        return key ? std::nullopt : std::optional(fmt::format("{} holds no unencrypted PEM private key", path));
+        return key ? std::nullopt : std::optional(fmt::format("{} holds no unencrypted PEM private key", pem.path));
     }
     X509* certificate = PEM_read_bio_X509(bio.get(), nullptr, noPassphrase, nullptr);
     X509_free(certificate);
-    return certificate ? std::nullopt : std::optional(fmt::format("{} holds no PEM certificate", path));
+    return certificate ? std::nullopt : std::optional(fmt::format("{} holds no PEM certificate", pem.path));
 }
 
-bool keyMatches(const std::string& certFile, const std::string& keyFile)
+// A private key is its owner's (the daemon's user, or root who set it up) and its
+// group's at most: one others may read is no longer private.
+std::optional<std::string> keyExposure(const std::string& path, const ConfigFile::Read& read)
 {
-    Bio certBio(BIO_new_file(certFile.c_str(), "r"), &BIO_free);
-    Bio keyBio(BIO_new_file(keyFile.c_str(), "r"), &BIO_free);
-    X509* certificate = certBio ? PEM_read_bio_X509(certBio.get(), nullptr, noPassphrase, nullptr) : nullptr;
-    EVP_PKEY* key = keyBio ? PEM_read_bio_PrivateKey(keyBio.get(), nullptr, noPassphrase, nullptr) : nullptr;
-    bool matches = certificate && key && X509_check_private_key(certificate, key) == 1;
+    if (read.owner != 0 && read.owner != ::geteuid())
+        return fmt::format("{} is owned by uid {}: a private key must be this daemon's user's (uid {}) or root's", path,
+                           read.owner, ::geteuid());
+    if ((read.mode & 0027) != 0)
+        return fmt::format("{} has mode {:04o}: a private key must not be readable by others nor writable by its "
+                           "group (chmod 0640 or 0600)",
+                           path, read.mode);
+    return std::nullopt;
+}
+
+bool keyMatches(const OtlpCollector::Pem& cert, const OtlpCollector::Pem& key)
+{
+    auto certBio = memoryBio(cert.contents);
+    auto keyBio = memoryBio(key.contents);
+    X509* certificate = PEM_read_bio_X509(certBio.get(), nullptr, noPassphrase, nullptr);
+    EVP_PKEY* privateKey = PEM_read_bio_PrivateKey(keyBio.get(), nullptr, noPassphrase, nullptr);
+    bool matches = certificate && privateKey && X509_check_private_key(certificate, privateKey) == 1;
     X509_free(certificate);
-    EVP_PKEY_free(key);
+    EVP_PKEY_free(privateKey);
     return matches;
 }
 
@@ -116,7 +138,7 @@ bool readTls(ConfigFile& file, const ConfigFile::Pointer& at, OtlpCollector& col
     if (!file.expect(tls.is_object(), at, "an object of ca_file, cert_file and key_file"))
         return false;
     bool good = file.onlyKeys(at, {"ca_file", "cert_file", "key_file"});
-    auto readFile = [&](const char* key, std::string_view kind, std::string& into) {
+    auto readFile = [&](const char* key, std::string_view kind, OtlpCollector::Pem& into) {
         if (!tls.contains(key))
             return;
         auto setting = at / key;
@@ -125,24 +147,35 @@ bool readTls(ConfigFile& file, const ConfigFile::Pointer& at, OtlpCollector& col
             good = false;
             return;
         }
-        auto path = file.path().parent_path() / tls[key].get<std::string>();
-        if (auto problem = pemProblem(path.string(), kind)) {
+        auto path = (file.path().parent_path() / tls[key].get<std::string>()).string();
+        auto read = ConfigFile::readRegularFile(path, kLargestPem);
+        std::optional<std::string> problem;
+        if (read.outcome == ConfigFile::Read::Outcome::Missing)
+            problem = path + " does not exist";
+        else if (read.outcome == ConfigFile::Read::Outcome::Refused)
+            problem = read.problem;
+        else if (kind == "key")
+            problem = keyExposure(path, read);
+        OtlpCollector::Pem pem{path, std::move(read.contents)};
+        if (!problem)
+            problem = pemProblem(pem, kind);
+        if (problem) {
             file.failSetting(setting, *problem);
             good = false;
             return;
         }
-        into = path.string();
+        into = std::move(pem);
     };
-    readFile("ca_file", "certificate", collector.caFile);
-    readFile("cert_file", "certificate", collector.certFile);
-    readFile("key_file", "key", collector.keyFile);
+    readFile("ca_file", "certificate", collector.ca);
+    readFile("cert_file", "certificate", collector.cert);
+    readFile("key_file", "key", collector.key);
     if (good && tls.contains("cert_file") != tls.contains("key_file")) {
         file.failSetting(at, "cert_file and key_file go together");
         good = false;
     }
-    if (good && !collector.certFile.empty() && !keyMatches(collector.certFile, collector.keyFile)) {
+    if (good && !collector.cert.path.empty() && !keyMatches(collector.cert, collector.key)) {
         file.failSetting(at / "key_file",
-                         fmt::format("{} is not the key of {}", collector.keyFile, collector.certFile));
+                         fmt::format("{} is not the key of {}", collector.key.path, collector.cert.path));
         good = false;
     }
     return good;

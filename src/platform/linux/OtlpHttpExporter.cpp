@@ -260,13 +260,22 @@ std::optional<UplinkError> OtlpHttpExporter::post(CURL* curl, const std::string&
     curl_easy_setopt(curl, CURLOPT_ACCEPT_ENCODING, "");
     curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, failure);
     curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, discardBody);
-    // Empty names leave curl's own choice: the system's CAs, no client certificate.
-    auto fileOption = [&](CURLoption option, const std::string& path) {
-        curl_easy_setopt(curl, option, path.empty() ? nullptr : path.c_str());
+    // What the files held when the configuration was read, never the files again: what
+    // is in their place now may block, or be something else. Nothing given leaves
+    // curl's own choice: the system's CAs, no client certificate.
+    auto pemOption = [&](CURLoption option, const OtlpCollector::Pem& pem) {
+        if (pem.contents.empty())
+            return;
+        curl_blob blob{const_cast<char*>(pem.contents.data()), pem.contents.size(), CURL_BLOB_COPY};
+        curl_easy_setopt(curl, option, &blob);
     };
-    fileOption(CURLOPT_CAINFO, collector_.caFile);
-    fileOption(CURLOPT_SSLCERT, collector_.certFile);
-    fileOption(CURLOPT_SSLKEY, collector_.keyFile);
+    pemOption(CURLOPT_CAINFO_BLOB, collector_.ca);
+    pemOption(CURLOPT_SSLCERT_BLOB, collector_.cert);
+    pemOption(CURLOPT_SSLKEY_BLOB, collector_.key);
+    if (!collector_.cert.contents.empty()) {
+        curl_easy_setopt(curl, CURLOPT_SSLCERTTYPE, "PEM");
+        curl_easy_setopt(curl, CURLOPT_SSLKEYTYPE, "PEM");
+    }
     curl_slist* headers = curl_slist_append(nullptr, "Content-Type: application/json");
     if (collector_.gzip)
         headers = curl_slist_append(headers, "Content-Encoding: gzip");

@@ -149,8 +149,7 @@ TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)
             in("uplink.json") + ":4:3: backends[2] has no url: the collector's URL",
             in("uplink.json") + ":5:69: backends[3].headers.Key must be a string",
             in("uplink.json") + ":6:23: backends[3].tls.ca_file: " + in("ca.pem") + " holds no PEM certificate",
-            in("uplink.json") + ":6:46: backends[3].tls.cert_file: " + in("none.pem") +
-                " cannot be read: No such file or directory",
+            in("uplink.json") + ":6:46: backends[3].tls.cert_file: " + in("none.pem") + " does not exist",
             in("stores.json") + ":2:33: stores.json has no setting \"tallly\" (it has tally, joule, uplink, summaries)",
             in("stores.json") + ":2:25: joule.max_bytes must be a number of at least 0",
             ::testing::StartsWith(in("tally.json") + ":1:19: syntax error"),
