@@ -7,6 +7,7 @@ what it could not send reaches the receiver once it is back."""
 import json
 import os
 import sys
+import time
 
 from collector import Receiver
 from harness import Checks, Daemon, wait_for
@@ -56,6 +57,21 @@ def main():
         client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"alone": True}, 1, 0, None)
         check("standalone message exported at once",
               wait_for(lambda: any("alone" in json.dumps(b) for b in receiver.bodies())))
+
+        # A realtime session's message reaches the collector at once: well within 300 ms
+        # of its reply, long before the spool's own window would commit it.
+        client.call("createReportingSession:reply:", 5)
+        client.call("setServiceType:reportingSession:reply:", 12, 5)
+        client.send("startReportingSessionForID:reply:", 5)
+        latencies = []
+        for index in range(5):
+            client.call("sendMessage:withCategory:andType:forReportingIDs:reply:", {"live": index}, 3, 1, [5])
+            answered = time.monotonic()
+            wait_for(lambda: any(f'"live", "value": {{"intValue": "{index}"}}' in json.dumps(b)
+                                 for b in receiver.bodies()), 5)
+            latencies.append(time.monotonic() - answered)
+        check("realtime messages reach the collector within 300 ms of their replies", max(latencies) < 0.3, latencies)
+        client.call("destroyReportingSession:reply:", 5)
 
         receiver.stop()
         session(client, 2, 2)

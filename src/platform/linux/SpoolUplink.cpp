@@ -142,9 +142,14 @@ SpoolUplink::SpoolUplink(std::unique_ptr<SqliteStore> store, bool spoolListed,
 {
     for (const auto& collector : collectors)
         exporters_.push_back(std::make_shared<OtlpHttpExporter>(store_->path(), collector));
+    store_->setCommittedSoon([this] {
+        for (auto& exporter : exporters())
+            exporter->wake();
+    });
 }
 
-SpoolUplink::~SpoolUplink() = default;
+// The store goes first: its writer may wake the exporters until it has stopped.
+SpoolUplink::~SpoolUplink() { store_.reset(); }
 
 void SpoolUplink::reconfigure(const Backends& backends, const StoreLimit& limit)
 {
@@ -271,11 +276,13 @@ std::shared_ptr<UplinkSession> SpoolUplink::makeSession(Dictionary sessionInfo, 
 bool SpoolUplink::sendOneMessage(Dictionary sessionInfo, Dictionary userInfo, std::uint16_t category,
                                  std::uint16_t type, Dictionary payload, std::optional<UplinkError>& error)
 {
-    store_->submit({kInsertMessage,
+    // Exported at once, as a realtime session's messages are.
+    SqliteWrite row{kInsertMessage,
                     {nullptr, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, std::move(payload),
-                     std::move(sessionInfo), std::move(userInfo)}});
+                     std::move(sessionInfo), std::move(userInfo)}};
+    row.soon = true;
+    store_->submit(std::move(row));
     for (auto& exporter : exporters()) {
-        exporter->wake();
         // Spooled all the same: the exporter sends it once the collector is back.
         if (auto failing = exporter->currentError()) {
             error = UplinkError{failing->code, failing->description + " (message kept in the spool)"};

@@ -38,10 +38,14 @@ void SpoolUplinkSession::startConfiguration(UniqueFunction<void(std::optional<st
     });
 }
 
+// A realtime session's message goes to the collectors at once: its row is committed
+// within the short window, and its commit wakes the exporters.
 SqliteWrite SpoolUplinkSession::messageRow(std::uint16_t category, std::uint16_t type, const Dictionary& payload) const
 {
-    return {SpoolUplink::kInsertMessage,
-            {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, payload, nullptr, nullptr}};
+    SqliteWrite row{SpoolUplink::kInsertMessage,
+                    {id_, secondsSinceEpoch(), std::int64_t{category}, std::int64_t{type}, payload, nullptr, nullptr}};
+    row.soon = realtime_;
+    return row;
 }
 
 bool SpoolUplinkSession::sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,

@@ -313,17 +313,17 @@ void SqliteStore::submit(SqliteWrite write)
     if (!encoded.empty())
         write.pending = pending_->keep(encoded);
     bool kept = write.pending != 0;
-    if (!kept) {
-        ++unkept_;
-        if (!write.ticket && pending_)
-            write.ticket = ReplyTicket::take();
-    }
+    bool soon = write.soon;
+    if (!kept && !write.ticket && pending_)
+        write.ticket = ReplyTicket::take();
+    if (!kept || soon)
+        ++hurried_;
     queue_.push_back(std::move(write));
     ++submitted_;
     if (urgent)
         writer_->hurry();
     else
-        writer_->queued(queue_.size(), kept && !pending_->halfTaken());
+        writer_->queued(queue_.size(), kept && !soon && !pending_->halfTaken());
 }
 
 SqliteStore::Uncommitted SqliteStore::flush(std::chrono::steady_clock::time_point deadline)
@@ -367,8 +367,8 @@ bool SqliteStore::takeBatch(std::chrono::steady_clock::time_point now)
             logConfigured_ = false;
         }
         while (!queue_.empty() && batch_.size() < kBatchLimit) {
-            if (queue_.front().pending == 0)
-                --unkept_;
+            if (queue_.front().pending == 0 || queue_.front().soon)
+                --hurried_;
             batch_.push_back(std::move(queue_.front()));
             queue_.pop_front();
         }
@@ -420,9 +420,14 @@ void SqliteStore::writeBatch()
         roundSettled_ = batch_.size();
         roundPending_ = committedPending_;
         roundCheckpoint_ = logPages_ >= checkpointPages_;
-        for (auto& write : batch_)
+        bool soon = false;
+        for (auto& write : batch_) {
             write.ticket.giveBack();
+            soon |= write.soon;
+        }
         batch_.clear();
+        if (soon && committedSoon_)
+            committedSoon_();
         // Age is looked at now and then; size after any batch that may have taken the
         // rows past their share, so that a burst never takes the store far past its bound;
         // and a pruning cut short at its budget goes on.

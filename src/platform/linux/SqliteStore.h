@@ -21,6 +21,7 @@
 #include <cstdint>
 #include <deque>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -149,6 +150,9 @@ public:
     const std::filesystem::path& path() const { return path_; }
     // From the next batch on, keep this much instead.
     void setRetention(SqliteRetention retention);
+    // Called on the writer's thread after a commit that took a row wanted soon. Set
+    // before rows come.
+    void setCommittedSoon(std::function<void()> committed) { committedSoon_ = std::move(committed); }
     // "rows_written" (since start-up), "queue_depth" (rows waiting for the writer),
     // "bytes" (the file and its log on disk), "failures" (failed write attempts),
     // "pending_rows_in_memory" (the disk refused the file of pending rows: a crash
@@ -181,7 +185,7 @@ private:
 
     // The writer's side. Under its lock:
     bool hasWork() const { return !queue_.empty() || !batch_.empty(); }
-    bool allQueuedKept() const { return unkept_ == 0; }
+    bool anyHurried() const { return hurried_ > 0; }
     bool wantsRound() const;
     std::optional<std::chrono::steady_clock::time_point> retryAt() const;
     bool takeBatch(std::chrono::steady_clock::time_point now);
@@ -209,6 +213,7 @@ private:
     const std::vector<std::string> schema_;
     const std::vector<std::string> statementTexts_;
     const std::shared_ptr<SqliteWriter> writer_;
+    std::function<void()> committedSoon_;
 
     // Writer thread only.
     SqliteRetention retention_;
@@ -245,7 +250,9 @@ private:
     std::unique_ptr<SqlitePendingRows> pending_; // set at open, nothing: no row is kept
     std::optional<SqliteRetention> newRetention_;
     std::deque<SqliteWrite> queue_;
-    std::size_t unkept_ = 0; // rows in the queue not kept among the pending rows
+    // Rows in the queue that want the short window: not kept among the pending rows, or
+    // wanted soon by a reader.
+    std::size_t hurried_ = 0;
     std::uint64_t submitted_ = 0;
     std::uint64_t committed_ = 0;
     std::uint64_t settled_ = 0; // committed, or abandoned by a store closing on a failing disk

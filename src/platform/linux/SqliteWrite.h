@@ -30,6 +30,9 @@ struct SqliteWrite {
     std::uint64_t pending = 0;
     // A row kept nowhere yet holds its request's reply until it is committed.
     ReplyTicket ticket = {};
+    // Wanted by a reader soon (a message a collector takes at once): committed within
+    // the short window, and the store says when it is.
+    bool soon = false;
 };
 
 } // namespace mx

@@ -147,9 +147,9 @@ bool SqliteWriter::anyWork() const
     return std::ranges::any_of(stores_, [](const SqliteStore* store) { return store->hasWork(); });
 }
 
-bool SqliteWriter::allQueuedKept() const
+bool SqliteWriter::anyHurried() const
 {
-    return std::ranges::all_of(stores_, [](const SqliteStore* store) { return store->allQueuedKept(); });
+    return std::ranges::any_of(stores_, [](const SqliteStore* store) { return store->anyHurried(); });
 }
 
 bool SqliteWriter::anyUrgent() const
@@ -193,13 +193,13 @@ void SqliteWriter::run()
 }
 
 // Until the window ends, a batch fills, or a retry is due. The window is the long one
-// while every queued row is kept among its store's pending rows, and a row that is
-// not cuts it short (queued).
+// while every queued row is kept among its store's pending rows and no reader wants
+// one soon, and a row that is not so cuts it short (queued).
 void SqliteWriter::gather(std::unique_lock<std::mutex>& lock)
 {
     gathering_ = true;
     windowEnd_ =
-        std::chrono::steady_clock::now() + (allQueuedKept() ? SqliteStore::kKeptWindow : SqliteStore::kBatchWindow);
+        std::chrono::steady_clock::now() + (anyHurried() ? SqliteStore::kBatchWindow : SqliteStore::kKeptWindow);
     while (!anyUrgent()) {
         auto until = std::min(windowEnd_, nextRetry());
         if (std::chrono::steady_clock::now() >= until)

@@ -57,7 +57,7 @@ private:
     void run();
     bool anyWork() const;
     bool anyUrgent() const;
-    bool allQueuedKept() const;
+    bool anyHurried() const;
     void gather(std::unique_lock<std::mutex>& lock);
     std::chrono::steady_clock::time_point nextRetry() const;
     bool writeRound(std::unique_lock<std::mutex>& lock);
