@@ -34,6 +34,8 @@ public:
 
     // The wire size of the message `next` returned last.
     std::size_t lastMessageBytes() const { return lastMessageBytes_; }
+    // After `next` said NeedMore: the bytes of a message that has begun to arrive.
+    std::size_t partialBytes() const { return unpacker_.parsed_size() + unpacker_.nonparsed_size(); }
 
     // Convenience for tests and fuzzing: feed bytes in one go.
     void feed(const char* bytes, std::size_t count);

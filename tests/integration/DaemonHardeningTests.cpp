@@ -88,6 +88,33 @@ TEST_F(DaemonHardeningTest, AMessageNamesUpTo4096ReportersRepeatsIncluded)
     }));
 }
 
+// Requests that never finish arriving hold neither memory nor connections for long:
+// all together at most 64 MiB (the connection waiting longest goes first), and one
+// whose bytes stop for 10 s closes its connection.
+TEST_F(DaemonHardeningTest, RequestsThatNeverFinishArrivingAreBoundedInBytesAndTime)
+{
+    // Each a large request one byte short: a string parameter of its full length.
+    auto partial = [](std::size_t bytes) {
+        std::string request = packed([&](auto& p) {
+            p.pack_array(4), p.pack(0), p.pack(1), p.pack(std::string("createReportingSession:reply:"));
+            p.pack_array(1), p.pack_str(static_cast<std::uint32_t>(bytes));
+        });
+        return request + std::string(bytes - 1, 'x');
+    };
+    std::vector<std::unique_ptr<RawConnection>> stalled;
+    for (int i = 0; i < 80; ++i) {
+        stalled.push_back(std::make_unique<RawConnection>(daemon.socketPath()));
+        ASSERT_TRUE(stalled.back()->send(partial(1000000)));
+    }
+    EXPECT_TRUE(daemon.waitForLog("requests still arriving hold more than 64 MiB in all"));
+    EXPECT_TRUE(stalled.front()->waitForClose()) << "the one waiting longest goes first";
+    EXPECT_LT(daemon.residentBytes(), kMemoryBound + (std::size_t{80} << 20));
+    auto client = connect();
+    EXPECT_EQ(client->createSession(1), 0) << "the others are served";
+    EXPECT_TRUE(stalled.back()->waitForClose()) << "and a request that stops arriving closes in 10 s";
+    EXPECT_TRUE(daemon.waitForLog("a request stopped arriving for 10 s"));
+}
+
 // A store's bound is what an operator sees with du: the database, its log and the log's
 // index together, however much was sent.
 TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)

@@ -1,6 +1,8 @@
 #include "platform/linux/MsgpackRpcConnection.h"
 
+#include <algorithm>
 #include <future>
+#include <map>
 
 #include <poll.h>
 #include <sys/socket.h>
@@ -77,6 +79,54 @@ private:
     std::atomic<bool> replied_{false};
     std::atomic<bool> counted_{true};
 };
+
+// The requests still arriving on every connection: how much each holds, and since when
+// it has held any. Thread-safe.
+class RequestsInTransit {
+public:
+    // `connection` holds `bytes` of a request still arriving (0: none). The connection
+    // to close when all of them hold past the bound: the one whose request has waited
+    // longest.
+    std::shared_ptr<MsgpackRpcConnection> hold(const std::shared_ptr<MsgpackRpcConnection>& connection,
+                                               std::size_t bytes)
+    {
+        std::lock_guard lock(mutex_);
+        auto found = holders_.find(connection.get());
+        if (found != holders_.end()) {
+            total_ -= found->second.bytes;
+            if (bytes == 0) {
+                holders_.erase(found);
+                return nullptr;
+            }
+            found->second.bytes = bytes;
+        } else if (bytes > 0) {
+            holders_.emplace(connection.get(), Holder{connection, bytes, ++arrivals_});
+        }
+        total_ += bytes;
+        if (total_ <= MsgpackRpcConnection::kTransitBytes)
+            return nullptr;
+        auto longest = std::min_element(holders_.begin(), holders_.end(),
+                                        [](const auto& a, const auto& b) { return a.second.since < b.second.since; });
+        return longest->second.connection.lock();
+    }
+
+private:
+    struct Holder {
+        std::weak_ptr<MsgpackRpcConnection> connection;
+        std::size_t bytes;
+        std::uint64_t since; // in the order they began to hold
+    };
+    std::mutex mutex_;
+    std::map<const MsgpackRpcConnection*, Holder> holders_;
+    std::size_t total_ = 0;
+    std::uint64_t arrivals_ = 0;
+};
+
+RequestsInTransit& requestsInTransit()
+{
+    static auto* transit = new RequestsInTransit; // outlives every connection
+    return *transit;
+}
 
 } // namespace
 
@@ -203,6 +253,7 @@ void MsgpackRpcConnection::processBuffered()
         }
         switch (decoder_.next(message, reason)) {
         case MsgpackRpcDecoder::Status::NeedMore:
+            inTransit(decoder_.partialBytes());
             readMore();
             return;
         case MsgpackRpcDecoder::Status::Bad:
@@ -238,6 +289,32 @@ void MsgpackRpcConnection::watchForHangUp()
     });
 }
 
+// A request that has begun to arrive is watched until it has all arrived: its bytes
+// must keep coming, and what all such requests hold together is bounded.
+void MsgpackRpcConnection::inTransit(std::size_t bytes)
+{
+    if (bytes == 0 && !transitWatch_)
+        return;
+    auto self = shared_from_this();
+    if (auto longest = requestsInTransit().hold(self, bytes))
+        asio::post(longest->socket_.get_executor(), [longest] {
+            longest->close(fmt::format("requests still arriving hold more than {} MiB in all, and this one has "
+                                       "waited longest",
+                                       kTransitBytes >> 20));
+        });
+    if (bytes == 0) {
+        transitWatch_.reset();
+        return;
+    }
+    // Each read that brings more of it starts the wait afresh.
+    transitWatch_.emplace(socket_.get_executor(), kTransitTimeout);
+    transitWatch_->async_wait([weakSelf = weak_from_this()](const std::error_code& cancelled) {
+        auto waiting = weakSelf.lock();
+        if (!cancelled && waiting)
+            waiting->close(fmt::format("a request stopped arriving for {} s", kTransitTimeout.count()));
+    });
+}
+
 void MsgpackRpcConnection::resumeIfPaused()
 {
     if (!paused_.exchange(false))
@@ -266,6 +343,7 @@ void MsgpackRpcConnection::postResume()
 
 bool MsgpackRpcConnection::handleMessage(const Value& message, std::size_t bytes)
 {
+    inTransit(0);
     std::string reason;
     auto request = parseRpcRequest(message, reason);
     if (!request) {
@@ -407,6 +485,8 @@ void MsgpackRpcConnection::close(const std::string& reason)
     socket_.shutdown(asio::socket_base::shutdown_both, ignored);
     socket_.close(ignored);
     // The outbox stays until the connection goes: a write in flight still points into it.
+    transitWatch_.reset();
+    requestsInTransit().hold(shared_from_this(), 0);
     if (auto handler = std::move(invalidationHandler_))
         handler();
     // The exported object goes only after the handler, which may still need it.

@@ -45,6 +45,12 @@ public:
     static constexpr std::size_t kRequestsPerPass = 32;
     // How often a paused connection looks whether its client is still there.
     static constexpr std::chrono::milliseconds kHangUpWatchInterval{500};
+    // A request whose bytes stop arriving for this long closes its connection; and all
+    // requests still arriving, on every connection, hold at most this much (past it,
+    // the connection whose request has waited longest is closed): a thousand clients
+    // each a byte short of a large request hold neither memory nor descriptors for long.
+    static constexpr std::chrono::seconds kTransitTimeout{10};
+    static constexpr std::size_t kTransitBytes = std::size_t{64} << 20;
     // A reply batch starts this small: most hold a reply or two.
     static constexpr std::size_t kReplyBufferBytes = 512;
 
@@ -78,6 +84,8 @@ private:
     void resumeIfPaused();
     void watchForHangUp();
     bool handleMessage(const Value& message, std::size_t bytes);
+    // A request has begun to arrive and holds `bytes` (0: none does).
+    void inTransit(std::size_t bytes);
     void flushReplies();
     void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
     void writeMore();
@@ -109,6 +117,7 @@ private:
     std::atomic<bool> paused_{false};
     std::shared_ptr<MsgpackRpcConnection> holdWhilePaused_; // the strand's only
     std::optional<asio::steady_timer> hangUpWatch_;         // the strand's only
+    std::optional<asio::steady_timer> transitWatch_;        // the strand's only, while a request arrives
     std::atomic<bool> resumePosted_{false};
     std::atomic<std::size_t> requestsInFlight_{0};
     std::atomic<std::size_t> bytesInFlight_{0};
