@@ -4,6 +4,7 @@
 #include <chrono>
 #include <ctime>
 #include <fcntl.h>
+#include <limits>
 #include <sys/stat.h>
 #include <system_error>
 #include <unistd.h>
@@ -174,11 +175,19 @@ void SqliteStore::replayPending()
         return;
     std::deque<SqliteWrite> rows(std::make_move_iterator(replayed.begin()), std::make_move_iterator(replayed.end()));
     std::string failure;
-    if (connection_.database && commit(rows, failure)) {
-        MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run{}",
-                      path_.string(), rows.size() - refused_, path,
-                      refused_ > 0 ? fmt::format(" ({} refused, set aside)", refused_) : "");
+    std::size_t written = 0;
+    std::size_t refused = 0;
+    while (!rows.empty() && connection_.database && commit(rows, failure)) {
+        written += committedRows_ - refused_;
+        refused += refused_;
+        rows.erase(rows.begin(), rows.begin() + static_cast<std::ptrdiff_t>(committedRows_));
+    }
+    if (written + refused > 0)
         pending_->release(committedPending_);
+    if (rows.empty()) {
+        MXLOG_LIMITED(nullptr, Default, "{}: wrote the {} answered rows kept in {} since the last run{}",
+                      path_.string(), written, path,
+                      refused > 0 ? fmt::format(" ({} refused, set aside)", refused) : "");
         return;
     }
     // They stay kept, and go first once the store can take them.
@@ -416,16 +425,19 @@ void SqliteStore::writeBatch()
                           attempts_, describe(now - failingSince_));
         attempts_ = 0;
         retryDelay_ = kFirstRetry;
-        roundWritten_ = batch_.size() - refused_;
-        roundSettled_ = batch_.size();
+        roundWritten_ = committedRows_ - refused_;
+        roundSettled_ = committedRows_;
         roundPending_ = committedPending_;
         roundCheckpoint_ = logPages_ >= checkpointPages_;
         bool soon = false;
-        for (auto& write : batch_) {
-            write.ticket.giveBack();
-            soon |= write.soon;
+        auto committedEnd = batch_.begin() + static_cast<std::ptrdiff_t>(committedRows_);
+        for (auto write = batch_.begin(); write != committedEnd; ++write) {
+            write->ticket.giveBack();
+            soon |= write->soon;
         }
-        batch_.clear();
+        batch_.erase(batch_.begin(), committedEnd);
+        // What a transaction's bytes left over goes next, at once.
+        retryAt_ = now;
         if (soon && committedSoon_)
             committedSoon_();
         // Age is looked at now and then; size after any batch that may have taken the
@@ -512,9 +524,14 @@ void SqliteStore::configureLog()
         this);
 }
 
+// A store with a size bound moves its log into its file here, before the next batch,
+// once the log passes its mark: what the database, its log and its pending rows take
+// together then stays within twice the bound at every moment, a burst included. One
+// without a bound leaves it to the checkpointing thread until the log reaches twice
+// its mark, the checkpoints falling behind.
 void SqliteStore::checkpointIfBehind()
 {
-    if (logPages_ < 2 * checkpointPages_)
+    if (logPages_ < (retention_.maxBytes > 0 ? checkpointPages_ : 2 * checkpointPages_))
         return;
     sqlite3_wal_checkpoint_v2(connection_.database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
     logPages_ = 0;
@@ -747,7 +764,14 @@ bool SqliteStore::commit(std::deque<SqliteWrite>& batch, std::string& error)
     refused_ = 0;
     std::uint64_t bytes = 0;
     std::uint64_t newestPending = committedPending_;
+    // A store with a size bound commits a share of its log's room at a time, so that
+    // no transaction takes the log far past its mark.
+    std::uint64_t mostBytes = retention_.maxBytes > 0 ? logShare() / 4 : std::numeric_limits<std::uint64_t>::max();
+    committedRows_ = 0;
     for (auto& write : batch) {
+        if (committedRows_ > 0 && bytes >= mostBytes)
+            break;
+        ++committedRows_;
         int stepped = insert(write, bytes);
         if (stepped != SQLITE_DONE && !refusesRow(stepped))
             return failed("insert");

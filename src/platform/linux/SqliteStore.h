@@ -240,6 +240,7 @@ private:
     std::chrono::steady_clock::time_point failingSince_{};
     std::uint64_t committedPending_ = 0; // the newest pending row committed
     std::size_t refused_ = 0;            // rows of the last commit the store refused
+    std::size_t committedRows_ = 0;      // from the front of the batch, by the last commit
     std::uint64_t roundPending_ = 0;     // the same, once the round ends
     std::uint64_t roundWritten_ = 0;
     std::uint64_t roundSettled_ = 0; // written or abandoned
