@@ -27,8 +27,8 @@ public:
 
     std::size_t owed() const { return owed_.load(); }
     bool overdrawn() const;
-    // Owes more than a quarter of its bound: one of the clients filling the queues.
-    bool owesMuch() const { return owed() > bound_ / 4; }
+    // Owes more than half its bound: one of the clients filling the queues.
+    bool owesMuch() const { return owed() > bound_ / 2; }
     // Runs `resume` once the account owes at most half its bound: on the thread that
     // settles it that far, or here, at once, when it does already. The account must be
     // held by a shared_ptr.

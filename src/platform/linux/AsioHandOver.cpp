@@ -27,6 +27,14 @@ AsioHandOver* AsioHandOver::takingFrom(const void* giver, asio::io_context& targ
     return innermost;
 }
 
+AsioHandOver* AsioHandOver::ownedBy(const void* owner)
+{
+    for (AsioHandOver* handOver = innermost; handOver != nullptr; handOver = handOver->outer_)
+        if (handOver->owner_ == owner)
+            return handOver;
+    return nullptr;
+}
+
 void AsioHandOver::add(UniqueFunction<void()> handOver) { handOvers_.push_back(std::move(handOver)); }
 
 } // namespace mx

@@ -35,6 +35,9 @@ public:
     // own, or when this thread does not run `target` (the work could not run in place,
     // and held back it could fall behind work given later, a timer's). Then it posts.
     static AsioHandOver* takingFrom(const void* giver, asio::io_context& target);
+    // The hand-over of a handler of `owner`'s running further up this thread's stack, if
+    // any: what `owner` gives its own strand meanwhile can wait for that handler's end.
+    static AsioHandOver* ownedBy(const void* owner);
     // `handOver` dispatches the work to its strand.
     void add(UniqueFunction<void()> handOver);
 

@@ -80,46 +80,48 @@ private:
     std::atomic<bool> counted_{true};
 };
 
-// The requests still arriving on every connection: how much each holds, and since when
-// it has held any. Thread-safe.
+// The requests still arriving on every connection. Each connection keeps what its own
+// request in transit holds; the total is counted here, and the connections are listed
+// (from their first read to their close) so that the one waiting longest can be found
+// when the total passes its bound. Thread-safe.
 class RequestsInTransit {
 public:
-    // `connection` holds `bytes` of a request still arriving (0: none). The connection
-    // to close when all of them hold past the bound: the one whose request has waited
-    // longest.
-    std::shared_ptr<MsgpackRpcConnection> hold(const std::shared_ptr<MsgpackRpcConnection>& connection,
-                                               std::size_t bytes)
+    void enter(const std::shared_ptr<MsgpackRpcConnection>& connection)
     {
         std::lock_guard lock(mutex_);
-        auto found = holders_.find(connection.get());
-        if (found != holders_.end()) {
-            total_ -= found->second.bytes;
-            if (bytes == 0) {
-                holders_.erase(found);
-                return nullptr;
+        connections_.emplace(connection.get(), connection);
+    }
+    void leave(const MsgpackRpcConnection* connection)
+    {
+        std::lock_guard lock(mutex_);
+        connections_.erase(connection);
+    }
+    // What one connection's request in transit holds changed by `delta`: true when the
+    // total is past the bound.
+    bool grow(std::ptrdiff_t delta)
+    {
+        std::size_t total = total_.fetch_add(static_cast<std::size_t>(delta), std::memory_order_relaxed) +
+            static_cast<std::size_t>(delta);
+        return total > MsgpackRpcConnection::kTransitBytes;
+    }
+    // The connection whose request in transit began longest ago.
+    std::shared_ptr<MsgpackRpcConnection> longest()
+    {
+        std::lock_guard lock(mutex_);
+        std::shared_ptr<MsgpackRpcConnection> found;
+        auto since = std::chrono::steady_clock::time_point::max();
+        for (const auto& [raw, weak] : connections_)
+            if (auto connection = weak.lock(); connection && connection->transitBegan() < since) {
+                since = connection->transitBegan();
+                found = std::move(connection);
             }
-            found->second.bytes = bytes;
-        } else if (bytes > 0) {
-            holders_.emplace(connection.get(), Holder{connection, bytes, ++arrivals_});
-        }
-        total_ += bytes;
-        if (total_ <= MsgpackRpcConnection::kTransitBytes)
-            return nullptr;
-        auto longest = std::min_element(holders_.begin(), holders_.end(),
-                                        [](const auto& a, const auto& b) { return a.second.since < b.second.since; });
-        return longest->second.connection.lock();
+        return found;
     }
 
 private:
-    struct Holder {
-        std::weak_ptr<MsgpackRpcConnection> connection;
-        std::size_t bytes;
-        std::uint64_t since; // in the order they began to hold
-    };
     std::mutex mutex_;
-    std::map<const MsgpackRpcConnection*, Holder> holders_;
-    std::size_t total_ = 0;
-    std::uint64_t arrivals_ = 0;
+    std::map<const MsgpackRpcConnection*, std::weak_ptr<MsgpackRpcConnection>> connections_;
+    std::atomic<std::size_t> total_{0};
 };
 
 RequestsInTransit& requestsInTransit()
@@ -171,6 +173,7 @@ void MsgpackRpcConnection::resume()
     if (resumed_)
         return;
     resumed_ = true;
+    requestsInTransit().enter(shared_from_this());
     readMore();
 }
 
@@ -290,28 +293,46 @@ void MsgpackRpcConnection::watchForHangUp()
 }
 
 // A request that has begun to arrive is watched until it has all arrived: its bytes
-// must keep coming, and what all such requests hold together is bounded.
+// must keep coming, and what all such requests hold together is bounded. Cheap on the
+// way of every read: a count, and a timer armed once that looks again when it fires.
 void MsgpackRpcConnection::inTransit(std::size_t bytes)
 {
-    if (bytes == 0 && !transitWatch_)
+    if (bytes == transitBytes_)
         return;
-    auto self = shared_from_this();
-    if (auto longest = requestsInTransit().hold(self, bytes))
-        asio::post(longest->socket_.get_executor(), [longest] {
-            longest->close(fmt::format("requests still arriving hold more than {} MiB in all, and this one has "
-                                       "waited longest",
-                                       kTransitBytes >> 20));
-        });
-    if (bytes == 0) {
-        transitWatch_.reset();
-        return;
-    }
-    // Each read that brings more of it starts the wait afresh.
-    transitWatch_.emplace(socket_.get_executor(), kTransitTimeout);
+    auto now = std::chrono::steady_clock::now();
+    if (transitBytes_ == 0 || bytes == 0)
+        transitBegan_.store(bytes == 0 ? std::chrono::steady_clock::time_point::max() : now, std::memory_order_relaxed);
+    transitProgress_ = now;
+    bool past =
+        requestsInTransit().grow(static_cast<std::ptrdiff_t>(bytes) - static_cast<std::ptrdiff_t>(transitBytes_));
+    transitBytes_ = bytes;
+    if (past)
+        if (auto longest = requestsInTransit().longest())
+            asio::post(longest->socket_.get_executor(), [longest] {
+                if (longest->transitBytes_ > 0)
+                    longest->close(fmt::format(
+                        "requests still arriving hold more than {} MiB in all, and this one has waited longest",
+                        kTransitBytes >> 20));
+            });
+    if (bytes > 0 && !transitWatch_)
+        watchTransit(kTransitTimeout);
+}
+
+void MsgpackRpcConnection::watchTransit(std::chrono::steady_clock::duration wait)
+{
+    transitWatch_.emplace(socket_.get_executor(), wait);
     transitWatch_->async_wait([weakSelf = weak_from_this()](const std::error_code& cancelled) {
-        auto waiting = weakSelf.lock();
-        if (!cancelled && waiting)
-            waiting->close(fmt::format("a request stopped arriving for {} s", kTransitTimeout.count()));
+        auto self = weakSelf.lock();
+        if (cancelled || !self || self->closed_)
+            return;
+        self->transitWatch_.reset();
+        if (self->transitBytes_ == 0)
+            return;
+        auto stalled = std::chrono::steady_clock::now() - self->transitProgress_;
+        if (stalled >= kTransitTimeout)
+            self->close(fmt::format("a request stopped arriving for {} s", kTransitTimeout.count()));
+        else
+            self->watchTransit(kTransitTimeout - stalled);
     });
 }
 
@@ -374,10 +395,15 @@ void MsgpackRpcConnection::sendResponse(std::uint32_t msgid, const Value& error,
         if (std::exchange(flushScheduled_, true))
             return;
     }
-    // A handler's replies go together when it returns: a turn's steps, one write.
+    // Replies go together: those of a read pass's requests, run when the pass ends, in
+    // one write; others when the handler that made them returns.
     auto flush = [self = shared_from_this()] {
         self->flushReplies();
     };
+    if (auto* pass = AsioHandOver::ownedBy(this)) {
+        pass->add(std::move(flush));
+        return;
+    }
     auto* handOver = AsioHandOver::takingFrom(this, static_cast<asio::io_context&>(socket_.get_executor().context()));
     if (handOver == nullptr) {
         asio::post(socket_.get_executor(), std::move(flush));
@@ -486,7 +512,8 @@ void MsgpackRpcConnection::close(const std::string& reason)
     socket_.close(ignored);
     // The outbox stays until the connection goes: a write in flight still points into it.
     transitWatch_.reset();
-    requestsInTransit().hold(shared_from_this(), 0);
+    requestsInTransit().grow(-static_cast<std::ptrdiff_t>(std::exchange(transitBytes_, 0)));
+    requestsInTransit().leave(this);
     if (auto handler = std::move(invalidationHandler_))
         handler();
     // The exported object goes only after the handler, which may still need it.

@@ -68,6 +68,10 @@ public:
     // flight is still answered. Returns once that holds. Any thread but the strand's.
     void stopReading();
 
+    // Any thread: when the request now in transit began to arrive (the latest time
+    // there is when none is).
+    std::chrono::steady_clock::time_point transitBegan() const { return transitBegan_.load(std::memory_order_relaxed); }
+
     // Any thread. Dropped when the connection is gone.
     void sendResponse(std::uint32_t msgid, const Value& error, const Value& result);
     void sendError(std::uint32_t msgid, const ServiceError& error);
@@ -86,6 +90,7 @@ private:
     bool handleMessage(const Value& message, std::size_t bytes);
     // A request has begun to arrive and holds `bytes` (0: none does).
     void inTransit(std::size_t bytes);
+    void watchTransit(std::chrono::steady_clock::duration wait);
     void flushReplies();
     void enqueue(std::shared_ptr<msgpack::sbuffer> bytes);
     void writeMore();
@@ -117,7 +122,12 @@ private:
     std::atomic<bool> paused_{false};
     std::shared_ptr<MsgpackRpcConnection> holdWhilePaused_; // the strand's only
     std::optional<asio::steady_timer> hangUpWatch_;         // the strand's only
-    std::optional<asio::steady_timer> transitWatch_;        // the strand's only, while a request arrives
+    // The request in transit, the strand's only: what it holds, when it last grew.
+    std::size_t transitBytes_ = 0;
+    std::chrono::steady_clock::time_point transitProgress_{};
+    std::optional<asio::steady_timer> transitWatch_;
+    // Read by other connections; the latest time there is while none is in transit.
+    std::atomic<std::chrono::steady_clock::time_point> transitBegan_{std::chrono::steady_clock::time_point::max()};
     std::atomic<bool> resumePosted_{false};
     std::atomic<std::size_t> requestsInFlight_{0};
     std::atomic<std::size_t> bytesInFlight_{0};

@@ -65,6 +65,8 @@ public:
     // Any thread, without the lock: over half the file is taken, and its rows should be
     // committed soon, before a row finds no room (its reply would wait for a commit).
     bool halfTaken() const { return room_.load(std::memory_order_relaxed) < kFileBytes / 2; }
+    // Any thread, without the lock: less than a quarter of the file is left.
+    bool mostlyTaken() const { return room_.load(std::memory_order_relaxed) < kFileBytes / 4; }
 
     const std::filesystem::path& path() const { return path_; }
 

@@ -308,11 +308,11 @@ void SqliteStore::submit(SqliteWrite write)
     // A client held back waits on its rows: they go now, not at the window's end.
     bool urgent = write.debt.overdrawn();
     // Encoded before the lock is taken; a full file of pending rows is not tried. Its
-    // second half is kept for the clients that owe little: one that fills the queues
+    // last quarter is kept for the clients that owe little: one that fills the queues
     // (its rows outrunning the writer, or a disk refusing them) waits for commits once
-    // the first half is taken, and the others go on being answered at once.
+    // the rest is taken, and the others go on being answered at once.
     std::string_view encoded;
-    if (pending_ && pending_->mayHaveRoom() && !(pending_->halfTaken() && write.debt.owesMuch()))
+    if (pending_ && pending_->mayHaveRoom() && !(pending_->mostlyTaken() && write.debt.owesMuch()))
         encoded = SqlitePendingRows::encode(write);
     // A row kept nowhere holds its request's reply until it is committed; without a
     // file to keep rows in (a disk that refused it), rows are answered from memory.
@@ -327,6 +327,8 @@ void SqliteStore::submit(SqliteWrite write)
         write.ticket = ReplyTicket::take();
     if (!kept || soon)
         ++hurried_;
+    // A reply waiting on the row wants it committed now, not at the window's end.
+    urgent |= static_cast<bool>(write.ticket);
     queue_.push_back(std::move(write));
     ++submitted_;
     if (urgent)
@@ -428,7 +430,12 @@ void SqliteStore::writeBatch()
         roundWritten_ = committedRows_ - refused_;
         roundSettled_ = committedRows_;
         roundPending_ = committedPending_;
-        roundCheckpoint_ = logPages_ >= checkpointPages_;
+        // A store with a size bound moves its log into its file itself, now: another
+        // connection checkpointing beside it would hold a snapshot now and then, and the
+        // log could not start again.
+        if (retention_.maxBytes > 0)
+            checkpointIfBehind();
+        roundCheckpoint_ = retention_.maxBytes == 0 && logPages_ >= checkpointPages_;
         bool soon = false;
         auto committedEnd = batch_.begin() + static_cast<std::ptrdiff_t>(committedRows_);
         for (auto write = batch_.begin(); write != committedEnd; ++write) {
@@ -524,8 +531,8 @@ void SqliteStore::configureLog()
         this);
 }
 
-// A store with a size bound moves its log into its file here, before the next batch,
-// once the log passes its mark: what the database, its log and its pending rows take
+// A store with a size bound moves its log into its file here, after the commit that
+// took the log past its mark: what the database, its log and its pending rows take
 // together then stays within twice the bound at every moment, a burst included. One
 // without a bound leaves it to the checkpointing thread until the log reaches twice
 // its mark, the checkpoints falling behind.
@@ -633,9 +640,14 @@ void SqliteStore::prune()
     for (const auto& sql : retention_.tidy)
         sqlite3_exec(connection_.database, sql.c_str(), nullptr, nullptr, nullptr);
     // The pages the rows gave up go back to the file system, and the log that holds the
-    // deletions goes into the file beside the writer, to be cut back when it starts again.
+    // deletions goes into the file, to be cut back when it starts again.
     sqlite3_exec(connection_.database, "PRAGMA incremental_vacuum", nullptr, nullptr, nullptr);
-    roundCheckpoint_ = true;
+    if (retention_.maxBytes > 0) {
+        sqlite3_wal_checkpoint_v2(connection_.database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+        logPages_ = 0;
+    } else {
+        roundCheckpoint_ = true;
+    }
     if (pruneUnfinished_)
         return;
     MXLOG_LIMITED(nullptr, Default, "{}: pruned {} rows beyond its limits", path_.string(),

@@ -163,9 +163,9 @@ TEST_F(SqliteStoreTest, ConfigurationFilesAreReadStrictlyWithEveryErrorsPlace)
     EXPECT_TRUE(errors.empty());
 }
 
-// The log is moved into the file beside the writer once it passes its mark, with no
-// further commit to set it off.
-TEST_F(SqliteStoreTest, ALogPastItsMarkIsMovedIntoTheFileBesideTheWriter)
+// The log is moved into the file once it passes its mark, with no further commit to set
+// it off.
+TEST_F(SqliteStoreTest, ALogPastItsMarkIsMovedIntoTheFileWithNoFurtherCommit)
 {
     const std::uint64_t bound = 1 << 20;
     auto store = SqliteStore::open(directory / "tally.db",
