@@ -233,4 +233,23 @@ void measureKeptMemory(const std::filesystem::path& socket, pid_t daemon, int re
     }
 }
 
+double measureFullStop(const std::filesystem::path& socket, int& kept)
+{
+    auto client = connectOrExit(socket);
+    startBenchSession(*client, 200);
+    // A million one-byte numbers a report, under the request size: the most values the
+    // kept bytes can hold, and so the longest summary.
+    std::string samples = "[";
+    for (int i = 0; i < 1'000'000; ++i)
+        samples += std::to_string(i % 100) + ",";
+    samples.back() = ']';
+    mxr::Payload payload;
+    payload.addJson("samples", samples.c_str());
+    for (kept = 0; client->send(payload, kReportCategory, kReportType, {200}) == 0; ++kept)
+        ;
+    auto begun = Clock::now();
+    client->stopSession(200);
+    return std::chrono::duration<double>(Clock::now() - begun).count();
+}
+
 } // namespace mx::bench

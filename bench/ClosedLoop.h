@@ -37,4 +37,8 @@ void waitUntilStoresIdle(const std::filesystem::path& socket);
 // its memory comes back once the session is gone. Prints what it finds.
 void measureKeptMemory(const std::filesystem::path& socket, pid_t daemon, int reports);
 
+// One started session is sent reports of a million small numbers until it keeps all
+// it may; the seconds its stop takes, the summary built on the server queue.
+double measureFullStop(const std::filesystem::path& socket, int& kept);
+
 } // namespace mx::bench

@@ -121,19 +121,26 @@ void MxReportingAggregationArray::appendStoredUnder(const std::string& key, Rang
     add(count_, {storeScratch(*arena_, buffer), stored});
 }
 
-void MxReportingAggregationArray::forEach(const std::function<void(const Value&)>& visit) const
+void MxReportingAggregationArray::forEachEncoded(const std::function<void(std::string_view)>& visit) const
 {
     std::string bytes;
     for (std::size_t position = 0; position < entries_.size();) {
         Entry entry = decode(position);
         bytes.clear();
         arena_->read({entry.lead, entry.body}, [&](std::string_view part) { bytes += part; });
+        visit(bytes);
+    }
+}
+
+void MxReportingAggregationArray::forEach(const std::function<void(const Value&)>& visit) const
+{
+    forEachEncoded([&](std::string_view bytes) {
         auto handle = msgpack::unpack(bytes.data(), bytes.size());
         std::string reason;
         // Entries were Values from the wire, at most a level deeper under a message's
         // identifier: they all decode.
         visit(decodeMsgpack(handle.get(), reason, kMsgpackMaximumDepth + 1).value_or(Value()));
-    }
+    });
 }
 
 std::vector<Value> MxReportingAggregationArray::items() const

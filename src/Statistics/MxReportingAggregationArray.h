@@ -16,6 +16,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "Statistics/MxReportingEncodedArena.h"
@@ -46,6 +47,8 @@ public:
     bool empty() const { return count_ == 0; }
     // Each entry decoded in turn, in order: one at a time, however many there are.
     void forEach(const std::function<void(const Value&)>& visit) const;
+    // Each entry's MessagePack bytes in turn, in order.
+    void forEachEncoded(const std::function<void(std::string_view)>& visit) const;
     // The entries decoded, in order.
     std::vector<Value> items() const;
 

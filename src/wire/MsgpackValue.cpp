@@ -8,8 +8,6 @@ namespace mx {
 
 namespace {
 
-constexpr std::int8_t kTimestampExtension = -1;
-
 std::uint64_t readBigEndian(const char* bytes, std::size_t count)
 {
     std::uint64_t value = 0;
@@ -18,23 +16,25 @@ std::uint64_t readBigEndian(const char* bytes, std::size_t count)
     return value;
 }
 
-std::optional<Date> decodeTimestamp(const msgpack::object_ext& ext)
+} // namespace
+
+std::optional<Date> decodeMsgpackTimestamp(const char* body, std::size_t size)
 {
     std::int64_t seconds = 0;
     std::uint32_t nanoseconds = 0;
-    switch (ext.size) {
+    switch (size) {
     case 4:
-        seconds = static_cast<std::int64_t>(readBigEndian(ext.data(), 4));
+        seconds = static_cast<std::int64_t>(readBigEndian(body, 4));
         break;
     case 8: {
-        std::uint64_t packed = readBigEndian(ext.data(), 8);
+        std::uint64_t packed = readBigEndian(body, 8);
         nanoseconds = static_cast<std::uint32_t>(packed >> 34);
         seconds = static_cast<std::int64_t>(packed & 0x3FFFFFFFFull);
         break;
     }
     case 12:
-        nanoseconds = static_cast<std::uint32_t>(readBigEndian(ext.data(), 4));
-        seconds = static_cast<std::int64_t>(readBigEndian(ext.data() + 4, 8));
+        nanoseconds = static_cast<std::uint32_t>(readBigEndian(body, 4));
+        seconds = static_cast<std::int64_t>(readBigEndian(body + 4, 8));
         break;
     default:
         return std::nullopt;
@@ -45,6 +45,8 @@ std::optional<Date> decodeTimestamp(const msgpack::object_ext& ext)
         return std::nullopt;
     return Date(std::chrono::seconds(seconds) + std::chrono::nanoseconds(nanoseconds));
 }
+
+namespace {
 
 std::optional<Value> decode(const msgpack::object& object, std::size_t depth, std::size_t maximumDepth,
                             std::string& reason)
@@ -73,11 +75,11 @@ std::optional<Value> decode(const msgpack::object& object, std::size_t depth, st
         return Value(Data(reinterpret_cast<const std::uint8_t*>(object.via.bin.ptr),
                           reinterpret_cast<const std::uint8_t*>(object.via.bin.ptr) + object.via.bin.size));
     case msgpack::type::EXT: {
-        if (object.via.ext.type() != kTimestampExtension) {
+        if (object.via.ext.type() != kMsgpackTimestampExtension) {
             reason = "extension type " + std::to_string(object.via.ext.type()) + " is not a date";
             return std::nullopt;
         }
-        auto date = decodeTimestamp(object.via.ext);
+        auto date = decodeMsgpackTimestamp(object.via.ext.data(), object.via.ext.size);
         if (!date) {
             reason = "malformed timestamp";
             return std::nullopt;
@@ -129,13 +131,13 @@ void encodeDate(msgpack::packer<msgpack::sbuffer>& packer, Date date)
     };
     if (secondsCount >= 0 && secondsCount < (std::int64_t(1) << 34)) {
         put(0, (std::uint64_t(nanoseconds) << 34) | std::uint64_t(secondsCount), 8);
-        packer.pack_ext(8, kTimestampExtension);
+        packer.pack_ext(8, kMsgpackTimestampExtension);
         packer.pack_ext_body(bytes, 8);
         return;
     }
     put(0, nanoseconds, 4);
     put(4, static_cast<std::uint64_t>(secondsCount), 8);
-    packer.pack_ext(12, kTimestampExtension);
+    packer.pack_ext(12, kMsgpackTimestampExtension);
     packer.pack_ext_body(bytes, 12);
 }
 

@@ -13,6 +13,7 @@
 #include "platform/FileSystem.h"
 #include "platform/MxLog.h"
 #include "value/JsonValue.h"
+#include "wire/MsgpackText.h"
 
 namespace mx {
 
@@ -56,6 +57,35 @@ std::string withoutUnsafeCharacters(const std::string& text)
     return safe;
 }
 
+// The entries as one pretty-printed JSON array, or nothing when it would pass what the
+// summary directory may hold: trimming would remove it as soon as it was written.
+std::string summaryText(const MxReportingAggregationArray& nested)
+{
+    std::uint64_t room = gMaximumBytes.load();
+    std::string text = "[";
+    bool read = true;
+    bool fits = true;
+    nested.forEachEncoded([&](std::string_view entry) {
+        if (!read || !fits)
+            return;
+        text += text.size() == 1 ? "\n" : ",\n";
+        text.append(4, ' ');
+        read = appendMsgpackPrettyJson(text, entry, 1);
+        fits = text.size() < room;
+    });
+    if (!read) {
+        MXLOG(logScope(), Error, "dataWithJSONObject: {}", "a kept message could not be read");
+        return {};
+    }
+    if (!fits) {
+        MXLOG_LIMITED(logScope(), Error, "a summary file would pass the {} bytes the summaries may hold: not written",
+                      room);
+        return {};
+    }
+    text += "\n]";
+    return text;
+}
+
 } // namespace
 
 std::optional<Dictionary> MxReportingSessionSummary::createSummaryEvent(const MxReportingAggregationArray* aggregated,
@@ -70,22 +100,18 @@ std::optional<Dictionary> MxReportingSessionSummary::createSummaryEvent(const Mx
     // Keys keep the order of their first appearance; values keep message order.
     std::vector<std::pair<std::string, std::string>> collected;
     std::map<std::string, std::size_t, std::less<>> position;
-    auto collect = [&](const std::string& key, const std::string& text) {
-        auto [found, inserted] = position.try_emplace(key, collected.size());
-        if (inserted) {
-            collected.emplace_back(key, text);
-            return;
+    auto into = [&](std::string_view key) -> std::string& {
+        auto found = position.find(key);
+        if (found == position.end()) {
+            position.emplace(key, collected.size());
+            return collected.emplace_back(key, std::string()).second;
         }
         auto& joined = collected[found->second].second;
         joined += ',';
-        joined += text;
+        return joined;
     };
-    collect("Mx_Session_Summary_Event", std::to_string(serviceType));
-    aggregated->forEach([&](const Value& payload) {
-        if (const Dictionary* entries = payload.asDictionary())
-            for (const auto& [key, value] : *entries)
-                collect(key, value.description());
-    });
+    into("Mx_Session_Summary_Event") += std::to_string(serviceType);
+    aggregated->forEachEncoded([&](std::string_view payload) { describeMsgpackEntries(payload, into); });
 
     Dictionary summary;
     for (auto& [key, joined] : collected)
@@ -131,13 +157,7 @@ void MxReportingSessionSummary::writeSummaryJson(MxReportingAggregationArray* ne
         if (nested->empty())
             return;
         nested->insert(0, userInfo);
-        try {
-            nlohmann::ordered_json document = nlohmann::ordered_json::array();
-            nested->forEach([&](const Value& item) { document.push_back(toJson(item)); });
-            text = document.dump(4, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
-        } catch (const std::exception& error) {
-            MXLOG(logScope(), Error, "dataWithJSONObject: {}", error.what());
-        }
+        text = summaryText(*nested);
     }
 
     auto& fileSystem = ProcessWide<FileSystem>::get();

@@ -349,12 +349,22 @@ std::string_view SqlitePendingRows::encode(SqliteWrite& write)
     if (buffer.size() > kKeptBytes)
         buffer = msgpack::sbuffer();
     buffer.clear();
-    msgpack::packer packer(buffer);
-    packer.pack_array(static_cast<std::uint32_t>(write.parameters.size() + 1));
-    packer.pack_uint64(write.statement);
+    // A row larger than the file is not copied only to find no room.
+    std::size_t bytes = 0;
     for (auto& parameter : write.parameters) {
         if (auto* deferred = std::get_if<SqliteDeferredDictionary>(&parameter))
             parameter = (**deferred)();
+        if (const auto* text = std::get_if<std::string>(&parameter))
+            bytes += text->size();
+        else if (const auto* dictionary = std::get_if<Dictionary>(&parameter))
+            bytes += encodedMsgpackBytes(Value(*dictionary));
+    }
+    if (bytes > kFileBytes)
+        return {};
+    msgpack::packer packer(buffer);
+    packer.pack_array(static_cast<std::uint32_t>(write.parameters.size() + 1));
+    packer.pack_uint64(write.statement);
+    for (const auto& parameter : write.parameters) {
         std::visit(
             [&](const auto& value) {
                 using T = std::decay_t<decltype(value)>;

@@ -54,7 +54,8 @@ public:
     std::vector<SqliteWrite> rowsAfter(std::uint64_t committed, std::size_t statements);
 
     // Any thread: the row as it is kept, in a buffer of the calling thread valid until
-    // its next call. A deferred dictionary in it is built first, in place.
+    // its next call, or nothing for a row larger than the file. A deferred dictionary in
+    // it is built first, in place.
     static std::string_view encode(SqliteWrite& write);
     // Keeps an encoded row: its number, or 0 when there is no room for it.
     std::uint64_t keep(std::string_view encoded);

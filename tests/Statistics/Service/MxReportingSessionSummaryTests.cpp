@@ -6,6 +6,7 @@
 
 #include "Statistics/Service/MxReportingSession.h"
 #include "fakes/FakePlatform.h"
+#include "value/JsonValue.h"
 
 namespace mx::testing {
 namespace {
@@ -48,6 +49,26 @@ TEST_F(MxReportingSessionSummaryTest, SummaryEventListsEveryValueOfEveryKeyInMes
                           {"rate", "48000,44100"},
                           {"output_route", "Speaker"},
                           {"list", "[1,\"two\"]"}}));
+
+    // Every kind of value reads as its description, inside containers and out.
+    using namespace std::chrono;
+    Date date(seconds(1700000000) + milliseconds(250));
+    Dictionary everyKind{
+        {"nested",
+         Dictionary{{"k",
+                     Array{Value(), true, 0, 9, 10, 99, 100, 127, -3, -32, -33, 18446744073709551615ull, 0.1,
+                           Data{0x0a, 0xff}, date, "q\"\n\x01", Array{}, Dictionary{}}}}},
+        {"when", date},
+        {"bytes", Data{0x00, 0x7f}},
+        {"negative", -5},
+        {"small", 2.5e-7},
+        {"single", 1.5f},
+        {"nothing", Value()},
+        {"yes", false}};
+    session->sendMessage(everyKind, 3, 1, nullptr);
+    auto summary = *session->createSummaryEventForSession();
+    for (const auto& [key, value] : everyKind)
+        EXPECT_EQ(*summary.find(key), Value(value.description())) << key;
     session->stop();
     EXPECT_TRUE(platform.log.contains("sending summary event for reporter 5"));
 }
@@ -72,6 +93,27 @@ TEST_F(MxReportingSessionSummaryTest, FileHoldsUserInfoThenEveryMessageThenTheSu
         {"Session_Playback_Stop_1": {"rate": 44100}},
         {"Undefined_Unknown_1": {"Mx_Session_Summary_Event": "7", "output_route": "Speaker", "rate": "48000,44100"}}
     ])"));
+}
+
+TEST_F(MxReportingSessionSummaryTest, FileIsTheJsonLibrarysOwnPrettyPrintOfEveryKindOfValue)
+{
+    using namespace std::chrono;
+    auto session = makeSession(5, 7);
+    session->start();
+    Dictionary everyKind{{"nested",
+                          Dictionary{{"k",
+                                      Array{Value(), true, 0, 99, 127, -3, -33, 18446744073709551615ull, 0.1, 1.0,
+                                            1e300, std::nan(""), Data{0x0a, 0xff, 0x00}, Date(seconds(1700000000)),
+                                            "q\"\n\x01\x7f", Array{}, Dictionary{}, Array{Array{1}}}}}},
+                         {"single", 1.5f}};
+    session->sendMessage(everyKind, 0x08000003, 1, nullptr);
+    session->stop();
+
+    ASSERT_EQ(platform.files.files.size(), 1u);
+    const std::string& text = platform.files.files.begin()->second;
+    auto document = nlohmann::ordered_json::parse(text);
+    EXPECT_EQ(text, document.dump(4));
+    EXPECT_EQ(document[1]["Session_Playback_Start_1"], toJson(everyKind));
 }
 
 TEST_F(MxReportingSessionSummaryTest, HostNamesNeverLeaveTheDirectoryAndUnnamedHostsAreUnknown)
