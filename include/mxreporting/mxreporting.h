@@ -16,7 +16,11 @@
  * meanwhile waits for that, up to the client's timeout. Requests that were in flight
  * when the connection broke are sent again once the sessions are restored (so a
  * report the daemon had taken just before the break may be taken twice), or fail
- * with -ETIMEDOUT or -ENOTCONN: none is dropped silently. What a restart costs is
+ * with -ETIMEDOUT or -ENOTCONN: none is dropped silently. A connection that breaks as soon as it is
+ * made is retried ever more slowly, up to 5 s, and said once. While the daemon is
+ * away, what waits is bounded: real-time reports stay in their ring (full: dropped
+ * and counted), asynchronous sends up to 4096 requests or 16 MiB (past it: -EAGAIN,
+ * counted). What a restart costs is
  * the daemon's own: the aggregation of every session's interrupted period (the
  * summary its stop would have sent) is lost with the daemon that held it, and a
  * restored session starts a new period.
@@ -37,10 +41,15 @@ typedef struct mxr_client mxr_client;
 typedef struct mxr_payload mxr_payload;
 
 /* Errors of the library's own, besides the errno values of the system calls it makes
- * (-ECONNREFUSED or -ENOENT from mxr_client_open: nobody listens on the socket):
+ * (from mxr_client_open: -ECONNREFUSED or -ENOENT, nobody listens on the socket;
+ * -EACCES, this user may not use it, not being in the daemon's group):
  *   -EINVAL     an argument is wrong (NULL where something is needed, a key that is
- *               no text, JSON that does not parse), or the daemon refused the request
- *               as one it cannot take;
+ *               no text, JSON that does not parse, a payload nested deeper than the
+ *               daemon reads: 62 levels, the payload and its innermost values counted),
+ *               or the daemon refused the request as one it cannot take; a request
+ *               the daemon would refuse is never sent;
+ *   -ENAMETOOLONG mxr_client_open(): the socket path is longer than a Unix socket
+ *               address holds (107 bytes);
  *   -EMFILE     mxr_session_create(): the daemon holds as many sessions as it takes
  *               (4096 a connection, 16384 in all); none was made;
  *   -E2BIG      mxr_send(): more reporter IDs than one message may name (4096);
@@ -54,8 +63,12 @@ typedef struct mxr_payload mxr_payload;
  *   -EPROTO     a reply of the wrong shape;
  *   -EPERM      mxr_send(): reporting is switched off on this host (the daemon's
  *               refusal), nothing was sent;
- *   -EAGAIN     mxr_send_rt(): the ring is full; the report was dropped and counted;
- *   -EMSGSIZE   mxr_send_rt(): the report does not fit in a ring slot. */
+ *   -EAGAIN     mxr_send_rt(): the ring is full; mxr_send_async(): asynchronous sends
+ *               already hold all they may; the report was dropped and counted;
+ *   -EMSGSIZE   mxr_send_rt(): the report does not fit in a ring slot; any request:
+ *               larger than the daemon reads (1 MiB encoded), never sent;
+ *   -EDEADLK    a synchronous call from the library's own thread (a callback of
+ *               mxr_send_async()), where its reply could never come. */
 
 /* Opens a client on `socket_path`, or, for NULL, on the daemon's socket:
  * $MXREPORTING_ROOT/run/harmonia/reporting.sock ($MXREPORTING_ROOT defaults to /).
@@ -103,7 +116,10 @@ int mxr_send(mxr_client *c, const mxr_payload *p, uint32_t category, uint16_t ty
 
 /* The same without waiting: `done`, when given, is called once with what mxr_send()
  * would have returned, on the library's thread (never call a synchronous function of
- * the same client from it). Returns 0 once the report is on its way. */
+ * the same client from it). Returns 0 once the report is on its way; -EAGAIN, with
+ * `done` never called, when asynchronous sends already hold 4096 requests or 16 MiB
+ * (mxr_client_get_async_dropped() counts them), -EMSGSIZE or -EINVAL when the daemon
+ * would refuse it. */
 typedef void (*mxr_send_done)(int result, void *userdata);
 int mxr_send_async(mxr_client *c, const mxr_payload *p, uint32_t category, uint16_t type,
                    const int64_t *reporter_ids, size_t n_reporter_ids, mxr_send_done done, void *userdata);
@@ -112,9 +128,10 @@ int mxr_send_async(mxr_client *c, const mxr_payload *p, uint32_t category, uint1
    write(2) to an eventfd. The report is copied into a ring made at mxr_client_open
    and sent by the library's own thread. -EAGAIN: the ring is full (counted and
    dropped); -EMSGSIZE: larger than a ring slot. */
+typedef enum mxr_field_kind { MXR_INT, MXR_DOUBLE, MXR_STRING, MXR_BOOL } mxr_field_kind;
 typedef struct mxr_field {
     const char *key;
-    enum { MXR_INT, MXR_DOUBLE, MXR_STRING, MXR_BOOL } kind;
+    mxr_field_kind kind;
     union {
         int64_t i;
         double d;
@@ -122,7 +139,8 @@ typedef struct mxr_field {
         int b;
     } value;
 } mxr_field;
-/* A reporter ID of 0 sends without an ID list, as mxr_send() with NULL does. The
+/* A reporter ID of 0 sends without an ID list, as mxr_send() with NULL does (0 names
+ * no session anywhere in the protocol): to every started session, or alone. The
  * ring holds MXR_RT_SLOTS reports of at most MXR_RT_SLOT_BYTES each, encoded: keys
  * and string values with a few bytes each beside them. What the daemon answers is
  * counted, not reported: see mxr_client_get_rt_counts(). */
@@ -133,6 +151,8 @@ int mxr_send_rt(mxr_client *c, int64_t reporter_id, uint32_t category, uint16_t 
 /* Real-time reports so far: sent (taken by the daemon), dropped (ring full), failed
  * (refused or lost). Any pointer may be NULL. */
 int mxr_client_get_rt_counts(mxr_client *c, uint64_t *ret_sent, uint64_t *ret_dropped, uint64_t *ret_failed);
+/* Asynchronous sends refused with -EAGAIN so far. */
+int mxr_client_get_async_dropped(mxr_client *c, uint64_t *ret_dropped);
 
 /* Questions to the daemon, answered as it sees every client's sessions. */
 /* The service type of the session of that ID (65535 when there is none). */

@@ -2,8 +2,13 @@
 // whose comments say what each call does. Header-only: it is compiled into the caller
 // and reaches the library through its C ABI alone. Calls return what the C functions
 // return: 0 or more on success, a negative errno (mxr::errorText says what it means).
+// It needs C++17 or later.
 #ifndef MXREPORTING_MXREPORTING_HPP
 #define MXREPORTING_MXREPORTING_HPP
+
+#if __cplusplus < 201703L
+#error "<mxreporting/mxreporting.hpp> needs C++17 or later (-std=c++17); C++ before it can use <mxreporting/mxreporting.h>"
+#endif
 
 #include <chrono>
 #include <cstdint>
@@ -14,6 +19,7 @@
 #include <new>
 #include <optional>
 #include <string>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -34,8 +40,16 @@ public:
     Payload& operator=(Payload&&) noexcept = default;
 
     // Each returns what the C function does; a key added again replaces its value.
-    int add(const char* key, std::int64_t value) { return mxr_payload_add_int(get(), key, value); }
-    int add(const char* key, int value) { return mxr_payload_add_int(get(), key, value); }
+    // Any integer type, unsigned ones beyond INT64_MAX included.
+    template <class Integer,
+              std::enable_if_t<std::is_integral_v<Integer> && !std::is_same_v<Integer, bool>, int> = 0>
+    int add(const char* key, Integer value)
+    {
+        if constexpr (std::is_unsigned_v<Integer>)
+            if (static_cast<std::uint64_t>(value) > static_cast<std::uint64_t>(INT64_MAX))
+                return mxr_payload_add_json(get(), key, std::to_string(value).c_str());
+        return mxr_payload_add_int(get(), key, static_cast<std::int64_t>(value));
+    }
     int add(const char* key, double value) { return mxr_payload_add_double(get(), key, value); }
     int add(const char* key, const char* value) { return mxr_payload_add_string(get(), key, value); }
     int add(const char* key, const std::string& value) { return mxr_payload_add_string(get(), key, value.c_str()); }

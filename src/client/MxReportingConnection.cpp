@@ -21,6 +21,21 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
+// Levels of containers, the value's own included: a number is 1, [1] is 2.
+std::size_t nestingOf(const Value& value)
+{
+    std::size_t deepest = 0;
+    if (const Array* items = value.asArray())
+        for (const auto& item : *items)
+            deepest = std::max(deepest, nestingOf(item));
+    else if (const Dictionary* entries = value.asDictionary())
+        for (const auto& [key, item] : *entries)
+            deepest = std::max(deepest, nestingOf(item));
+    else
+        return 1;
+    return deepest + 1;
+}
+
 // Where a synchronous call's reply is waited for.
 struct Reply {
     std::mutex mutex;
@@ -47,6 +62,7 @@ std::unique_ptr<MxReportingConnection> MxReportingConnection::open(const std::fi
         return nullptr;
     }
     connection->connected_ = true;
+    connection->connectedAt_ = Clock::now();
     connection->readMore();
     connection->watchRing();
     connection->thread_ = std::thread([raw = connection.get()] { raw->io_.run(); });
@@ -74,13 +90,41 @@ MxReportingConnection::~MxReportingConnection()
         thread_.join();
 }
 
-void MxReportingConnection::call(std::string_view method, Array params, Completion done,
-                                 MxReportingSessionEffect effect)
+// What the daemon's reader closes a connection on: a request larger than it reads, or
+// nested deeper than it decodes (the request's array and its parameters' count).
+int MxReportingConnection::refusal(std::string_view method, const Array& params, std::size_t& bytes)
 {
-    Request request{++requests_, std::string(method), std::move(params), std::move(done), Clock::now() + timeout()};
-    asio::post(io_, [this, request = std::move(request), effect = std::move(effect)]() mutable {
-        submit(std::move(request), effect);
-    });
+    bytes = encodedMsgpackBytes(Value(Array{0, std::uint32_t{0xFFFFFFFF}, std::string(method), params}));
+    if (bytes > kMsgpackRpcMaximumMessageBytes)
+        return -EMSGSIZE;
+    std::size_t depth = 0;
+    for (const auto& parameter : params)
+        depth = std::max(depth, nestingOf(parameter));
+    return depth + 2 > kMsgpackMaximumDepth ? -EINVAL : 0;
+}
+
+int MxReportingConnection::callAsync(std::string_view method, Array params, Completion done)
+{
+    std::size_t bytes = 0;
+    if (int refused = refusal(method, params, bytes))
+        return refused;
+    bool room = asyncRequests_.fetch_add(1) < kAsyncRequests;
+    room = asyncBytes_.fetch_add(bytes) + bytes <= kAsyncBytes && room;
+    if (!room) {
+        asyncRequests_.fetch_sub(1);
+        asyncBytes_.fetch_sub(bytes);
+        ++asyncDropped_;
+        return -EAGAIN;
+    }
+    Completion counted = [this, bytes, done = std::move(done)](int error, const Value& result) {
+        asyncRequests_.fetch_sub(1);
+        asyncBytes_.fetch_sub(bytes);
+        if (done)
+            done(error, result);
+    };
+    Request request{++requests_, std::string(method), std::move(params), std::move(counted), Clock::now() + timeout()};
+    asio::post(io_, [this, request = std::move(request)]() mutable { submit(std::move(request), {}); });
+    return 0;
 }
 
 int MxReportingConnection::callAndWait(std::string_view method, Array params, Value& result,
@@ -99,6 +143,9 @@ int MxReportingConnection::wait(Request request, Value& result, const MxReportin
 {
     if (std::this_thread::get_id() == thread_.get_id())
         return -EDEADLK;
+    std::size_t bytes = 0;
+    if (int refused = refusal(request.method, request.params, bytes))
+        return refused;
     auto reply = std::make_shared<Reply>();
     std::uint64_t number = ++requests_;
     request.number = number;
@@ -142,7 +189,15 @@ void MxReportingConnection::submit(Request request, const MxReportingSessionEffe
             request.done(-ENOTCONN, Value());
         return;
     }
-    registry_.apply(effect);
+    // A create the daemon refuses made nothing to restore.
+    if (std::uint64_t created = registry_.apply(effect))
+        request.done = [this, reporterID = effect.reporterID, created,
+                        done = std::move(request.done)](int error, const Value& result) {
+            if (error == -EMFILE || error == -EINVAL)
+                registry_.forget(reporterID, created);
+            if (done)
+                done(error, result);
+        };
     if (connected_)
         send(std::move(request));
     else
@@ -188,6 +243,9 @@ void MxReportingConnection::readMore()
                                     if (status == MsgpackRpcDecoder::Status::NeedMore)
                                         break;
                                     if (status == MsgpackRpcDecoder::Status::Bad) {
+                                        // What was in flight may have been answered in
+                                        // what could not be read: not sent again.
+                                        failInFlight(-EPROTO);
                                         lose("unreadable reply: " + reason);
                                         return;
                                     }
@@ -203,6 +261,7 @@ void MxReportingConnection::deliver(const Value& message)
     auto response = parseRpcResponse(message, reason);
     if (!response)
         return;
+    answered_ = true;
     // A second reply to one request (the daemon answers one query twice) finds none.
     auto found = inFlight_.find(response->msgid);
     if (found == inFlight_.end())
@@ -295,8 +354,18 @@ void MxReportingConnection::lose(const std::string& why)
     inFlight_.clear();
     std::sort(again.begin(), again.end(), [](const Request& a, const Request& b) { return a.number < b.number; });
     unsent_.insert(unsent_.begin(), std::make_move_iterator(again.begin()), std::make_move_iterator(again.end()));
-    log_(LOG_WARNING, "connection to " + socketPath_.string() + " lost (" + why + "): reconnecting");
-    backoff_ = kFirstReconnect;
+    // A connection that breaks as soon as it is made, before any reply (a peer that
+    // answers garbage or closes at once), is retried ever more slowly, and said once.
+    if (answered_ || Clock::now() - connectedAt_ >= kHealthy) {
+        backoff_ = kFirstReconnect;
+        quietReconnects_ = false;
+        log_(LOG_WARNING, "connection to " + socketPath_.string() + " lost (" + why + "): reconnecting");
+    } else if (!quietReconnects_) {
+        quietReconnects_ = true;
+        log_(LOG_WARNING,
+             "connection to " + socketPath_.string() + " broke at once (" + why + "): reconnecting at most every " +
+                 std::to_string(kLongestReconnect.count() / 1000) + " s, without a line each time");
+    }
     reconnectLater();
 }
 
@@ -323,8 +392,11 @@ void MxReportingConnection::reconnect()
                                   return;
                               }
                               connected_ = true;
+                              connectedAt_ = Clock::now();
+                              answered_ = false;
                               restore();
                               readMore();
+                              resumeRing();
                           });
 }
 
@@ -342,9 +414,10 @@ void MxReportingConnection::restore()
         unsent_.pop_front();
         send(std::move(request));
     }
-    log_(LOG_NOTICE,
-         "reconnected to " + socketPath_.string() + ": " + std::to_string(registry_.size()) + " sessions restored, " +
-             std::to_string(resent) + " requests sent again");
+    if (!quietReconnects_)
+        log_(LOG_NOTICE,
+             "reconnected to " + socketPath_.string() + ": " + std::to_string(registry_.size()) +
+                 " sessions restored, " + std::to_string(resent) + " requests sent again");
 }
 
 void MxReportingConnection::failExpired()
@@ -364,17 +437,49 @@ void MxReportingConnection::failExpired()
             request.done(-ENOTCONN, Value());
 }
 
+void MxReportingConnection::failInFlight(int error)
+{
+    std::vector<Completion> failed;
+    for (auto& [msgid, request] : inFlight_)
+        if (!request.held && request.done)
+            failed.push_back(std::move(request.done));
+    std::erase_if(inFlight_, [](const auto& entry) { return !entry.second.held; });
+    for (auto& done : failed)
+        done(error, Value());
+}
+
+// Reports are taken from the ring only while there is a connection to send them on,
+// and only so many at a time: the rest wait in the ring, which drops when full.
+std::size_t MxReportingConnection::realtimeRoom() const
+{
+    return connected_ ? kRealtimeOutstanding - std::min(kRealtimeOutstanding, realtimeOutstanding_) : 0;
+}
+
 void MxReportingConnection::watchRing()
 {
-    do
-        ring_->drain([this](const MxReportingRealtimeRing::Report& report) { takeRealtime(report); });
-    while (!ring_->prepareToWait());
+    for (;;) {
+        ring_->drain(realtimeRoom(), [this](const MxReportingRealtimeRing::Report& report) { takeRealtime(report); });
+        if (realtimeRoom() == 0) {
+            ringPaused_ = true; // resumeRing() takes it up again
+            return;
+        }
+        if (ring_->prepareToWait())
+            break;
+    }
     wake_.async_wait(asio::posix::stream_descriptor::wait_read, [this](const std::error_code& error) {
         if (error || closing_)
             return;
         ring_->acknowledgeWake();
         watchRing();
     });
+}
+
+void MxReportingConnection::resumeRing()
+{
+    if (!ringPaused_ || closing_ || realtimeRoom() == 0)
+        return;
+    ringPaused_ = false;
+    watchRing();
 }
 
 void MxReportingConnection::takeRealtime(const MxReportingRealtimeRing::Report& report)
@@ -388,13 +493,16 @@ void MxReportingConnection::takeRealtime(const MxReportingRealtimeRing::Report& 
         return;
     }
     Value ids = report.reporterID != 0 ? Value(Array{report.reporterID}) : Value();
+    ++realtimeOutstanding_;
     Request request{++requests_, std::string(method::kSendMessage),
                     Array{std::move(*payload), report.category, report.type, std::move(ids)},
                     [this](int error, const Value& result) {
+                        --realtimeOutstanding_;
                         if (error == 0 && result.isNil())
                             ++realtimeSent_;
                         else
                             ++realtimeFailed_;
+                        resumeRing();
                     },
                     Clock::now() + timeout()};
     submit(std::move(request), {});

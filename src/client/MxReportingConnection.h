@@ -4,8 +4,11 @@
 // (an Asio context). When the connection breaks it is made again, with backoff, and
 // the client's sessions are restored (MxReportingSessionRegistry) before anything
 // else is sent; requests that were in flight are sent again, or fail with -ENOTCONN
-// once their time is up. Real-time reports come in through a ring
-// (MxReportingRealtimeRing) that the thread drains.
+// once their time is up.
+// A request the daemon would refuse by closing the connection (too large, too deep)
+// is refused here and never sent. Real-time reports come in through a ring
+// (MxReportingRealtimeRing) that the thread drains while connected, a bounded number
+// at a time: while the daemon is away they wait in the ring, and a full ring drops.
 // Owned by the C API's client; every public call is safe from any thread.
 
 #include <atomic>
@@ -46,6 +49,14 @@ public:
     static constexpr std::chrono::milliseconds kFirstReconnect{50};
     static constexpr std::chrono::milliseconds kLongestReconnect{5000};
     static constexpr std::chrono::microseconds kDefaultTimeout = std::chrono::seconds(10);
+    // A connection that lasted less than this, and answered nothing, broke at once: the
+    // backoff goes on growing.
+    static constexpr std::chrono::seconds kHealthy{2};
+    // Real-time reports taken from the ring and not yet answered.
+    static constexpr std::size_t kRealtimeOutstanding = 256;
+    // What asynchronous sends may hold, waiting for a connection or a reply.
+    static constexpr std::size_t kAsyncRequests = 4096;
+    static constexpr std::size_t kAsyncBytes = std::size_t{16} << 20;
 
     // Connects, or returns nothing with the errno of the failure.
     static std::unique_ptr<MxReportingConnection> open(const std::filesystem::path& socket, Log log, int& error);
@@ -58,8 +69,10 @@ public:
     void setTimeout(std::chrono::microseconds timeout) { timeout_.store(timeout.count()); }
 
     // Sends a request; `done`, when given, runs once on the connection's thread.
-    // `effect` is what the request does to the session it names.
-    void call(std::string_view method, Array params, Completion done, MxReportingSessionEffect effect = {});
+    // -EMSGSIZE or -EINVAL, with `done` never run, for a request the daemon would
+    // refuse (larger than it reads, nested deeper); -EAGAIN, counted, when the
+    // asynchronous sends already hold all they may.
+    int callAsync(std::string_view method, Array params, Completion done);
     // The same, waiting for the reply up to the timeout. -EDEADLK from the
     // connection's own thread, where the reply could never come.
     int callAndWait(std::string_view method, Array params, Value& result, const MxReportingSessionEffect& effect = {});
@@ -79,6 +92,7 @@ public:
     std::uint64_t realtimeSent() const { return realtimeSent_.load(); }
     std::uint64_t realtimeFailed() const { return realtimeFailed_.load(); }
     std::uint64_t realtimeDropped() const { return ring_->dropped(); }
+    std::uint64_t asyncDropped() const { return asyncDropped_.load(); }
 
 private:
     struct Request {
@@ -98,9 +112,12 @@ private:
     MxReportingConnection(std::filesystem::path socket, Log log, std::unique_ptr<MxReportingRealtimeRing> ring);
 
     std::chrono::microseconds timeout() const { return std::chrono::microseconds(timeout_.load()); }
+    // 0, or why the daemon would close the connection on this request.
+    static int refusal(std::string_view method, const Array& params, std::size_t& bytes);
     // Connection thread only, below.
     int wait(Request request, Value& result, const MxReportingSessionEffect& effect);
     void submit(Request request, const MxReportingSessionEffect& effect);
+    void failInFlight(int error);
     void cancel(std::uint64_t number);
     void send(Request request);
     void readMore();
@@ -115,6 +132,8 @@ private:
     void restore();
     void failExpired();
     void watchRing();
+    void resumeRing();
+    std::size_t realtimeRoom() const;
     void takeRealtime(const MxReportingRealtimeRing::Report& report);
     void close();
 
@@ -125,6 +144,9 @@ private:
     std::atomic<std::uint64_t> requests_{0};
     std::atomic<std::uint64_t> realtimeSent_{0};
     std::atomic<std::uint64_t> realtimeFailed_{0};
+    std::atomic<std::size_t> asyncRequests_{0};
+    std::atomic<std::size_t> asyncBytes_{0};
+    std::atomic<std::uint64_t> asyncDropped_{0};
 
     asio::io_context io_;
     asio::executor_work_guard<asio::io_context::executor_type> keepRunning_;
@@ -141,6 +163,11 @@ private:
     std::uint32_t nextMsgid_ = 1;
     std::uint64_t generation_ = 0; // of the socket: one more for each connection lost
     std::chrono::milliseconds backoff_ = kFirstReconnect;
+    std::chrono::steady_clock::time_point connectedAt_;
+    bool answered_ = false;        // a reply came on this connection
+    bool quietReconnects_ = false; // the breaks at once are said once
+    std::size_t realtimeOutstanding_ = 0;
+    bool ringPaused_ = false;
     bool connected_ = false;
     bool writing_ = false;
     bool closing_ = false;

@@ -88,20 +88,20 @@ int encodeFields(const mxr_field* fields, std::size_t count, std::uint8_t* out, 
     bool fits = encoder.map(count);
     for (std::size_t i = 0; i < count && fits; ++i) {
         const mxr_field& field = fields[i];
-        if (!field.key || (field.kind == mxr_field::MXR_STRING && !field.value.s))
+        if (!field.key || (field.kind == MXR_STRING && !field.value.s))
             return -EINVAL;
         fits = encoder.text(field.key);
         switch (field.kind) {
-        case mxr_field::MXR_INT:
+        case MXR_INT:
             fits = fits && encoder.integer(field.value.i);
             break;
-        case mxr_field::MXR_DOUBLE:
+        case MXR_DOUBLE:
             fits = fits && encoder.real(field.value.d);
             break;
-        case mxr_field::MXR_STRING:
+        case MXR_STRING:
             fits = fits && encoder.text(field.value.s);
             break;
-        case mxr_field::MXR_BOOL:
+        case MXR_BOOL:
             fits = fits && encoder.boolean(field.value.b != 0);
             break;
         default:

@@ -41,12 +41,13 @@ public:
     int push(std::int64_t reporterID, std::uint32_t category, std::uint16_t type, const mxr_field* fields,
              std::size_t count);
 
-    // The consumer's side. `take` is called for each report in the ring, in the order
-    // they were claimed; a report's payload is valid only during its call.
+    // The consumer's side. `take` is called for each report in the ring, at most
+    // `most` of them, in the order they were claimed; a report's payload is valid only
+    // during its call.
     template <class Take>
-    void drain(Take&& take)
+    void drain(std::size_t most, Take&& take)
     {
-        for (;;) {
+        for (std::size_t taken = 0; taken < most; ++taken) {
             Slot& slot = slots_[consumed_ % kSlots];
             if (slot.sequence.load(std::memory_order_acquire) != consumed_ + 1)
                 return;

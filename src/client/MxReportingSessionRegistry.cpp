@@ -6,16 +6,16 @@
 
 namespace mx {
 
-void MxReportingSessionRegistry::apply(const MxReportingSessionEffect& effect)
+std::uint64_t MxReportingSessionRegistry::apply(const MxReportingSessionEffect& effect)
 {
     using Kind = MxReportingSessionEffect::Kind;
     if (effect.kind == Kind::Create) {
         sessions_[effect.reporterID] = Session{++creations_, std::nullopt, {}, false};
-        return;
+        return creations_;
     }
     auto found = sessions_.find(effect.reporterID);
     if (found == sessions_.end() || effect.reporterID == 0)
-        return;
+        return 0;
     Session& session = found->second;
     switch (effect.kind) {
     case Kind::SetServiceType:
@@ -37,6 +37,14 @@ void MxReportingSessionRegistry::apply(const MxReportingSessionEffect& effect)
     case Kind::Create:
         break;
     }
+    return 0;
+}
+
+void MxReportingSessionRegistry::forget(std::int64_t reporterID, std::uint64_t created)
+{
+    auto found = sessions_.find(reporterID);
+    if (found != sessions_.end() && found->second.created == created)
+        sessions_.erase(found);
 }
 
 std::vector<MxReportingSessionRegistry::Request> MxReportingSessionRegistry::restoration() const

@@ -33,7 +33,11 @@ public:
         Array params;
     };
 
-    void apply(const MxReportingSessionEffect& effect);
+    // The create's number when `effect` made a session, else 0.
+    std::uint64_t apply(const MxReportingSessionEffect& effect);
+    // A create the daemon refused: the session it made here is not restored, unless a
+    // later create made it again.
+    void forget(std::int64_t reporterID, std::uint64_t created);
     // The requests that make the sessions again, in order, on a connection that has none.
     std::vector<Request> restoration() const;
     std::size_t size() const { return sessions_.size(); }

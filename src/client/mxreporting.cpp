@@ -12,6 +12,7 @@
 #include <mutex>
 #include <new>
 #include <string>
+#include <sys/un.h>
 #include <syslog.h>
 
 #include <nlohmann/json.hpp>
@@ -163,6 +164,8 @@ int mxr_client_open(mxr_client** ret, const char* socket_path)
     return guarded([&] {
         std::filesystem::path socket =
             socket_path ? std::filesystem::path(socket_path) : MxReportingPath(kServiceSocketPath);
+        if (socket.native().size() >= sizeof(sockaddr_un::sun_path))
+            return -ENAMETOOLONG;
         int error = 0;
         auto connection = MxReportingConnection::open(socket, writeLog, error);
         if (!connection)
@@ -200,9 +203,11 @@ const char* mxr_strerror(int error)
     case EPERM:
         return "Reporting is switched off on this host: nothing was sent";
     case EAGAIN:
-        return "The real-time ring is full: the report was dropped";
+        return "The real-time ring, or what asynchronous sends may hold, is full: the report was dropped";
     case EMSGSIZE:
-        return "The report does not fit in a real-time ring slot";
+        return "The report is larger than a real-time ring slot, or than a request the daemon reads (1 MiB)";
+    case ENAMETOOLONG:
+        return "The socket path is longer than a Unix socket address holds";
     case EDEADLK:
         return "A synchronous call from the library's own thread (a callback), where its reply cannot come";
     case ECONNREFUSED:
@@ -317,10 +322,9 @@ int mxr_send_async(mxr_client* c, const mxr_payload* p, uint32_t category, uint1
             completion = [done, userdata](int error, const Value& result) {
                 done(sendOutcome(error, result), userdata);
             };
-        c->connection->call(method::kSendMessage,
-                            Array{p->dictionary, category, type, reporterIDs(reporter_ids, n_reporter_ids)},
-                            std::move(completion));
-        return 0;
+        return c->connection->callAsync(method::kSendMessage,
+                                        Array{p->dictionary, category, type, reporterIDs(reporter_ids, n_reporter_ids)},
+                                        std::move(completion));
     });
 }
 
@@ -342,6 +346,14 @@ int mxr_client_get_rt_counts(mxr_client* c, uint64_t* ret_sent, uint64_t* ret_dr
         *ret_dropped = c->connection->realtimeDropped();
     if (ret_failed)
         *ret_failed = c->connection->realtimeFailed();
+    return 0;
+}
+
+int mxr_client_get_async_dropped(mxr_client* c, uint64_t* ret_dropped)
+{
+    if (!c || !ret_dropped)
+        return -EINVAL;
+    *ret_dropped = c->connection->asyncDropped();
     return 0;
 }
 

@@ -151,7 +151,7 @@ TEST(DaemonStoreSizeTest, AStoreStaysWithinItsBoundOnDiskLogIncluded)
     ASSERT_EQ(client->createSession(5), 0);
     Dictionary report{{"filler", std::string(500, 'f')}};
     for (int i = 0; i < 10000; ++i)
-        client->sendAsync(payloadOf(report), 3, 1, std::vector<std::int64_t>{5}, nullptr);
+        sendAsyncPaced(*client, payloadOf(report), 3, 1, std::vector<std::int64_t>{5}, nullptr);
     ASSERT_EQ(client->send(payloadOf(report), 3, 1, {5}), 0);
     ASSERT_TRUE(daemon.waitForLog("tally.db: pruned"));
     EXPECT_TRUE(waitUntil([&] { return onDisk({"", "-wal", "-shm"}) <= 1048576; }));

@@ -183,8 +183,8 @@ TEST_F(DaemonIntegrationTest, ReportsReachEveryStoreAndSigtermUnderLoadLosesNoth
     std::atomic<bool> sending{true};
     std::thread load([&] {
         for (int i = 0; sending; ++i) {
-            client->sendAsync(payloadOf(Dictionary{{"seq", i}}), 3, 2, std::vector<std::int64_t>{3},
-                              [&](int result) { acknowledged += result == 0 ? 1 : 0; });
+            sendAsyncPaced(*client, payloadOf(Dictionary{{"seq", i}}), 3, 2, std::vector<std::int64_t>{3},
+                           [&](int result) { acknowledged += result == 0 ? 1 : 0; });
             std::vector<std::int64_t> reporters;
             if (i % 64 == 63)
                 client->reporters(reporters); // some 64 requests in flight
@@ -252,10 +252,11 @@ TEST(DaemonStoreFailureTest, AFullDiskHoldsReportsUntilThereIsRoomAndLosesNone)
     std::atomic<int> acknowledged{0};
     auto report = payloadOf(Dictionary{{"filler", std::string(100, 'f')}});
     for (int i = 0; i < kReports; ++i)
-        client->sendAsync(report, 3, 1, std::vector<std::int64_t>{3}, [&](int result) {
-            if (result == 0)
-                ++acknowledged;
-        });
+        if (sendAsyncPaced(*client, report, 3, 1, std::vector<std::int64_t>{3}, [&](int result) {
+                if (result == 0)
+                    ++acknowledged;
+            }) == -EAGAIN)
+            break; // held: the library takes no more
     ASSERT_TRUE(daemon.waitForLog("the clients that sent them wait until it can write again"));
 
     // The client whose reports wait is answered no more once the rows it sent fill
@@ -386,9 +387,9 @@ TEST(DaemonStoreLimitTest, StoresAndSummariesStayWithinTheirLimitsUnexportedRows
     }
     Dictionary report{{"filler", std::string(200, 'f')}};
     for (int i = 0; i < 3000; ++i)
-        client->sendAsync(payloadOf(report), 1, 0, std::vector<std::int64_t>{4}, nullptr); // to analytics
+        sendAsyncPaced(*client, payloadOf(report), 1, 0, std::vector<std::int64_t>{4}, nullptr); // to analytics
     for (int i = 0; i < 3000; ++i)
-        client->sendAsync(payloadOf(report), 1, 0, std::nullopt, nullptr); // alone, to the spool
+        sendAsyncPaced(*client, payloadOf(report), 1, 0, std::nullopt, nullptr); // alone, to the spool
     ASSERT_EQ(client->send(payloadOf(Dictionary{{"last", 1}}), 1, 0, std::nullopt), 0);
     EXPECT_TRUE(daemon.waitForLog("tally.db: pruned"));
     EXPECT_TRUE(daemon.waitForLog("had not been exported to every collector"));
@@ -700,8 +701,8 @@ TEST_F(DaemonIntegrationTest, AKilledDaemonLosesNoAnsweredRowAndStartsCleanly)
     // Keep the daemon busy while it dies.
     std::atomic<int> answered{0};
     for (int i = 0; i < 200; ++i)
-        client->sendAsync(payloadOf(Dictionary{{"late", i}}), 3, 1, std::vector<std::int64_t>{3},
-                          [&](int result) { answered += result == 0 ? 1 : 0; });
+        sendAsyncPaced(*client, payloadOf(Dictionary{{"late", i}}), 3, 1, std::vector<std::int64_t>{3},
+                       [&](int result) { answered += result == 0 ? 1 : 0; });
     ASSERT_TRUE(waitUntil([&] { return answered > 100; }));
     daemon.signal(SIGKILL);
     EXPECT_EQ(daemon.waitForExit(), 128 + SIGKILL);

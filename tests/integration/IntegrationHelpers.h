@@ -5,6 +5,7 @@
 // take however a client behaves.
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <filesystem>
 #include <functional>
@@ -12,6 +13,7 @@
 #include <string>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <thread>
 #include <unistd.h>
 #include <utility>
 
@@ -143,6 +145,21 @@ inline mxr::Payload payloadOf(const Dictionary& dictionary)
 }
 
 // The daemon's answer to reporterID:valid:, as the protocol words it.
+// An asynchronous send that waits while the library holds all the asynchronous sends
+// it may, as a program that sends faster than the daemon answers would: -EAGAIN when
+// no room came within 2 s (the daemon holds its replies).
+inline int sendAsyncPaced(mxr::Client& client, const mxr::Payload& payload, std::uint32_t category, std::uint16_t type,
+                          const std::optional<std::vector<std::int64_t>>& reporterIDs, std::function<void(int)> done)
+{
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(2);
+    for (;;) {
+        int result = client.sendAsync(payload, category, type, reporterIDs, done);
+        if (result != -EAGAIN || std::chrono::steady_clock::now() > deadline)
+            return result;
+        std::this_thread::yield();
+    }
+}
+
 inline Dictionary validity(mxr::Client& client, std::int64_t reporterID)
 {
     std::uint16_t type = 0;

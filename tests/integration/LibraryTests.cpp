@@ -9,6 +9,10 @@
 #include <set>
 #include <thread>
 
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
@@ -127,9 +131,127 @@ TEST(LibraryErrorTest, EachFailureHasItsOwnCodeAndText)
     EXPECT_EQ(client->createSession(3), 0) << "sessions are still made while reporting is off";
 
     std::set<std::string> texts;
-    for (int error : {-EINVAL, -ENOMEM, -ETIMEDOUT, -ENOTCONN, -EPROTO, -EPERM, -EAGAIN, -EMSGSIZE})
+    const int codes[] = {-EINVAL,   -ENOMEM,  -ETIMEDOUT,    -ENOTCONN, -EPROTO, -EPERM, -EAGAIN,
+                         -EMSGSIZE, -EDEADLK, -ENAMETOOLONG, -EMFILE,   -E2BIG,  -ENOSPC};
+    for (int error : codes)
         texts.insert(mxr_strerror(error));
-    EXPECT_EQ(texts.size(), 8u) << "every code the library returns says what it means";
+    EXPECT_EQ(texts.size(), std::size(codes)) << "every code the library returns says what it means";
+}
+
+// Requests the daemon would close the connection on are refused before they are sent,
+// and the connection they would have cost serves on.
+TEST(LibraryErrorTest, WhatTheDaemonWouldRefuseIsNeverSent)
+{
+    LibraryLog log;
+    DaemonProcess daemon;
+    daemon.start();
+    auto client = connectTo(daemon);
+    std::string nested = "1";
+    for (int depth = 1; depth < 61; ++depth)
+        nested = "[" + nested + "]";
+    mxr::Payload deepest;
+    ASSERT_EQ(deepest.addJson("n", nested.c_str()), 0);
+    EXPECT_EQ(client->send(deepest, 3, 1, std::nullopt), 0) << "as deep as the daemon reads";
+    mxr::Payload deeper;
+    ASSERT_EQ(deeper.addJson("n", ("[" + nested + "]").c_str()), 0);
+    EXPECT_EQ(client->send(deeper, 3, 1, std::nullopt), -EINVAL);
+    mxr::Payload large;
+    ASSERT_EQ(large.add("text", std::string(std::size_t{1} << 20, 'x')), 0);
+    EXPECT_EQ(client->send(large, 3, 1, std::nullopt), -EMSGSIZE);
+    EXPECT_EQ(client->sendAsync(large, 3, 1, std::nullopt, [](int) { ADD_FAILURE() << "never called"; }), -EMSGSIZE);
+    EXPECT_EQ(client->send(payloadOf(Dictionary{{"after", 1}}), 3, 1, std::nullopt), 0);
+    EXPECT_FALSE(log.contains("lost")) << "the connection never broke";
+
+    mxr_client* far = nullptr;
+    EXPECT_EQ(mxr_client_open(&far, ("/" + std::string(200, 'x')).c_str()), -ENAMETOOLONG);
+    mxr_field field{"rate", MXR_INT, {48000}}; // the kinds are at file scope, in C++ as in C
+    EXPECT_EQ(client->sendRealtime(0, 3, 1, &field, 1), 0);
+}
+
+// While the daemon is away, what waits is the ring and a bounded number of
+// asynchronous sends; past them reports are dropped and counted, and what waited goes
+// once the daemon is back.
+TEST(LibraryRestartTest, WhatWaitsForAnAbsentDaemonIsBounded)
+{
+    LibraryLog log;
+    DaemonProcess daemon;
+    daemon.start();
+    auto client = connectTo(daemon);
+    daemon.signal(SIGKILL);
+    ASSERT_EQ(daemon.waitForExit(), 128 + SIGKILL);
+    ASSERT_TRUE(waitUntil([&] { return log.contains("reconnecting"); }));
+
+    mxr_field field{"rate", MXR_INT, {48000}};
+    int full = 0;
+    for (int i = 0; i < 2 * MXR_RT_SLOTS; ++i)
+        full += client->sendRealtime(0, 3, 1, &field, 1) == -EAGAIN;
+    EXPECT_EQ(full, MXR_RT_SLOTS) << "the ring holds what it holds, and no more is taken out of it";
+    std::atomic<int> answered{0};
+    int refused = 0;
+    auto payload = payloadOf(Dictionary{{"waiting", 1}});
+    for (int i = 0; i < 5000; ++i)
+        refused += client->sendAsync(payload, 3, 1, std::nullopt, [&](int) { ++answered; }) == -EAGAIN;
+    EXPECT_EQ(refused, 5000 - 4096);
+    std::uint64_t dropped = 0;
+    ASSERT_EQ(mxr_client_get_async_dropped(client->get(), &dropped), 0);
+    EXPECT_EQ(dropped, 5000u - 4096u);
+
+    daemon.start();
+    EXPECT_TRUE(waitUntil([&] {
+        std::uint64_t sent = 0;
+        mxr_client_get_rt_counts(client->get(), &sent, nullptr, nullptr);
+        return sent == MXR_RT_SLOTS && answered == 4096;
+    })) << "what waited went once the daemon was back: "
+        << answered << " answered";
+    std::uint64_t sent = 0, failed = 0;
+    mxr_client_get_rt_counts(client->get(), &sent, nullptr, &failed);
+    EXPECT_EQ(sent, MXR_RT_SLOTS) << failed << " failed";
+}
+
+// A peer that answers garbage: what was in flight fails with -EPROTO at once, and the
+// reconnections slow down rather than loop, said once.
+TEST(LibraryRestartTest, APeerThatAnswersGarbageFailsAtOnceAndIsRetriedEverMoreSlowly)
+{
+    LibraryLog log;
+    DaemonProcess daemon; // for its private root only
+    auto path = daemon.socketPath();
+    std::filesystem::create_directories(path.parent_path());
+    int listener = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    ASSERT_EQ(::bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(::listen(listener, 16), 0);
+    std::atomic<int> connections{0};
+    std::atomic<bool> serving{true};
+    std::thread peer([&] {
+        while (serving) {
+            int connection = ::accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+            if (connection < 0)
+                return;
+            ++connections;
+            char request[4096];
+            if (::read(connection, request, sizeof request) > 0) [[maybe_unused]]
+                auto written = ::write(connection, "\xc1\xc1\xc1", 3);
+            ::close(connection);
+        }
+    });
+
+    mxr_client* raw = nullptr;
+    ASSERT_EQ(mxr_client_open(&raw, path.c_str()), 0);
+    auto begun = std::chrono::steady_clock::now();
+    mxr::Payload payload;
+    EXPECT_EQ(mxr_send(raw, payload.get(), 3, 1, nullptr, 0), -EPROTO);
+    EXPECT_LT(std::chrono::steady_clock::now() - begun, std::chrono::seconds(5)) << "not at the timeout";
+    // 50 ms doubling: about six attempts in three seconds, not sixty.
+    std::this_thread::sleep_for(std::chrono::seconds(3));
+    EXPECT_LE(connections.load(), 8);
+    EXPECT_TRUE(log.contains("broke at once"));
+    mxr_client_close(raw);
+    serving = false;
+    ::shutdown(listener, SHUT_RDWR);
+    peer.join();
+    ::close(listener);
 }
 
 // Deliveries and what the throttle says it is done with, by user data.
