@@ -86,7 +86,15 @@ class Daemon:
                    DBUS_SYSTEM_BUS_ADDRESS="unix:path=" + self.path("run/no-system-bus")) | (env or {})
         env.pop("JOURNAL_STREAM", None)
         self.log_file = open(self.path("daemon.log"), "w")
+        self.command = ([binary], env)
         self.process = subprocess.Popen([binary], env=env, stderr=self.log_file, stdout=self.log_file)
+
+    def restart(self):
+        """Killed, and started anew on the same root."""
+        self.process.kill()
+        self.process.wait()
+        arguments, env = self.command
+        self.process = subprocess.Popen(arguments, env=env, stderr=self.log_file, stdout=self.log_file)
 
     def path(self, relative):
         return os.path.join(self.root, relative)
